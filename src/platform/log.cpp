@@ -1,0 +1,319 @@
+#include "platform/log.h"
+
+#include <sys/stat.h>
+#include <systemd/sd-journal.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <cinttypes>
+#include <cstdio>
+#include <cstdlib>
+#include <ctime>
+#include <mutex>
+
+namespace platform {
+
+namespace {
+
+bool stderrIsJournal();
+
+struct LogState {
+  std::mutex mutex;
+  LogSettings settings;
+  std::shared_ptr<const LogSink> sink;
+  bool useJournal = stderrIsJournal();
+};
+
+LogState& state() {
+  static LogState s;
+  return s;
+}
+
+std::atomic<int> gMinimum{static_cast<int>(LogLevel::Default)};
+std::atomic<bool> gPrivateData{false};
+
+// The journal convention: stderr is the journal when JOURNAL_STREAM names its device and inode.
+bool stderrIsJournal() {
+  const char* env = std::getenv("JOURNAL_STREAM");
+  if (!env) return false;
+  unsigned long long dev = 0, ino = 0;
+  if (std::sscanf(env, "%llu:%llu", &dev, &ino) != 2) return false;
+  struct stat st {};
+  if (fstat(STDERR_FILENO, &st) != 0) return false;
+  return st.st_dev == dev && st.st_ino == ino;
+}
+
+bool hasControlCharacters(const std::string& s) {
+  for (unsigned char c : s)
+    if (c < 0x20 || c == 0x7F) return true;
+  return false;
+}
+
+void appendNumber(std::string& out, const char* spec, const LogArg::Storage& arg) {
+  char buf[128];
+  std::string f(spec);
+  char conv = f.back();
+  // Re-emit with a length modifier that matches how the argument is held.
+  std::string base = f.substr(0, f.size() - 1);
+  while (!base.empty() && std::string_view("hljztL").find(base.back()) != std::string_view::npos) base.pop_back();
+  int n = 0;
+  if (conv == 'f' || conv == 'F' || conv == 'e' || conv == 'E' || conv == 'g' || conv == 'G') {
+    double d = 0;
+    if (auto p = std::get_if<double>(&arg)) d = *p;
+    else if (auto i = std::get_if<int64_t>(&arg)) d = static_cast<double>(*i);
+    else if (auto u = std::get_if<uint64_t>(&arg)) d = static_cast<double>(*u);
+    n = std::snprintf(buf, sizeof buf, (base + conv).c_str(), d);
+  } else if (conv == 'c') {
+    int c = '?';
+    if (auto i = std::get_if<int64_t>(&arg)) c = static_cast<int>(*i);
+    else if (auto u = std::get_if<uint64_t>(&arg)) c = static_cast<int>(*u);
+    n = std::snprintf(buf, sizeof buf, (base + 'c').c_str(), c);
+  } else {
+    bool isSigned = conv == 'd' || conv == 'i';
+    if (auto i = std::get_if<int64_t>(&arg)) {
+      if (isSigned) n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*i));
+      else n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*i));
+    } else if (auto u = std::get_if<uint64_t>(&arg)) {
+      if (isSigned) n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*u));
+      else n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*u));
+    } else if (auto d = std::get_if<double>(&arg)) {
+      n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*d));
+    } else if (auto p = std::get_if<LogArg::Pointer>(&arg)) {
+      n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(p->value));
+    } else {
+      out += "(null)";
+      return;
+    }
+  }
+  if (n > 0) out.append(buf, std::min<size_t>(static_cast<size_t>(n), sizeof buf - 1));
+}
+
+void appendObject(std::string& out, const LogArg::Storage& arg) {
+  if (auto s = std::get_if<std::string>(&arg)) out += *s;
+  else if (auto i = std::get_if<int64_t>(&arg)) out += std::to_string(*i);
+  else if (auto u = std::get_if<uint64_t>(&arg)) out += std::to_string(*u);
+  else if (auto d = std::get_if<double>(&arg)) {
+    char buf[32];
+    std::snprintf(buf, sizeof buf, "%.17g", *d);
+    out += buf;
+  } else if (auto p = std::get_if<LogArg::Pointer>(&arg)) {
+    char buf[32];
+    std::snprintf(buf, sizeof buf, "0x%" PRIxPTR, p->value);
+    out += buf;
+  } else {
+    out += "(null)";
+  }
+}
+
+void appendPointer(std::string& out, const LogArg::Storage& arg) {
+  uintptr_t v = 0;
+  if (auto p = std::get_if<LogArg::Pointer>(&arg)) v = p->value;
+  else if (auto u = std::get_if<uint64_t>(&arg)) v = static_cast<uintptr_t>(*u);
+  else if (auto i = std::get_if<int64_t>(&arg)) v = static_cast<uintptr_t>(*i);
+  if (v == 0) {
+    out += "0x0";
+    return;
+  }
+  char buf[32];
+  std::snprintf(buf, sizeof buf, "0x%" PRIxPTR, v);
+  out += buf;
+}
+
+std::string timestamp() {
+  using namespace std::chrono;
+  auto now = system_clock::now();
+  std::time_t t = system_clock::to_time_t(now);
+  auto ms = duration_cast<milliseconds>(now.time_since_epoch()).count() % 1000;
+  std::tm tm{};
+  localtime_r(&t, &tm);
+  char buf[40];
+  size_t n = std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S", &tm);
+  std::snprintf(buf + n, sizeof buf - n, ".%03d", static_cast<int>(ms));
+  return buf;
+}
+
+void writeStderr(const std::string& identifier, const Log& log, LogLevel level, const std::string& message) {
+  std::string line = timestamp() + " " + identifier + "[" + std::to_string(getpid()) + "] <" +
+                     std::string(logLevelName(level)) + ">";
+  if (!log.subsystem().empty()) line += " [" + log.subsystem() + ":" + log.category() + "]";
+  line += ' ';
+  for (char c : message) {
+    if (c == '\n') line += "\\n";
+    else line += c;
+  }
+  line += '\n';
+  // One write per entry keeps lines from concurrent threads whole.
+  const char* p = line.data();
+  size_t left = line.size();
+  while (left > 0) {
+    ssize_t w = ::write(STDERR_FILENO, p, left);
+    if (w <= 0) break;
+    p += w;
+    left -= static_cast<size_t>(w);
+  }
+}
+
+}  // namespace
+
+std::string_view logLevelName(LogLevel level) {
+  switch (level) {
+    case LogLevel::Debug: return "debug";
+    case LogLevel::Info: return "info";
+    case LogLevel::Default: return "default";
+    case LogLevel::Error: return "error";
+    case LogLevel::Fault: return "fault";
+  }
+  return "default";
+}
+
+std::optional<LogLevel> logLevelFromName(std::string_view name) {
+  for (LogLevel l : {LogLevel::Debug, LogLevel::Info, LogLevel::Default, LogLevel::Error, LogLevel::Fault})
+    if (logLevelName(l) == name) return l;
+  return std::nullopt;
+}
+
+int journalPriority(LogLevel level) {
+  switch (level) {
+    case LogLevel::Fault: return 2;
+    case LogLevel::Error: return 3;
+    case LogLevel::Default: return 5;
+    case LogLevel::Info: return 6;
+    case LogLevel::Debug: return 7;
+  }
+  return 5;
+}
+
+void configureLog(const LogSettings& settings) {
+  LogState& s = state();
+  std::lock_guard lock(s.mutex);
+  s.settings = settings;
+  s.useJournal = settings.backend == LogBackend::Journal ||
+                 (settings.backend == LogBackend::Auto && stderrIsJournal());
+  gMinimum.store(static_cast<int>(settings.minimum), std::memory_order_relaxed);
+  gPrivateData.store(settings.privateData, std::memory_order_relaxed);
+}
+
+LogSettings currentLogSettings() {
+  LogState& s = state();
+  std::lock_guard lock(s.mutex);
+  return s.settings;
+}
+
+void setLogSink(LogSink sink) {
+  LogState& s = state();
+  std::lock_guard lock(s.mutex);
+  s.sink = sink ? std::make_shared<const LogSink>(std::move(sink)) : nullptr;
+}
+
+const Log& Log::defaultLog() {
+  static const Log log("", "");
+  return log;
+}
+
+std::shared_ptr<const Log> Log::create(std::string subsystem, std::string category) {
+  if (subsystem.empty() || category.empty() || hasControlCharacters(subsystem) || hasControlCharacters(category))
+    return nullptr;
+  return std::shared_ptr<const Log>(new Log(std::move(subsystem), std::move(category)));
+}
+
+bool Log::enabled(LogLevel level) {
+  return static_cast<int>(level) >= gMinimum.load(std::memory_order_relaxed);
+}
+
+std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate) {
+  std::string out;
+  out.reserve(format.size() + 32);
+  size_t next = 0;
+  for (size_t i = 0; i < format.size(); ++i) {
+    char c = format[i];
+    if (c != '%') {
+      out += c;
+      continue;
+    }
+    size_t start = i++;
+    if (i >= format.size()) {
+      out += '%';
+      break;
+    }
+    if (format[i] == '%') {
+      out += '%';
+      continue;
+    }
+    bool isPrivate = false;
+    if (format[i] == '{') {
+      size_t close = format.find('}', i);
+      if (close == std::string_view::npos) {
+        out.append(format.substr(start));
+        break;
+      }
+      std::string_view annotation = format.substr(i + 1, close - i - 1);
+      isPrivate = annotation.find("private") != std::string_view::npos;
+      i = close + 1;
+    }
+    // flags, width, precision, length modifiers
+    std::string spec = "%";
+    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos) spec += format[i++];
+    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos) spec += format[i++];
+    if (i >= format.size()) {
+      out.append(format.substr(start));
+      break;
+    }
+    char conv = format[i];
+    if (std::string_view("@sdiuxXocfFeEgGp").find(conv) == std::string_view::npos) {
+      out.append(format.substr(start, i - start + 1));  // unknown directive: keep it visible
+      continue;
+    }
+    if (next >= args.size()) {
+      out += "<missing>";
+      continue;
+    }
+    const LogArg::Storage& arg = args[next++].storage();
+    if (isPrivate && !showPrivate) {
+      out += "<private>";
+      continue;
+    }
+    spec += conv;
+    switch (conv) {
+      case '@':
+      case 's': appendObject(out, arg); break;
+      case 'p': appendPointer(out, arg); break;
+      default: appendNumber(out, spec.c_str(), arg); break;
+    }
+  }
+  return out;
+}
+
+void writeLog(const Log& log, LogLevel level, std::string_view format, std::span<const LogArg> args) {
+  if (!Log::enabled(level)) return;
+  std::shared_ptr<const LogSink> sink;
+  bool journal;
+  std::string identifier;
+  {
+    LogState& s = state();
+    std::lock_guard lock(s.mutex);
+    sink = s.sink;
+    journal = s.useJournal;
+    identifier = s.settings.identifier;
+  }
+  std::string message = formatLogMessage(format, args, gPrivateData.load(std::memory_order_relaxed));
+  if (sink) {
+    (*sink)(LogEntry{level, log.subsystem(), log.category(), std::move(message)});
+    return;
+  }
+  if (journal) {
+    int rc;
+    if (log.subsystem().empty()) {
+      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level),
+                           "SYSLOG_IDENTIFIER=%s", identifier.c_str(), nullptr);
+    } else {
+      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level),
+                           "SYSLOG_IDENTIFIER=%s", identifier.c_str(), "ZLKA_SUBSYSTEM=%s",
+                           log.subsystem().c_str(), "ZLKA_CATEGORY=%s", log.category().c_str(), nullptr);
+    }
+    if (rc >= 0) return;
+  }
+  writeStderr(identifier, log, level, message);
+}
+
+}  // namespace platform

@@ -1,0 +1,8 @@
+// Pointer mask for "%p" fields of log lines: real addresses never reach the log, distances between
+// logged positions are kept. Null stays null; anything else gets a process-wide random offset,
+// drawn at the first call with a non-null pointer (and again while the draw yields 0).
+#pragma once
+
+#include <cstdint>
+
+uintptr_t obfuscatedPointer(const void* pointer);
