@@ -1,6 +1,6 @@
 #include "network/token_array.h"
 
-#include "der/der.h"
+#include "der/der_item.h"
 #include "platform/log.h"
 #include "platform/value.h"
 #include "support/obfuscated_pointer.h"
@@ -30,13 +30,13 @@ std::optional<std::vector<platform::Data>> parseTokenArray(const std::optional<p
   // byte is never decoded; zero-length data hands the decoder an empty range and fails.
   if (data.empty()) {
     DERDecodedItem item{};
-    if (DERDecodeItem(DERSlice{base, 0}, item) != DER_STATUS_OK) return std::nullopt;
+    if (DERDecodeItem(DERSlice{base, 0}, &item) != DER_STATUS_OK) return std::nullopt;
   }
   while (itemBegin < dataEnd) {
     const uint8_t* p = base + (itemBegin - begin);
     platform::log(LogLevel::Debug, "[#TokenAuth] pItemBegin: %p", obfuscatedPointer(p));
     DERDecodedItem item{};
-    DERStatus ret = DERDecodeItem(DERSlice{p, dataEnd - itemBegin + 1}, item);
+    DERStatus ret = DERDecodeItem(DERSlice{p, dataEnd - itemBegin + 1}, &item);
     if (ret != DER_STATUS_OK) return std::nullopt;
     platform::log(LogLevel::Debug, "[#TokenAuth] ret: %d", static_cast<int>(ret));
 

@@ -132,6 +132,17 @@ bool operator==(const Value& a, const Value& b) {
   return a.v_ == b.v_;
 }
 
+std::string Value::typeName() const {
+  if (isNull()) return "Null";
+  if (isBool()) return "Boolean";
+  if (isNumber()) return "Number";
+  if (isString()) return "String";
+  if (isData()) return "Data";
+  if (isArray()) return "Array";
+  if (isDictionary()) return "Dictionary";
+  return opaque()->kind;
+}
+
 std::string Value::description() const {
   std::string out;
   describe(out, *this);

@@ -85,6 +85,10 @@ class Value {
   // Numbers compare by value across integer and real; Booleans equal only Booleans.
   friend bool operator==(const Value& a, const Value& b);
 
+  // The kind of value, for log lines: "Null", "Boolean", "Number", "String", "Data", "Array",
+  // "Dictionary" or the opaque kind.
+  std::string typeName() const;
+
   // A readable rendering for logs: JSON-like, bytes as Data::description().
   std::string description() const;
 

@@ -1,13 +1,9 @@
 #include "support/json_file.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <fstream>
 #include <sstream>
 
+#include "platform/atomic_file.h"
 #include "platform/json.h"
 
 std::optional<platform::Value> readJSONFile(const std::optional<std::filesystem::path>& path) {
@@ -24,24 +20,5 @@ bool writeJSONFile(const std::optional<platform::Value>& object, const std::opti
   if (!path) return false;
   std::optional<std::string> text = platform::json::serialize(object ? *object : platform::Value(platform::Dictionary{}), true);
   if (!text) return false;
-  std::string tmp = path->string() + ".XXXXXX";
-  int fd = mkostemp(tmp.data(), O_CLOEXEC);
-  if (fd < 0) return false;
-  bool ok = true;
-  const char* p = text->data();
-  size_t left = text->size();
-  while (ok && left > 0) {
-    ssize_t w = ::write(fd, p, left);
-    if (w < 0 && errno == EINTR) continue;
-    ok = w > 0;
-    if (ok) {
-      p += w;
-      left -= static_cast<size_t>(w);
-    }
-  }
-  ok = ok && fchmod(fd, 0644) == 0 && fsync(fd) == 0;
-  ok = (::close(fd) == 0) && ok;
-  if (ok) ok = ::rename(tmp.c_str(), path->c_str()) == 0;
-  if (!ok) ::unlink(tmp.c_str());
-  return ok;
+  return platform::writeFileAtomically(*path, *text);
 }

@@ -1,0 +1,103 @@
+// ZLKANetwork: the one object that does the service's work. It runs the three token operations,
+// signs and verifies through its secure-association session, and serves that session as its
+// delegate for the certificate download and the handshake.
+//
+// sharedInstance() makes it on first use (once per process): the exported object, the
+// internal-build flag, the settings suite, an ephemeral HTTP session and the session. On an
+// internal build the settings suite selects the servers and injects faults, read afresh at every
+// use; on a production device it is never consulted. The switch setters store a value that the
+// getters never read: the suite is the only control.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "network/zlka_network_constants.h"
+#include "network/zlka_network_protocol.h"
+#include "platform/configuration.h"
+#include "platform/http_session.h"
+#include "platform/settings_store.h"
+#include "sap/tarvex_sap_session.h"
+
+class ZLKANetwork final : public ZLKANetworkProtocol,
+                          public TarvexSAPSessionDelegate,
+                          public std::enable_shared_from_this<ZLKANetwork> {
+ public:
+  static std::shared_ptr<ZLKANetwork> sharedInstance();
+  // Forbidden: the instance comes from sharedInstance(). Throws InternalInconsistencyException.
+  [[noreturn]] static std::shared_ptr<ZLKANetwork> init();
+  ~ZLKANetwork() override;
+
+  // The token operations.
+  void requestMetadataForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
+                               const std::optional<platform::Locale>& requestedLocale,
+                               const std::optional<platform::Dictionary>& requestInfo, ZLKAMetadataReply reply) override;
+  void requestActivationForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
+                                 ZLKAActivationReply reply) override;
+  void confirmActivationForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
+                                 ZLKAConfirmationReply reply) override;
+
+  // The session's certificate and handshake transport.
+  void sessionRequestCertificateWithCompletionHandler(TarvexSAPSession& session, TarvexSAPDataCompletion completion) override;
+  void sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSession& session,
+                                                          const std::optional<platform::Data>& handshakeData,
+                                                          TarvexSAPDataCompletion completion) override;
+
+  // Fault-injection switches: true only on an internal build whose suite holds true for the key.
+  bool forceNetworkFailure();
+  bool forceTokenActivationFailure();
+  bool forceTokenConfirmationFailure();
+  bool forceTarvexSAPFailure();
+  void setForceNetworkFailure(bool value);
+  void setForceTokenActivationFailure(bool value);
+  void setForceTokenConfirmationFailure(bool value);
+  void setForceTarvexSAPFailure(bool value);
+
+  // Base URLs to use now (no trailing slash).
+  std::string _selectedStaticContentServer();
+  std::string _selectedTarvexSAPServer();
+  std::string _selectedAPIServer();
+
+  std::shared_ptr<ZLKANetworkProtocol> exportedObject() const;
+  bool isInternalBuild() const;
+  void setIsInternalBuild(bool value);
+  std::shared_ptr<platform::SettingsStore> userDefaults() const;
+  void setUserDefaults(std::shared_ptr<platform::SettingsStore> value);
+  std::shared_ptr<platform::HTTPSession> urlSession() const;
+  void setUrlSession(std::shared_ptr<platform::HTTPSession> value);
+  std::shared_ptr<TarvexSAPSession> tarvexSAPSession() const;
+  void setTarvexSAPSession(std::shared_ptr<TarvexSAPSession> value);
+
+  // The request pipeline shared by the operations.
+  std::optional<platform::Error> _openTarvexSAPSession();
+  std::optional<platform::Data> _tarvexSignatureForDataSync(const platform::Data& data, bool* timedOut,
+                                                            std::optional<platform::Error>* error);
+  bool _verifyTarvexSignatureSync(const std::optional<platform::Data>& signature, const platform::Data& data, bool* timedOut,
+                                  std::optional<platform::Error>* error);
+  platform::HTTPRequest _generateTokenAuthURLRequestForEndpoint(const std::string& endpoint,
+                                                                const std::optional<std::string>& sessionID,
+                                                                const std::optional<platform::Data>& signature);
+
+ private:
+  struct Private {};
+
+ public:
+  explicit ZLKANetwork(Private);
+
+ private:
+  void _init();
+  std::string selectServer(const char* key, bool offerCustom, std::string (*pick)(const platform::ServerEnvironment&));
+
+  mutable std::mutex mutex_;
+  bool isInternalBuild_ = false;
+  bool forceNetworkFailure_ = false;  // stored, never read back
+  bool forceTokenActivationFailure_ = false;
+  bool forceTokenConfirmationFailure_ = false;
+  bool forceTarvexSAPFailure_ = false;
+  std::shared_ptr<ZLKANetworkProtocol> exportedObject_;
+  std::shared_ptr<platform::SettingsStore> userDefaults_;
+  std::shared_ptr<platform::HTTPSession> urlSession_;
+  std::shared_ptr<TarvexSAPSession> tarvexSAPSession_;
+};

@@ -1,0 +1,47 @@
+// Connection: one peer of the messaging service. Operations read the connection of the message
+// being served with currentConnection(), a thread-local set while the message is handled, and ask
+// it for the peer's entitlements.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/value.h"
+
+namespace platform {
+
+// Answers the value of an entitlement for a peer, or nullopt when the peer does not hold it.
+using EntitlementLookup = std::function<std::optional<Value>(std::string_view entitlement)>;
+
+class Connection : public std::enable_shared_from_this<Connection> {
+ public:
+  Connection(std::string peerName, EntitlementLookup entitlements);
+  virtual ~Connection() = default;
+
+  const std::string& peerName() const { return peerName_; }
+  std::optional<Value> valueForEntitlement(std::string_view entitlement) const;
+
+  // The connection whose message the calling thread is serving, or null.
+  static Connection* currentConnection();
+
+  // Makes a connection current on this thread for the lifetime of the scope.
+  class CurrentScope {
+   public:
+    explicit CurrentScope(Connection* connection);
+    ~CurrentScope();
+    CurrentScope(const CurrentScope&) = delete;
+    CurrentScope& operator=(const CurrentScope&) = delete;
+
+   private:
+    Connection* previous_;
+  };
+
+ private:
+  std::string peerName_;
+  EntitlementLookup entitlements_;
+};
+
+}  // namespace platform

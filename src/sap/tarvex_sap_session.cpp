@@ -1,0 +1,356 @@
+#include "sap/tarvex_sap_session.h"
+
+#include <atomic>
+#include <chrono>
+#include <cstdlib>
+#include <ctime>
+#include <vector>
+
+#include "platform/exception.h"
+#include "platform/log.h"
+
+using platform::Data;
+using platform::Error;
+using platform::LogLevel;
+using platform::Value;
+
+namespace {
+
+constexpr char kClassName[] = "TarvexSAPSession";
+constexpr double kDistantFuture = 64092211200.0;  // 4001-01-01, far beyond any time-to-live
+constexpr uint64_t kStateOpen = 6;
+
+double now() {
+  return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
+}
+
+std::string formatDate(double secondsSince1970) {
+  std::time_t t = static_cast<std::time_t>(secondsSince1970);
+  std::tm tm{};
+  gmtime_r(&t, &tm);
+  char buf[40];
+  std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+  return buf;
+}
+
+std::string queueLabel(const void* session, const char* suffix) {
+  return std::string(kClassName) + "-" + std::to_string(reinterpret_cast<uintptr_t>(session)) + "." + suffix;
+}
+
+// The open completion fires at most once, whatever a misbehaving delegate does.
+TarvexSAPSession::OpenCompletion once(TarvexSAPSession::OpenCompletion completion) {
+  auto fired = std::make_shared<std::atomic<bool>>(false);
+  return [fired, completion = std::move(completion)](std::optional<Error> error) {
+    if (!fired->exchange(true) && completion) completion(std::move(error));
+  };
+}
+
+std::string className(const std::optional<Value>& v) { return v ? v->typeName() : "(null)"; }
+
+}  // namespace
+
+std::shared_ptr<TarvexSAPSession> TarvexSAPSession::sessionWithDelegate(std::weak_ptr<TarvexSAPSessionDelegate> delegate,
+                                                                        TarvexSAPPrimitives primitives) {
+  return std::make_shared<TarvexSAPSession>(Private{}, std::move(delegate), std::move(primitives));
+}
+
+std::shared_ptr<TarvexSAPSession> TarvexSAPSession::init() {
+  throw platform::InternalInconsistencyException(std::string("Must use +[") + kClassName + " initWithDelegate:] instead of +[" +
+                                                 kClassName + " init]!");
+}
+
+TarvexSAPSession::TarvexSAPSession(Private, std::weak_ptr<TarvexSAPSessionDelegate> delegate, TarvexSAPPrimitives primitives)
+    : delegate_(std::move(delegate)),
+      completionQueue_(platform::Queue::concurrent(queueLabel(this, "completionQueue"))),
+      internalQueue_(platform::Queue::serial(queueLabel(this, "internalQueue"))),
+      delegateQueue_(platform::Queue::concurrent(queueLabel(this, "delegateQueue"), 2)),
+      expiration_(kDistantFuture),
+      primitives_(std::move(primitives)) {}
+
+TarvexSAPSession::~TarvexSAPSession() {
+  // Queued work holds the session alive, so nothing else can be running now: close in place
+  // rather than queueing a close that would outlive the context.
+  _close();
+}
+
+std::optional<std::string> TarvexSAPSession::stateName(uint64_t state_int) {
+  static const char* const names[] = {"[Closed]",
+                                      "[Initialized]",
+                                      "[Waiting For Certificate]",
+                                      "[Generating Handshake Request]",
+                                      "[Waiting For Handshake Response]",
+                                      "[Processing Handshake Response]",
+                                      "[Open]"};
+  if (state_int > kStateOpen) return std::nullopt;
+  return names[state_int];
+}
+
+void TarvexSAPSession::setState_int(uint64_t value) {
+  state_int_ = value;
+  platform::log(LogLevel::Info, "[#TarvexSAPSession] self.state_int: %@", stateName(value));
+}
+
+void TarvexSAPSession::_close() {
+  platform::log(LogLevel::Default, "[#TarvexSAPSession] Closing session...");
+  expiration_ = now();
+  // The handle is kept on purpose: a later close tears it down again, which the primitives refuse
+  // harmlessly, and the next open overwrites it.
+  if (sessionContext_ && primitives_.teardown(sessionContext_) != 0)
+    platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not tear down Tarvex SAP session!");
+  setState_int(0);
+}
+
+void TarvexSAPSession::_checkExpiration() {
+  // An opening session has no valid expiration yet (a reopened one still carries the moment of
+  // its last close), so only a closed or open session can expire.
+  if (state_int_ != 0 && state_int_ != kStateOpen) return;
+  if (expiration_ - now() < 0) {
+    platform::log(LogLevel::Default, "[#TarvexSAPSession] Session is past expiration, closing session...");
+    _close();
+  }
+}
+
+double TarvexSAPSession::_secondsUntilExpiration() const { return expiration_ - now(); }
+
+void TarvexSAPSession::_complete(const OpenCompletion& completion, std::optional<Error> error) {
+  completionQueue_->async([completion, error = std::move(error)] { completion(error); });
+}
+
+void TarvexSAPSession::openWithCompletionHandler(OpenCompletion completion) {
+  internalQueue_->async([self = shared_from_this(), completion = once(std::move(completion))] { self->_open(completion); });
+}
+
+void TarvexSAPSession::_open(OpenCompletion completion) {
+  _checkExpiration();
+  if (state_int_ != 0) {
+    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session is already open or initializing."));
+    return;
+  }
+  platform::log(LogLevel::Info, "[#TarvexSAPSession] Opening session...");
+  int32_t status = primitives_.init(&sessionContext_, &hwInfo_);
+  if (status != 0) {
+    platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not initialize session! (status: %d)", status);
+    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal, "Could not initialize session."));
+    return;
+  }
+  const uint64_t generation = ++openGeneration_;
+  setState_int(1);
+  setState_int(2);
+  delegateQueue_->async([self = shared_from_this(), generation, completion] {
+    auto delegate = self->delegate_.lock();
+    if (!delegate) return;
+    delegate->sessionRequestCertificateWithCompletionHandler(
+        *self, [self, generation, completion](std::optional<Data> certificate, std::optional<Error> error) {
+          self->internalQueue_->async([self, generation, completion, certificate = std::move(certificate),
+                                       error = std::move(error)]() mutable {
+            self->_receivedCertificate(generation, std::move(certificate), std::move(error), completion);
+          });
+        });
+  });
+}
+
+bool TarvexSAPSession::_stillOpening(uint64_t generation, uint64_t expectedState, const OpenCompletion& completion) {
+  if (generation == openGeneration_ && state_int_ == expectedState) return true;
+  // The session was closed (or reopened) while the delegate worked: leave it alone.
+  _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState));
+  return false;
+}
+
+void TarvexSAPSession::_receivedCertificate(uint64_t generation, std::optional<Data> certificate,
+                                            std::optional<Error> error, OpenCompletion completion) {
+  if (!_stillOpening(generation, 2, completion)) return;
+  if (error) {
+    platform::log(LogLevel::Error, "[#TarvexSAPSession] Error requesting certificate: %@", error);
+    _close();
+    _complete(completion, std::move(error));
+    return;
+  }
+  if (!certificate || certificate->empty()) {
+    platform::log(LogLevel::Default, "[#TarvexSAPSession] Invalid certificate received!");
+    _close();
+    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
+    return;
+  }
+  platform::log(LogLevel::Info, "[#TarvexSAPSession] Received certificate!");
+  setState_int(3);
+
+  uint8_t* out = nullptr;
+  uint32_t outLength = 0;
+  uint8_t returnCode = 255;
+  int32_t status = primitives_.exchange(kTarvexSAPExchangeSelector, &hwInfo_, sessionContext_, certificate->bytes(),
+                                        certificate->length(), &out, &outLength, &returnCode);
+  if (status != 0 || returnCode != 1 || !out || outLength == 0) {
+    platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not generate handshake request data! (status: %d, returnCode: %d)",
+                  status, returnCode);
+    std::free(out);
+    _close();
+    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
+    return;
+  }
+  Data request = Data::adoptMalloc(out, outLength);
+  setState_int(4);
+  delegateQueue_->async([self = shared_from_this(), generation, completion, request] {
+    auto delegate = self->delegate_.lock();
+    if (!delegate) return;
+    delegate->sessionRequestHandshakeWithServerCompletionHandler(
+        *self, request, [self, generation, completion](std::optional<Data> response, std::optional<Error> error) {
+          self->internalQueue_->async([self, generation, completion, response = std::move(response),
+                                       error = std::move(error)]() mutable {
+            self->_receivedHandshake(generation, std::move(response), std::move(error), completion);
+          });
+        });
+  });
+}
+
+void TarvexSAPSession::_receivedHandshake(uint64_t generation, std::optional<Data> response, std::optional<Error> error,
+                                          OpenCompletion completion) {
+  if (!_stillOpening(generation, 4, completion)) return;
+  if (error) {
+    platform::log(LogLevel::Error, "[#TarvexSAPSession] Error requesting handshake: %@", error);
+    _close();
+    _complete(completion, std::move(error));
+    return;
+  }
+  if (!response) {
+    platform::log(LogLevel::Default, "[#TarvexSAPSession] Invalid handshake response received!");
+    _close();
+    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
+    return;
+  }
+  platform::log(LogLevel::Info, "[#TarvexSAPSession] Received handshake response!");
+  setState_int(5);
+
+  uint8_t* out = nullptr;
+  uint32_t outLength = 0;
+  uint8_t returnCode = 255;
+  int32_t status = primitives_.exchange(kTarvexSAPExchangeSelector, &hwInfo_, sessionContext_, response->bytes(),
+                                        response->length(), &out, &outLength, &returnCode);
+  std::free(out);  // nothing follows the handshake: any output is unread
+  // One round trip only: a primitive that wants another round has failed.
+  if (status == 0 && returnCode == 0) {
+    setState_int(kStateOpen);
+    _complete(completion, std::nullopt);
+    return;
+  }
+  platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not process handshake response! (status: %d, returnCode: %d)", status,
+                returnCode);
+  _close();
+  _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
+}
+
+void TarvexSAPSession::close() {
+  internalQueue_->async([self = shared_from_this()] { self->_close(); });
+}
+
+void TarvexSAPSession::signatureForData(const platform::Data& data, SignCompletion completion) {
+  signatureForData(std::optional<Value>(Value(data)), std::move(completion));
+}
+
+void TarvexSAPSession::signatureForData(const std::optional<Value>& data, SignCompletion completion) {
+  if (!completion) return;
+  internalQueue_->async([self = shared_from_this(), data, completion = std::move(completion)] {
+    auto reply = [&](std::optional<Data> signature, std::optional<Error> error) {
+      self->completionQueue_->async([completion, signature = std::move(signature), error = std::move(error)] {
+        completion(signature, error);
+      });
+    };
+    platform::log(LogLevel::Info, "[#TarvexSAPSession] Generating signature...");
+    self->_checkExpiration();
+    if (!data || !data->isData()) {
+      platform::log(LogLevel::Info, "[#TarvexSAPSession] Invalid parameter! (data.class: %@, data: %@)", className(data), data);
+      reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
+      return;
+    }
+    if (self->state_int_ != kStateOpen) {
+      reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to generate signature."));
+      return;
+    }
+    const Data& bytes = *data->data();
+    uint8_t* signature = nullptr;
+    uint32_t signatureLength = 0;
+    int32_t status = self->primitives_.sign(self->sessionContext_, bytes.bytes(), bytes.length(), &signature, &signatureLength);
+    if (status != 0) {
+      platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not generate signature! (status: %d)", status);
+      std::free(signature);
+      reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
+      return;
+    }
+    reply(Data::adoptMalloc(signature, signatureLength), std::nullopt);
+  });
+}
+
+void TarvexSAPSession::verifySignature(const std::optional<platform::Data>& signature, const platform::Data& data,
+                                       VerifyCompletion completion) {
+  std::optional<Value> sig;
+  if (signature) sig = Value(*signature);
+  verifySignature(sig, std::optional<Value>(Value(data)), std::move(completion));
+}
+
+void TarvexSAPSession::verifySignature(const std::optional<Value>& signature, const std::optional<Value>& data,
+                                       VerifyCompletion completion) {
+  if (!completion) return;
+  internalQueue_->async([self = shared_from_this(), signature, data, completion = std::move(completion)] {
+    auto reply = [&](bool valid, std::optional<Error> error) {
+      self->completionQueue_->async([completion, valid, error = std::move(error)] { completion(valid, error); });
+    };
+    platform::log(LogLevel::Info, "[#TarvexSAPSession] Verifying signature...");
+    if (!signature || !signature->isData() || !data || !data->isData()) {
+      platform::log(LogLevel::Info,
+                    "[#TarvexSAPSession] Invalid parameter! (signature.class: %@, data.class: %@, signature: %@, data: %@)",
+                    className(signature), className(data), signature, data);
+      reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
+      return;
+    }
+    if (self->state_int_ != kStateOpen) {
+      reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to verify signature."));
+      return;
+    }
+    const Data& sig = *signature->data();
+    // The primitive may write into the data; it gets a private copy.
+    std::vector<uint8_t> copy = data->data()->toVector();
+    int32_t status = self->primitives_.verify(self->sessionContext_, sig.bytes(), sig.length(), copy.data(), copy.size());
+    self->_checkExpiration();
+    if (status != 0) {
+      platform::log(LogLevel::Default, "[#TarvexSAPSession] Signature verification failed! (status: %d)", status);
+      reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
+      return;
+    }
+    reply(true, std::nullopt);
+  });
+}
+
+TarvexSAPSessionState TarvexSAPSession::state() {
+  TarvexSAPSessionState result = TarvexSAPSessionStateClosed;
+  internalQueue_->sync([&] {
+    _checkExpiration();
+    static const TarvexSAPSessionState publicStates[] = {TarvexSAPSessionStateInitializing, TarvexSAPSessionStateInitializing,
+                                                         TarvexSAPSessionStateInitializing, TarvexSAPSessionStateInitializing,
+                                                         TarvexSAPSessionStateInitializing, TarvexSAPSessionStateOpen};
+    if (state_int_ >= 1 && state_int_ <= kStateOpen) result = publicStates[state_int_ - 1];
+  });
+  return result;
+}
+
+double TarvexSAPSession::TTL() {
+  double ttl = 0.0;
+  internalQueue_->sync([&] {
+    if (state_int_ == kStateOpen) ttl = _secondsUntilExpiration();
+  });
+  return ttl;
+}
+
+void TarvexSAPSession::setTTL(double seconds) {
+  internalQueue_->barrierSync([&] {
+    expiration_ = now() + seconds;
+    platform::log(LogLevel::Debug, "[#TarvexSAPSession] Setting TTL... (TTL: %f, self.expiration: %@)", seconds,
+                  formatDate(expiration_));
+  });
+}
+
+std::string TarvexSAPSession::description() {
+  static const char* const names[] = {"[Closed]", "[Initializing]", "[Open]"};
+  TarvexSAPSessionState s = state();
+  char ttl[64];
+  std::snprintf(ttl, sizeof ttl, "%f", TTL());
+  return std::string(kClassName) + " <state: " + names[s] + ", TTL: " + ttl + "s>";
+}

@@ -1,0 +1,103 @@
+// TarvexSAPSession: the one secure association with the device-services back end.
+//
+// It owns a primitive context, opens it with a two-message handshake whose network legs its
+// delegate carries, then signs request bodies and verifies answers until its expiration passes;
+// any use after that closes it, and it must be opened again. Every operation is asynchronous and
+// reports through its completion on the concurrent completion queue; state changes and primitive
+// calls run on the serial internal queue, delegate calls on the concurrent delegate queue.
+//
+// state(), TTL(), setTTL() and description() wait for the internal queue: never call them from it
+// (completions and delegate calls run elsewhere, so they may). The delegate is held weakly; keep
+// it alive while an open runs, or the open never completes.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/data.h"
+#include "platform/error.h"
+#include "platform/queue.h"
+#include "platform/uuid.h"
+#include "platform/value.h"
+#include "sap/tarvex_sap_primitives.h"
+#include "sap/tarvex_sap_session_delegate.h"
+#include "sap/tarvex_sap_session_error.h"
+
+enum TarvexSAPSessionState : uint64_t {
+  TarvexSAPSessionStateClosed = 0,
+  TarvexSAPSessionStateInitializing = 1,
+  TarvexSAPSessionStateOpen = 2,
+};
+
+class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
+ public:
+  using OpenCompletion = std::function<void(std::optional<platform::Error>)>;
+  using SignCompletion = std::function<void(std::optional<platform::Data>, std::optional<platform::Error>)>;
+  using VerifyCompletion = std::function<void(bool, std::optional<platform::Error>)>;
+
+  static std::shared_ptr<TarvexSAPSession> sessionWithDelegate(std::weak_ptr<TarvexSAPSessionDelegate> delegate,
+                                                               TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library());
+  // Forbidden: sessions are made with sessionWithDelegate. Throws InternalInconsistencyException.
+  [[noreturn]] static std::shared_ptr<TarvexSAPSession> init();
+  ~TarvexSAPSession();
+
+  void openWithCompletionHandler(OpenCompletion completion);  // an empty completion still opens
+  void close();                                               // queued; returns at once
+  // Anything but bytes is an invalid parameter. An empty completion does nothing at all.
+  void signatureForData(const std::optional<platform::Value>& data, SignCompletion completion);
+  void signatureForData(const platform::Data& data, SignCompletion completion);
+  void verifySignature(const std::optional<platform::Value>& signature, const std::optional<platform::Value>& data,
+                       VerifyCompletion completion);
+  void verifySignature(const std::optional<platform::Data>& signature, const platform::Data& data,
+                       VerifyCompletion completion);
+
+  TarvexSAPSessionState state();
+  double TTL();              // seconds left while open (negative once past), else 0
+  void setTTL(double seconds);
+  std::string description();  // "TarvexSAPSession <state: [Open], TTL: 3599.998000s>"
+
+  const platform::UUID& UUID() const { return uuid_; }
+  std::weak_ptr<TarvexSAPSessionDelegate> delegate() const { return delegate_; }
+  const std::shared_ptr<platform::Queue>& completionQueue() const { return completionQueue_; }
+  const std::shared_ptr<platform::Queue>& internalQueue() const { return internalQueue_; }
+  const std::shared_ptr<platform::Queue>& delegateQueue() const { return delegateQueue_; }
+
+  // Internal state 0..6, readable on the internal queue only (and by tests through it).
+  uint64_t state_int() const { return state_int_; }
+  static std::optional<std::string> stateName(uint64_t state_int);
+
+ private:
+  struct Private {};
+
+ public:
+  TarvexSAPSession(Private, std::weak_ptr<TarvexSAPSessionDelegate> delegate, TarvexSAPPrimitives primitives);
+
+ private:
+  // All of these run on the internal queue.
+  void setState_int(uint64_t value);
+  void _close();
+  void _checkExpiration();
+  void _open(OpenCompletion completion);
+  void _receivedCertificate(uint64_t generation, std::optional<platform::Data> certificate,
+                            std::optional<platform::Error> error, OpenCompletion completion);
+  void _receivedHandshake(uint64_t generation, std::optional<platform::Data> response,
+                          std::optional<platform::Error> error, OpenCompletion completion);
+  bool _stillOpening(uint64_t generation, uint64_t expectedState, const OpenCompletion& completion);
+  void _complete(const OpenCompletion& completion, std::optional<platform::Error> error);
+  double _secondsUntilExpiration() const;
+
+  std::weak_ptr<TarvexSAPSessionDelegate> delegate_;
+  const platform::UUID uuid_;
+  uint64_t state_int_ = 0;
+  std::shared_ptr<platform::Queue> completionQueue_;
+  std::shared_ptr<platform::Queue> internalQueue_;
+  std::shared_ptr<platform::Queue> delegateQueue_;
+  QVSAPContextOpaque_* sessionContext_ = nullptr;
+  TarvexHWInfo_ hwInfo_{};
+  double expiration_;  // seconds since 1970
+  uint64_t openGeneration_ = 0;
+  TarvexSAPPrimitives primitives_;
+};

@@ -1,0 +1,27 @@
+// Errors of the secure-association session, in their own domain. The token operations map them
+// onto the service's codes; clients never see them.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+#include "platform/error.h"
+
+inline constexpr char TarvexSAPSessionErrorDomain[] = "TarvexSAPSessionErrorDomain";
+
+enum TarvexSAPSessionErrorCode : int64_t {
+  TarvexSAPSessionErrorUnknown = -1,
+  TarvexSAPSessionErrorNotAvailable = -2,
+  TarvexSAPSessionErrorInvalidParameter = -3,
+  TarvexSAPSessionErrorInternal = -4,
+  TarvexSAPSessionErrorTransport = -5,     // no description of its own
+  TarvexSAPSessionErrorBadResponse = -6,   // no description of its own
+  TarvexSAPSessionErrorInvalidState = -7,
+};
+
+// The code's fixed description; nullopt for -5, -6 and codes outside -7..-1.
+std::optional<std::string> QVSAPS_errorDescriptionForCode(int64_t code);
+platform::Error QVSAPS_errorWithCode(int64_t code);
+// No description means no user-info at all.
+platform::Error QVSAPS_errorWithCode(int64_t code, const std::optional<std::string>& description);
