@@ -5,10 +5,13 @@
 
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 
+#include "platform/messaging.h"
+#include "platform/queue.h"
 #include "platform/value.h"
 
 namespace platform {
@@ -23,6 +26,17 @@ class Connection : public std::enable_shared_from_this<Connection> {
 
   const std::string& peerName() const { return peerName_; }
   std::optional<Value> valueForEntitlement(std::string_view entitlement) const;
+
+  // Set up by the listener's delegate before resume(); calls arrive only once resumed.
+  void setExportedInterface(std::shared_ptr<const Interface> interface);
+  void setExportedObject(std::shared_ptr<void> object);
+  void resume();
+  std::shared_ptr<const Interface> exportedInterface() const;
+  std::shared_ptr<void> exportedObject() const;
+  bool isResumed() const;
+
+  // The serial queue this peer's calls run on (made on first use).
+  std::shared_ptr<Queue> queue();
 
   // The connection whose message the calling thread is serving, or null.
   static Connection* currentConnection();
@@ -42,6 +56,11 @@ class Connection : public std::enable_shared_from_this<Connection> {
  private:
   std::string peerName_;
   EntitlementLookup entitlements_;
+  mutable std::mutex mutex_;
+  std::shared_ptr<const Interface> interface_;
+  std::shared_ptr<void> object_;
+  bool resumed_ = false;
+  std::shared_ptr<Queue> queue_;
 };
 
 }  // namespace platform

@@ -18,9 +18,10 @@ void appendHex(std::string& out, const uint8_t* p, size_t n) {
 
 Data::Data(const void* bytes, size_t length) {
   if (length == 0) return;
-  auto storage = std::make_shared<std::vector<uint8_t>>(static_cast<const uint8_t*>(bytes),
-                                                        static_cast<const uint8_t*>(bytes) + length);
-  bytes_ = storage->data();
+  // One allocation for the control block and the bytes.
+  std::shared_ptr<uint8_t[]> storage = std::make_shared_for_overwrite<uint8_t[]>(length);
+  std::memcpy(storage.get(), bytes, length);
+  bytes_ = storage.get();
   length_ = length;
   owner_ = std::move(storage);
 }

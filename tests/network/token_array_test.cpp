@@ -124,7 +124,7 @@ TEST(ParseTokenArray, DebugLinesMaskPointersAndReportEachItem) {
   }
   EXPECT_EQ(itemLengths, 2);
   EXPECT_EQ(rets, 2);
-  EXPECT_EQ(lines.front(), "[#TokenAuth] tokens: " + input.description());
+  EXPECT_EQ(lines.front(), "[#TokenAuth] tokens: <private>");
   EXPECT_EQ(lines[1], "[#TokenAuth] tokens.length: 7");
   EXPECT_TRUE(std::regex_match(lines[2], std::regex(R"(\[#TokenAuth\] pItemBegin: 0x[0-9a-f]+)")));
   EXPECT_TRUE(lines.back().starts_with("[#TokenAuth] tokenArray: ["));

@@ -1,0 +1,504 @@
+#include "platform/listener.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/eventfd.h>
+#include <systemd/sd-daemon.h>
+#include <systemd/sd-event.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstring>
+#include <map>
+#include <set>
+#include <vector>
+
+#include "platform/log.h"
+
+namespace platform {
+
+namespace {
+ListenerOptions& configuredOptions() {
+  static ListenerOptions options;
+  return options;
+}
+
+}  // namespace
+
+struct Reply::State {
+  std::weak_ptr<Listener::Core> core;
+  sd_bus_message* call = nullptr;  // referenced; touched on the bus thread only
+  uint64_t id = 0;
+  std::atomic<bool> done{false};
+  ~State();
+};
+
+class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
+ public:
+  Core(ListenerOptions options, Listener& owner) : options_(std::move(options)), owner_(owner) {}
+
+  ~Core() {
+    sd_bus_slot_unref(vtableSlot_);
+    sd_bus_slot_unref(matchSlot_);
+    for (sd_event_source* s : sources_) sd_event_source_unref(s);
+    if (bus_) sd_bus_flush_close_unref(bus_);
+    if (event_) sd_event_unref(event_);
+    if (wakeFd_ >= 0) ::close(wakeFd_);
+  }
+
+  int run() {
+    if (!options_.interface) {
+      log(LogLevel::Fault, "The listener has no interface to export");
+      return 1;
+    }
+    int rc = sd_event_new(&event_);
+    if (rc < 0) return fail("cannot create the event loop", rc);
+    rc = openBus();
+    if (rc < 0) return fail("cannot connect to the " + options_.bus + " bus", rc);
+    rc = sd_bus_attach_event(bus_, event_, SD_EVENT_PRIORITY_NORMAL);
+    if (rc < 0) return fail("cannot attach the bus to the event loop", rc);
+    wakeFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (wakeFd_ < 0) return fail("cannot create an eventfd", -errno);
+    sd_event_source* source = nullptr;
+    if ((rc = sd_event_add_io(event_, &source, wakeFd_, EPOLLIN, &Core::onPosted, this)) < 0)
+      return fail("cannot watch the eventfd", rc);
+    sources_.push_back(source);
+    for (int sig : {SIGTERM, SIGINT, SIGHUP}) {
+      if ((rc = sd_event_add_signal(event_, &source, sig, &Core::onSignal, this)) < 0)
+        return fail("cannot handle signals (call Listener::blockSignals() first)", rc);
+      sources_.push_back(source);
+    }
+    buildVTable();
+    rc = sd_bus_add_object_vtable(bus_, &vtableSlot_, options_.objectPath.c_str(), options_.interface->name.c_str(),
+                                  vtable_.data(), this);
+    if (rc < 0) return fail("cannot export " + options_.objectPath, rc);
+    rc = sd_bus_match_signal(bus_, &matchSlot_, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+                             "NameOwnerChanged", &Core::onNameOwnerChanged, this);
+    if (rc < 0) return fail("cannot watch peers leaving the bus", rc);
+    rc = sd_bus_request_name(bus_, options_.serviceName.c_str(), 0);
+    if (rc < 0) return fail("cannot own the name " + options_.serviceName, rc);
+    lastActivity_ = now();
+    if (options_.exitOnIdle) armIdleTimer(lastActivity_ + toUsec(*options_.exitOnIdle));
+    log(LogLevel::Default, "Listening as %s on %s at %s", options_.serviceName, options_.bus, options_.objectPath);
+    if (options_.notifyReady) sd_notify(0, "READY=1\nSTATUS=Serving requests");
+    rc = sd_event_loop(event_);
+    if (options_.notifyReady) sd_notify(0, "STOPPING=1");
+    return rc < 0 ? 1 : rc;
+  }
+
+  // Runs `work` on the bus thread.
+  void post(std::function<void()> work) {
+    {
+      std::lock_guard lock(postMutex_);
+      posted_.push_back(std::move(work));
+    }
+    uint64_t one = 1;
+    if (::write(wakeFd_, &one, sizeof one) < 0) {
+      // The counter saturating still wakes the loop; nothing else can go wrong here.
+    }
+  }
+
+  void requestStop() {
+    post([self = shared_from_this()] { self->beginDrain("stop requested"); });
+  }
+
+  size_t connectionCount() const { return connectionCount_.load(); }
+  size_t callsInFlight() const { return inFlight_.load(); }
+
+  // Bus thread: the answer to a call, then its bookkeeping.
+  void sendReturn(sd_bus_message* call, const Reply::Writer& writer, uint64_t id) {
+    sd_bus_message* reply = nullptr;
+    int rc = sd_bus_message_new_method_return(call, &reply);
+    if (rc >= 0 && writer) rc = writer(reply);
+    if (rc >= 0) rc = sd_bus_send(bus_, reply, nullptr);
+    sd_bus_message_unref(reply);
+    if (rc < 0) {
+      log(LogLevel::Error, "Could not encode the answer to %s: %s", memberOf(call), std::string(strerror(-rc)));
+      sendErrorNow(call, BusError{kBusErrorFailed, "The answer could not be encoded."});
+    }
+    sd_bus_message_unref(call);
+    finishCall(id);
+  }
+
+  void sendError(sd_bus_message* call, const BusError& error, uint64_t id) {
+    sendErrorNow(call, error);
+    sd_bus_message_unref(call);
+    finishCall(id);
+  }
+
+ private:
+  static std::string memberOf(sd_bus_message* m) {
+    const char* member = sd_bus_message_get_member(m);
+    return member ? member : "?";
+  }
+
+  uint64_t now() const {
+    uint64_t t = 0;
+    sd_event_now(event_, CLOCK_MONOTONIC, &t);
+    return t;
+  }
+  static uint64_t toUsec(std::chrono::seconds s) { return static_cast<uint64_t>(s.count()) * 1000000u; }
+
+  int fail(const std::string& what, int rc) {
+    log(LogLevel::Fault, "Messaging: %s: %s", what, std::string(strerror(-rc)));
+    return 1;
+  }
+
+  int openBus() {
+    if (options_.bus == "system") return sd_bus_open_system(&bus_);
+    if (options_.bus == "session") return sd_bus_open_user(&bus_);
+    int rc = sd_bus_new(&bus_);
+    if (rc < 0) return rc;
+    if ((rc = sd_bus_set_address(bus_, options_.bus.c_str())) < 0) return rc;
+    if ((rc = sd_bus_set_bus_client(bus_, 1)) < 0) return rc;
+    return sd_bus_start(bus_);
+  }
+
+  void buildVTable() {
+    sd_bus_vtable start{};
+    start.type = _SD_BUS_VTABLE_START;
+    start.flags = 0;
+    start.x.start.element_size = sizeof(sd_bus_vtable);
+    start.x.start.features = _SD_BUS_VTABLE_PARAM_NAMES;
+    start.x.start.vtable_format_reference = &sd_bus_object_vtable_format;
+    vtable_.push_back(start);
+    for (const InterfaceMethod& m : options_.interface->methods) {
+      std::string names;
+      for (const auto& n : m.inNames) names.append(n).push_back('\0');
+      for (const auto& n : m.outNames) names.append(n).push_back('\0');
+      names_.push_back(std::move(names));
+    }
+    size_t i = 0;
+    for (const InterfaceMethod& m : options_.interface->methods) {
+      sd_bus_vtable v{};
+      v.type = _SD_BUS_VTABLE_METHOD;
+      // Admission is the operations' business (entitlements) and the bus policy's, not sd-bus's.
+      v.flags = SD_BUS_VTABLE_UNPRIVILEGED;
+      v.x.method.member = m.name.c_str();
+      v.x.method.signature = m.inSignature.c_str();
+      v.x.method.result = m.outSignature.c_str();
+      v.x.method.handler = &Core::onMethodCall;
+      v.x.method.offset = 0;
+      v.x.method.names = names_[i++].c_str();
+      vtable_.push_back(v);
+    }
+    sd_bus_vtable end{};
+    end.type = _SD_BUS_VTABLE_END;
+    vtable_.push_back(end);
+  }
+
+  void sendErrorNow(sd_bus_message* call, const BusError& error) {
+    sd_bus_error e = SD_BUS_ERROR_NULL;
+    sd_bus_error_set(&e, error.name.c_str(), error.message.c_str());
+    sd_bus_reply_method_error(call, &e);
+    sd_bus_error_free(&e);
+  }
+
+  void finishCall(uint64_t id) {
+    pending_.erase(id);
+    inFlight_.fetch_sub(1);
+    lastActivity_ = now();
+    if (draining_ && inFlight_.load() == 0) sd_event_exit(event_, 0);
+  }
+
+  std::optional<PeerCredentials> credentialsOf(const char* sender, int& dupedPidfd) {
+    sd_bus_message* reply = nullptr;
+    sd_bus_error error = SD_BUS_ERROR_NULL;
+    int rc = sd_bus_call_method(bus_, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+                                "GetConnectionCredentials", &error, &reply, "s", sender);
+    sd_bus_error_free(&error);
+    if (rc < 0) return std::nullopt;
+    PeerCredentials c;
+    bool haveUid = false, havePid = false;
+    if (sd_bus_message_enter_container(reply, 'a', "{sv}") >= 0) {
+      while (sd_bus_message_enter_container(reply, 'e', "sv") > 0) {
+        const char* key = nullptr;
+        sd_bus_message_read_basic(reply, 's', &key);
+        std::string k = key ? key : "";
+        if (k == "UnixUserID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
+          uint32_t v = 0;
+          haveUid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
+          c.uid = v;
+          sd_bus_message_exit_container(reply);
+        } else if (k == "ProcessID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
+          uint32_t v = 0;
+          havePid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
+          c.pid = static_cast<pid_t>(v);
+          sd_bus_message_exit_container(reply);
+        } else if (k == "ProcessFD" && sd_bus_message_enter_container(reply, 'v', "h") > 0) {
+          int fd = -1;
+          if (sd_bus_message_read_basic(reply, 'h', &fd) > 0 && fd >= 0) dupedPidfd = fcntl(fd, F_DUPFD_CLOEXEC, 3);
+          c.pidfd = dupedPidfd;
+          sd_bus_message_exit_container(reply);
+        } else {
+          sd_bus_message_skip(reply, "v");
+        }
+        sd_bus_message_exit_container(reply);
+      }
+      sd_bus_message_exit_container(reply);
+    }
+    sd_bus_message_unref(reply);
+    if (!haveUid || !havePid) return std::nullopt;
+    return c;
+  }
+
+  std::shared_ptr<Connection> connectionFor(const std::string& sender) {
+    auto it = connections_.find(sender);
+    if (it != connections_.end()) return it->second;
+    int pidfd = -1;
+    std::optional<PeerCredentials> credentials = credentialsOf(sender.c_str(), pidfd);
+    EntitlementLookup lookup;
+    if (credentials && options_.entitlementsForPeer) lookup = options_.entitlementsForPeer(*credentials);
+    if (pidfd >= 0) ::close(pidfd);
+    if (!credentials) log(LogLevel::Error, "No credentials for peer %s: it holds no entitlements", sender);
+    auto connection = std::make_shared<Connection>(sender, std::move(lookup));
+    std::shared_ptr<ListenerDelegate> delegate = owner_.delegate();
+    bool accepted = delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection);
+    if (!accepted) connection.reset();
+    connections_.emplace(sender, connection);
+    connectionCount_.store(connections_.size());
+    return connection;
+  }
+
+  static int onMethodCall(sd_bus_message* m, void* userdata, sd_bus_error*) {
+    auto* self = static_cast<Core*>(userdata);
+    return self->dispatch(m);
+  }
+
+  int dispatch(sd_bus_message* m) {
+    const char* senderRaw = sd_bus_message_get_sender(m);
+    std::string member = memberOf(m);
+    if (draining_) {
+      sendErrorNow(m, BusError{kBusErrorNoServer, "The service is shutting down."});
+      return 1;
+    }
+    if (!senderRaw) {
+      sendErrorNow(m, BusError{kBusErrorAccessDenied, "Calls must come through the bus."});
+      return 1;
+    }
+    std::shared_ptr<Connection> connection = connectionFor(senderRaw);
+    if (!connection || !connection->isResumed()) {
+      sendErrorNow(m, BusError{kBusErrorAccessDenied, "The connection was not accepted."});
+      return 1;
+    }
+    std::shared_ptr<const Interface> interface = connection->exportedInterface();
+    const InterfaceMethod* method = nullptr;
+    if (interface)
+      for (const auto& candidate : interface->methods)
+        if (candidate.name == member) method = &candidate;
+    if (!method) {
+      sendErrorNow(m, BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
+      return 1;
+    }
+    DecodedCall decoded;
+    try {
+      decoded = method->decode(m, connection->exportedObject());
+    } catch (const std::exception& e) {
+      decoded.error = BusError{kBusErrorFailed, std::string("The call could not be decoded: ") + e.what()};
+    }
+    if (decoded.error || !decoded.invocation) {
+      sendErrorNow(m, decoded.error.value_or(BusError{kBusErrorFailed, "The call could not be decoded."}));
+      return 1;
+    }
+    auto state = std::make_shared<Reply::State>();
+    state->core = weak_from_this();
+    state->call = sd_bus_message_ref(m);
+    state->id = ++nextId_;
+    pending_.emplace(state->id, state);
+    inFlight_.fetch_add(1);
+    lastActivity_ = now();
+    connection->queue()->async([connection, invocation = std::move(decoded.invocation), reply = Reply(state)] {
+      Connection::CurrentScope scope(connection.get());
+      try {
+        invocation(reply);
+      } catch (const std::exception& e) {
+        reply.fail(BusError{kBusErrorFailed, std::string("The operation failed: ") + e.what()});
+      }
+    });
+    return 1;
+  }
+
+  static int onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error*) {
+    auto* self = static_cast<Core*>(userdata);
+    const char *name = nullptr, *oldOwner = nullptr, *newOwner = nullptr;
+    if (sd_bus_message_read(m, "sss", &name, &oldOwner, &newOwner) < 0) return 0;
+    // A unique name never comes back: its connection ends with it. Work already queued finishes.
+    if (name && name[0] == ':' && newOwner && !*newOwner) {
+      self->connections_.erase(name);
+      self->connectionCount_.store(self->connections_.size());
+    }
+    return 0;
+  }
+
+  static int onPosted(sd_event_source*, int fd, uint32_t, void* userdata) {
+    auto* self = static_cast<Core*>(userdata);
+    uint64_t count = 0;
+    if (::read(fd, &count, sizeof count) < 0) {
+      // Spurious wake-up: nothing to read, nothing to do.
+    }
+    std::vector<std::function<void()>> work;
+    {
+      std::lock_guard lock(self->postMutex_);
+      work.swap(self->posted_);
+    }
+    for (auto& w : work) w();
+    return 0;
+  }
+
+  static int onSignal(sd_event_source*, const struct signalfd_siginfo* info, void* userdata) {
+    auto* self = static_cast<Core*>(userdata);
+    if (info->ssi_signo == SIGHUP) {
+      log(LogLevel::Default, "Reloading on SIGHUP");
+      if (self->options_.onReload) self->options_.onReload();
+      return 0;
+    }
+    self->beginDrain(info->ssi_signo == SIGTERM ? "SIGTERM" : "SIGINT");
+    return 0;
+  }
+
+  void beginDrain(const std::string& why) {
+    if (draining_) return;
+    draining_ = true;
+    log(LogLevel::Default, "Shutting down (%s) with %zu call(s) in flight", why, inFlight_.load());
+    if (options_.notifyReady) sd_notify(0, "STOPPING=1");
+    sd_bus_release_name(bus_, options_.serviceName.c_str());
+    if (inFlight_.load() == 0) {
+      sd_event_exit(event_, 0);
+      return;
+    }
+    sd_event_source* timer = nullptr;
+    if (sd_event_add_time_relative(event_, &timer, CLOCK_MONOTONIC, toUsec(options_.drainLimit), 0, &Core::onDrainLimit, this) >= 0)
+      sources_.push_back(timer);
+  }
+
+  static int onDrainLimit(sd_event_source*, uint64_t, void* userdata) {
+    auto* self = static_cast<Core*>(userdata);
+    log(LogLevel::Error, "Calls still in flight after the drain limit: failing %zu of them", self->pending_.size());
+    for (auto& [id, weak] : self->pending_)
+      if (auto state = weak.lock(); state && !state->done.exchange(true)) {
+        self->sendErrorNow(state->call, BusError{kBusErrorNoServer, "The service shut down before the operation finished."});
+        sd_bus_message_unref(state->call);
+        state->call = nullptr;
+      }
+    self->pending_.clear();
+    sd_event_exit(self->event_, 0);
+    return 0;
+  }
+
+  void armIdleTimer(uint64_t at) {
+    if (!idleTimer_) {
+      if (sd_event_add_time(event_, &idleTimer_, CLOCK_MONOTONIC, at, 0, &Core::onIdleTimer, this) >= 0) sources_.push_back(idleTimer_);
+      return;
+    }
+    sd_event_source_set_time(idleTimer_, at);
+    sd_event_source_set_enabled(idleTimer_, SD_EVENT_ONESHOT);
+  }
+
+  static int onIdleTimer(sd_event_source*, uint64_t, void* userdata) {
+    auto* self = static_cast<Core*>(userdata);
+    uint64_t limit = toUsec(*self->options_.exitOnIdle);
+    uint64_t t = self->now();
+    if (self->inFlight_.load() == 0 && t - self->lastActivity_ >= limit) {
+      self->beginDrain("idle");
+      return 0;
+    }
+    self->armIdleTimer(std::max(self->lastActivity_, t) + limit);
+    return 0;
+  }
+
+  ListenerOptions options_;
+  Listener& owner_;
+  sd_event* event_ = nullptr;
+  sd_bus* bus_ = nullptr;
+  sd_bus_slot* vtableSlot_ = nullptr;
+  sd_bus_slot* matchSlot_ = nullptr;
+  sd_event_source* idleTimer_ = nullptr;
+  std::vector<sd_event_source*> sources_;
+  std::vector<sd_bus_vtable> vtable_;
+  std::vector<std::string> names_;
+  int wakeFd_ = -1;
+  std::mutex postMutex_;
+  std::vector<std::function<void()>> posted_;
+  std::map<std::string, std::shared_ptr<Connection>> connections_;  // null: refused
+  std::atomic<size_t> connectionCount_{0};
+  std::map<uint64_t, std::weak_ptr<Reply::State>> pending_;
+  std::atomic<size_t> inFlight_{0};
+  uint64_t nextId_ = 0;
+  uint64_t lastActivity_ = 0;
+  bool draining_ = false;
+};
+
+Reply::State::~State() {
+  if (done.exchange(true) || !call) return;
+  // Dropped without an answer: the caller still gets one.
+  if (auto c = core.lock()) {
+    c->post([c, call = call, id = id] {
+      c->sendError(call, BusError{kBusErrorFailed, "The operation ended without an answer."}, id);
+    });
+  }
+}
+
+void Reply::send(Writer writer) const {
+  if (state_->done.exchange(true)) return;
+  if (auto core = state_->core.lock())
+    core->post([core, call = state_->call, writer = std::move(writer), id = state_->id] { core->sendReturn(call, writer, id); });
+}
+
+void Reply::fail(BusError error) const {
+  if (state_->done.exchange(true)) return;
+  if (auto core = state_->core.lock())
+    core->post([core, call = state_->call, error = std::move(error), id = state_->id] { core->sendError(call, error, id); });
+}
+
+void Listener::configure(ListenerOptions options) { configuredOptions() = std::move(options); }
+
+Listener& Listener::serviceListener() {
+  static Listener listener;
+  return listener;
+}
+
+void Listener::blockSignals() {
+  sigset_t set;
+  sigemptyset(&set);
+  sigaddset(&set, SIGTERM);
+  sigaddset(&set, SIGINT);
+  sigaddset(&set, SIGHUP);
+  pthread_sigmask(SIG_BLOCK, &set, nullptr);
+}
+
+void Listener::setDelegate(std::shared_ptr<ListenerDelegate> delegate) {
+  std::lock_guard lock(mutex_);
+  delegate_ = std::move(delegate);
+}
+
+std::shared_ptr<ListenerDelegate> Listener::delegate() const {
+  std::lock_guard lock(mutex_);
+  return delegate_;
+}
+
+int Listener::resume() {
+  std::shared_ptr<Core> core;
+  {
+    std::lock_guard lock(mutex_);
+    core_ = std::make_shared<Core>(configuredOptions(), *this);
+    core = core_;
+  }
+  return core->run();
+}
+
+void Listener::stop() {
+  std::lock_guard lock(mutex_);
+  if (core_) core_->requestStop();
+}
+
+size_t Listener::connectionCount() const {
+  std::lock_guard lock(mutex_);
+  return core_ ? core_->connectionCount() : 0;
+}
+
+size_t Listener::callsInFlight() const {
+  std::lock_guard lock(mutex_);
+  return core_ ? core_->callsInFlight() : 0;
+}
+
+}  // namespace platform

@@ -1,0 +1,22 @@
+// zlkad: the process entry. Everything after start-up runs on the listener's loop and the queues.
+#include <unistd.h>
+
+#include "platform/listener.h"
+#include "service/daemon_setup.h"
+#include "service/service_delegate.h"
+
+int main(int argc, char** argv) {
+  // Before any thread exists, so that every thread inherits the mask and the loop gets the signals.
+  platform::Listener::blockSignals();
+  if (std::optional<int> status = setUpDaemon(argc, argv)) return *status;
+
+  auto delegate = std::make_shared<ServiceDelegate>();
+  platform::Listener& listener = platform::Listener::serviceListener();
+  listener.setDelegate(delegate);
+  int status = listener.resume();
+  // Calls still blocked after the drain limit were answered already; do not wait for them.
+  if (listener.callsInFlight() > 0) _exit(status);
+  listener.setDelegate(nullptr);
+  delegate.reset();
+  return status;
+}

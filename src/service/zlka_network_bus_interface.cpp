@@ -1,0 +1,119 @@
+#include "service/zlka_network_bus_interface.h"
+
+#include "network/zlka_network_protocol.h"
+#include "platform/bus_values.h"
+#include "platform/json.h"
+
+using platform::BusError;
+using platform::Data;
+using platform::DecodedCall;
+using platform::Reply;
+using platform::Value;
+
+namespace {
+
+struct TokenArguments {
+  std::optional<Data> token;
+  std::optional<std::string> uuid;
+  std::optional<std::string> requestedLocale;
+  std::optional<platform::Dictionary> requestInfo;
+};
+
+int readString(sd_bus_message* m, std::optional<std::string>& out) {
+  const char* s = nullptr;
+  int r = sd_bus_message_read_basic(m, 's', &s);
+  if (r > 0) out = s ? s : "";
+  return r;
+}
+
+std::optional<BusError> readArguments(sd_bus_message* m, bool withLocale, TokenArguments& args) {
+  std::map<std::string, std::string> signatures = {{"token", "ay"}, {"uuid", "s"}};
+  if (withLocale) {
+    signatures.emplace("requestedLocale", "s");
+    signatures.emplace("requestInfo", "a{sv}");
+  }
+  return platform::readKnownDictionary(m, signatures, [&](const std::string& key, sd_bus_message* message) {
+    if (key == "uuid") return readString(message, args.uuid);
+    if (key == "requestedLocale") return readString(message, args.requestedLocale);
+    Value value;
+    int r = platform::readBusValue(message, value);
+    if (r < 0) return r;
+    if (key == "token") args.token = *value.data();
+    else args.requestInfo = *value.dictionary();
+    return r;
+  });
+}
+
+std::shared_ptr<ZLKANetworkProtocol> exported(const std::shared_ptr<void>& object) {
+  return std::static_pointer_cast<ZLKANetworkProtocol>(object);
+}
+
+DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& object) {
+  TokenArguments args;
+  if (auto error = readArguments(m, true, args)) return {nullptr, error};
+  return {[object, args](Reply reply) {
+            std::optional<platform::Locale> locale;
+            if (args.requestedLocale) locale = platform::Locale(*args.requestedLocale);
+            exported(object)->requestMetadataForToken(
+                args.token, args.uuid, locale, args.requestInfo,
+                [reply](std::optional<std::string> ppid, std::optional<platform::Locale> answered,
+                        std::optional<platform::Dictionary> metadata, std::optional<platform::Error> error) {
+                  if (error || !ppid || !answered || !metadata)
+                    return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+                  std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
+                  reply.send([ppid = *ppid, locale = answered->localeIdentifier(), json](sd_bus_message* r) {
+                    return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
+                  });
+                });
+          },
+          std::nullopt};
+}
+
+DecodedCall decodeActivation(sd_bus_message* m, const std::shared_ptr<void>& object) {
+  TokenArguments args;
+  if (auto error = readArguments(m, false, args)) return {nullptr, error};
+  return {[object, args](Reply reply) {
+            exported(object)->requestActivationForToken(
+                args.token, args.uuid, [reply](std::optional<Data> newToken, std::optional<platform::Error> error) {
+                  if (error || !newToken)
+                    return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+                  reply.send([token = *newToken](sd_bus_message* r) {
+                    return sd_bus_message_append_array(r, 'y', token.bytes() ? token.bytes() : reinterpret_cast<const uint8_t*>(""),
+                                                       token.length());
+                  });
+                });
+          },
+          std::nullopt};
+}
+
+DecodedCall decodeConfirmation(sd_bus_message* m, const std::shared_ptr<void>& object) {
+  TokenArguments args;
+  if (auto error = readArguments(m, false, args)) return {nullptr, error};
+  return {[object, args](Reply reply) {
+            exported(object)->confirmActivationForToken(args.token, args.uuid, [reply](std::optional<platform::Error> error) {
+              if (error) return reply.fail(busErrorForError(*error));
+              reply.send(nullptr);
+            });
+          },
+          std::nullopt};
+}
+
+}  // namespace
+
+std::shared_ptr<const platform::Interface> ZLKANetworkProtocolInterface() {
+  static const std::shared_ptr<const platform::Interface> interface = std::make_shared<const platform::Interface>(platform::Interface{
+      kZLKAInterfaceName,
+      {
+          {"RequestMetadataForToken", "a{sv}", "sss", {"arguments"}, {"ppid", "locale", "metadata"}, decodeMetadata},
+          {"RequestActivationForToken", "a{sv}", "ay", {"arguments"}, {"token"}, decodeActivation},
+          {"ConfirmActivationForToken", "a{sv}", "", {"arguments"}, {}, decodeConfirmation},
+      }});
+  return interface;
+}
+
+BusError busErrorForError(const platform::Error& error) {
+  static const char* const names[] = {"Unknown", "MissingEntitlement", "InvalidParameter", "Internal", "Network", "Server"};
+  int64_t code = error.code();
+  std::string name = (code <= -1 && code >= -6) ? names[-code - 1] : "Unknown";
+  return BusError{kZLKAErrorPrefix + name, error.localizedDescription()};
+}
