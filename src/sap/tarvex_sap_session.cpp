@@ -45,6 +45,15 @@ TarvexSAPSession::OpenCompletion once(TarvexSAPSession::OpenCompletion completio
   };
 }
 
+// A delegate that answers twice must not feed a second continuation into the open: the duplicate
+// would find the state moved on and report the open as failed while it goes on to succeed.
+TarvexSAPDataCompletion firstAnswerOnly(TarvexSAPDataCompletion answer) {
+  auto answered = std::make_shared<std::atomic<bool>>(false);
+  return [answered, answer = std::move(answer)](std::optional<Data> data, std::optional<Error> error) {
+    if (!answered->exchange(true)) answer(std::move(data), std::move(error));
+  };
+}
+
 std::string className(const std::optional<Value>& v) { return v ? v->typeName() : "(null)"; }
 
 }  // namespace
@@ -140,12 +149,12 @@ void TarvexSAPSession::_open(OpenCompletion completion) {
     auto delegate = self->delegate_.lock();
     if (!delegate) return;
     delegate->sessionRequestCertificateWithCompletionHandler(
-        *self, [self, generation, completion](std::optional<Data> certificate, std::optional<Error> error) {
+        *self, firstAnswerOnly([self, generation, completion](std::optional<Data> certificate, std::optional<Error> error) {
           self->internalQueue_->async([self, generation, completion, certificate = std::move(certificate),
                                        error = std::move(error)]() mutable {
             self->_receivedCertificate(generation, std::move(certificate), std::move(error), completion);
           });
-        });
+        }));
   });
 }
 
@@ -193,12 +202,12 @@ void TarvexSAPSession::_receivedCertificate(uint64_t generation, std::optional<D
     auto delegate = self->delegate_.lock();
     if (!delegate) return;
     delegate->sessionRequestHandshakeWithServerCompletionHandler(
-        *self, request, [self, generation, completion](std::optional<Data> response, std::optional<Error> error) {
+        *self, request, firstAnswerOnly([self, generation, completion](std::optional<Data> response, std::optional<Error> error) {
           self->internalQueue_->async([self, generation, completion, response = std::move(response),
                                        error = std::move(error)]() mutable {
             self->_receivedHandshake(generation, std::move(response), std::move(error), completion);
           });
-        });
+        }));
   });
 }
 
