@@ -37,7 +37,8 @@ std::optional<int> parse(int argc, char** argv, CommandLine& cl) {
   app.add_option("--log", cl.logBackend, "Where log entries go (default: the journal when stderr is connected to it)")
       ->check(CLI::IsMember({"journal", "stderr"}));
   app.add_option("--log-level", cl.logLevel, "Lowest level written; overrides log.level of the configuration")
-      ->check(CLI::IsMember({"debug", "info", "default", "error", "fault"}));
+      ->check(CLI::IsMember({"debug", "info", "default", "error", "fault"}))
+      ->multi_option_policy(CLI::MultiOptionPolicy::TakeLast);
   app.add_option("--exit-on-idle", cl.exitOnIdle,
                  "Exit after this many seconds with no call in flight and no new call (0: never)")
       ->check(CLI::Range(0u, 86400u * 365u));
@@ -45,7 +46,8 @@ std::optional<int> parse(int argc, char** argv, CommandLine& cl) {
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
-    return app.exit(e);
+    int status = app.exit(e);  // prints the help, the version or the mistake
+    return status == 0 ? 0 : 2;
   }
   return std::nullopt;
 }
