@@ -1,6 +1,8 @@
 #include "sap/tarvex_sap_session.h"
 
+#include <algorithm>
 #include <atomic>
+#include <cmath>
 #include <chrono>
 #include <cstdlib>
 #include <ctime>
@@ -25,7 +27,11 @@ double now() {
 }
 
 std::string formatDate(double secondsSince1970) {
-  std::time_t t = static_cast<std::time_t>(secondsSince1970);
+  // The TTL comes from the server: a huge one must not overflow the conversion to time_t.
+  constexpr double kEarliest = -62135596800.0;  // 0001-01-01
+  constexpr double kLatest = 253402300799.0;    // 9999-12-31 23:59:59
+  const double clamped = std::isnan(secondsSince1970) ? 0.0 : std::clamp(secondsSince1970, kEarliest, kLatest);
+  std::time_t t = static_cast<std::time_t>(clamped);
   std::tm tm{};
   gmtime_r(&t, &tm);
   char buf[40];
