@@ -1,0 +1,81 @@
+// BusCaller: one bus connection, served by an sd-event loop on a thread of its own, that sends
+// method calls to the daemon's object and hands each answer to a handler on that thread.
+//
+// sd-bus objects are not thread-safe, so the connection is touched only on the event thread:
+// calls from other threads are queued to it (through an eventfd). Every call's handler runs exactly
+// once, on the event thread: with the reply, or with an error (a D-Bus error reply, a send failure,
+// the timeout, or Cancelled when the caller is closed first). A blocking call made on the event
+// thread itself (from a handler) is sent with sd_bus_call there, holding up other answers until it
+// returns; from any other thread it waits for its handler to have run.
+#pragma once
+
+#include <systemd/sd-bus.h>
+#include <systemd/sd-event.h>
+
+#include <chrono>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <unordered_set>
+
+#include "client/result.h"
+
+namespace zlka_client {
+
+class BusCaller : public std::enable_shared_from_this<BusCaller> {
+ public:
+  // Appends the call's arguments; a negative errno refuses the call.
+  using ArgumentWriter = std::function<int(sd_bus_message* call)>;
+  // Exactly one of reply and error is non-null.
+  using ReplyHandler = std::function<void(sd_bus_message* reply, const platform::Error* error)>;
+
+  // `bus`: "system", "session" or a D-Bus address ("unix:path=/run/x"). Waits until the bus has
+  // accepted the connection, so that an unusable bus fails here (ConnectionFailed).
+  static Result<std::shared_ptr<BusCaller>> open(const std::string& bus, std::chrono::microseconds callTimeout);
+  ~BusCaller();
+  BusCaller(const BusCaller&) = delete;
+  BusCaller& operator=(const BusCaller&) = delete;
+
+  void callAsync(std::string method, ArgumentWriter write, ReplyHandler handler);
+  void callAndWait(const std::string& method, const ArgumentWriter& write, const ReplyHandler& handler);
+  // Hands `error` to `handler` on the event thread, for calls refused before they are sent.
+  void failAsync(platform::Error error, ReplyHandler handler);
+
+  // Stops the loop; calls not yet answered get Cancelled. Waits for the thread to end, unless
+  // called on it (from a handler), in which case the thread ends once the handler returns.
+  void close();
+  bool onEventThread() const { return std::this_thread::get_id() == threadId_; }
+
+ private:
+  struct Pending;
+  using Job = std::function<void(bool cancelled)>;
+
+  BusCaller(sd_bus* bus, std::chrono::microseconds callTimeout);
+  int start();
+  bool post(Job job);
+  void run();
+  void finish();
+  void send(const std::string& method, const ArgumentWriter& write, ReplyHandler handler);
+  void sendAndWait(const std::string& method, const ArgumentWriter& write, const ReplyHandler& handler);
+  static int onWake(sd_event_source* source, int fd, uint32_t events, void* userdata) noexcept;
+  static int onReply(sd_bus_message* reply, void* userdata, sd_bus_error* error) noexcept;
+
+  sd_bus* bus_ = nullptr;
+  sd_event* event_ = nullptr;
+  sd_event_source* wakeSource_ = nullptr;
+  int wakeFd_ = -1;
+  uint64_t timeoutUsec_;
+
+  std::mutex mutex_;  // guards jobs_ and closing_
+  std::deque<Job> jobs_;
+  bool closing_ = false;
+
+  std::unordered_set<Pending*> pending_;  // event thread only
+  std::thread thread_;
+  std::thread::id threadId_;
+};
+
+}  // namespace zlka_client

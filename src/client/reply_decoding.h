@@ -1,0 +1,31 @@
+// Reading the daemon's answers: the out arguments of each method, checked against the signature it
+// promises. An answer of another form is a MalformedReply client error.
+#pragma once
+
+#include <systemd/sd-bus.h>
+
+#include <string>
+
+#include "client/result.h"
+#include "platform/data.h"
+#include "platform/value.h"
+
+namespace zlka_client {
+
+// RequestMetadataForToken answers "sss": ppid, locale identifier, metadata as compact JSON text.
+struct MetadataReply {
+  std::string ppid;
+  std::string locale;
+  platform::Value metadata;  // the JSON text parsed (an object or an array)
+};
+
+// ConfirmActivationForToken answers with nothing.
+struct Confirmation {};
+
+Result<MetadataReply> decodeMetadataReply(sd_bus_message* reply);
+Result<platform::Data> decodeActivationReply(sd_bus_message* reply);  // "ay": the new token
+Result<Confirmation> decodeConfirmationReply(sd_bus_message* reply);  // ""
+// Any answer: each out argument read as a Value (variants unwrapped, byte arrays as Data).
+Result<platform::Array> decodeAnyReply(sd_bus_message* reply);
+
+}  // namespace zlka_client

@@ -1,0 +1,78 @@
+// ZLKAClient: the daemon's three token operations, called over D-Bus.
+//
+//   auto client = zlka_client::ZLKAClient::connect({.bus = "system"});
+//   if (!client) fail(client.error());
+//   auto answer = client.value()->requestMetadata({.token = token, .requestedLocale = "en_US"});
+//
+// Each operation comes in a blocking form, which returns its Result, and an asynchronous form,
+// whose callback runs exactly once on the client's own event thread (a thread with one bus
+// connection and an sd-event loop, owned by the client). Every method may be called from any
+// thread, callbacks included; a blocking call made from a callback holds up the other callbacks
+// until it returns. Calls time out after ClientOptions::callTimeout, five minutes by default, since
+// an operation may wait for a session to open. Destroying the client cancels the calls still
+// unanswered: their callbacks get a Cancelled error. Callbacks must not throw.
+//
+// Arguments left out are not sent at all (see request_encoding.h); errors are described in
+// client_error.h.
+#pragma once
+
+#include <systemd/sd-bus.h>
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "client/client_error.h"
+#include "client/reply_decoding.h"
+#include "client/request_encoding.h"
+#include "client/result.h"
+
+namespace zlka_client {
+
+class BusCaller;
+
+struct ClientOptions {
+  std::string bus = "system";  // "system", "session", or a D-Bus address such as "unix:path=/run/x"
+  std::chrono::microseconds callTimeout = std::chrono::minutes(5);
+};
+
+class ZLKAClient {
+ public:
+  using MetadataCallback = std::function<void(Result<MetadataReply>)>;
+  using ActivationCallback = std::function<void(Result<platform::Data>)>;
+  using ConfirmationCallback = std::function<void(Result<Confirmation>)>;
+  using RawCallback = std::function<void(Result<platform::Array>)>;
+  // Appends all of a raw call's arguments to the message; a negative errno refuses the call.
+  using ArgumentWriter = std::function<int(sd_bus_message* call)>;
+
+  // Connects to the bus (not yet to the daemon, which is first reached by a call). Fails with
+  // ConnectionFailed when the bus cannot be connected to.
+  static Result<std::unique_ptr<ZLKAClient>> connect(const ClientOptions& options = {});
+  ~ZLKAClient();
+  ZLKAClient(const ZLKAClient&) = delete;
+  ZLKAClient& operator=(const ZLKAClient&) = delete;
+
+  // RequestMetadataForToken: ppid, locale identifier and metadata.
+  Result<MetadataReply> requestMetadata(const MetadataArguments& arguments);
+  void requestMetadataAsync(const MetadataArguments& arguments, MetadataCallback callback);
+
+  // RequestActivationForToken: the new token.
+  Result<platform::Data> requestActivation(const TokenArguments& arguments);
+  void requestActivationAsync(const TokenArguments& arguments, ActivationCallback callback);
+
+  // ConfirmActivationForToken: nothing but success.
+  Result<Confirmation> confirmActivation(const TokenArguments& arguments);
+  void confirmActivationAsync(const TokenArguments& arguments, ConfirmationCallback callback);
+
+  // Any method of the daemon's interface with arguments written by `write` (for example an a{sv}
+  // with a key of the wrong type); the answer's arguments as Values.
+  Result<platform::Array> callRaw(const std::string& method, const ArgumentWriter& write);
+  void callRawAsync(const std::string& method, ArgumentWriter write, RawCallback callback);
+
+ private:
+  explicit ZLKAClient(std::shared_ptr<BusCaller> caller) : caller_(std::move(caller)) {}
+  std::shared_ptr<BusCaller> caller_;
+};
+
+}  // namespace zlka_client

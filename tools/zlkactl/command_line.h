@@ -1,0 +1,56 @@
+// zlkactl's command line: what the user asked for, parsed with CLI11.
+//
+//   zlkactl [--bus system|session|ADDRESS] [--json] metadata|activate|confirm
+//           [--token-file PATH | --token-hex HEX | --token-base64 B64] [--uuid UUID]
+//           [--locale ID] [--request-info JSON]          (the last two for metadata only)
+//   zlkactl [--config PATH] defaults read [KEY] | write KEY VALUE | delete KEY
+//
+// An option left out leaves the argument absent: the daemon is sent no key for it.
+#pragma once
+
+#include <optional>
+#include <ostream>
+#include <string>
+
+#include "client/request_encoding.h"
+
+namespace zlkactl {
+
+// Exit statuses, one per class of failure.
+enum ExitStatus : int {
+  kExitSuccess = 0,
+  kExitOperationFailed = 1,  // the daemon (or the bus) answered with an error; settings not written
+  kExitUsage = 2,            // bad arguments, unreadable or malformed input, unusable configuration
+  kExitUnreachable = 3,      // the bus cannot be connected to, or the service does not answer
+};
+
+enum class Command { Metadata, Activate, Confirm, DefaultsRead, DefaultsWrite, DefaultsDelete };
+
+inline constexpr char kDefaultConfigPath[] = "/etc/zlka/zlkad.toml";
+
+struct Invocation {
+  Command command = Command::Metadata;
+  std::string bus = "system";
+  bool json = false;
+  std::string configPath = kDefaultConfigPath;
+  // Operations: exactly what was given on the command line.
+  std::optional<std::string> tokenFile, tokenHex, tokenBase64;
+  std::optional<std::string> uuid, locale, requestInfo;
+  // defaults
+  std::optional<std::string> key, value;
+};
+
+// Either an invocation to run, or the exit status after help (0, printed on `out`) or a usage
+// error (kExitUsage, printed on `err`).
+struct ParsedCommandLine {
+  std::optional<Invocation> invocation;
+  int exitStatus = kExitSuccess;
+};
+ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostream& out, std::ostream& err);
+
+// The call arguments of an operation invocation, reading the token from whichever source was
+// given; nullopt with *error set for unusable input (a usage error).
+std::optional<zlka_client::MetadataArguments> metadataArguments(const Invocation& invocation, std::string* error);
+std::optional<zlka_client::TokenArguments> tokenArguments(const Invocation& invocation, std::string* error);
+
+}  // namespace zlkactl

@@ -1,0 +1,111 @@
+#include "zlkactl/token_input.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <vector>
+
+#include "client/request_encoding.h"
+#include "platform/base64.h"
+#include "platform/json.h"
+
+namespace zlkactl {
+
+namespace {
+
+int hexDigit(char c) {
+  if (c >= '0' && c <= '9') return c - '0';
+  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+  return -1;
+}
+
+template <class T>
+std::optional<T> fail(std::string* error, std::string message) {
+  if (error) *error = std::move(message);
+  return std::nullopt;
+}
+
+class FileDescriptor {
+ public:
+  explicit FileDescriptor(int fd) : fd_(fd) {}
+  ~FileDescriptor() {
+    if (fd_ >= 0) ::close(fd_);
+  }
+  FileDescriptor(const FileDescriptor&) = delete;
+  FileDescriptor& operator=(const FileDescriptor&) = delete;
+  int get() const { return fd_; }
+
+ private:
+  int fd_;
+};
+
+}  // namespace
+
+std::optional<platform::Data> parseHexToken(std::string_view text, std::string* error) {
+  std::vector<uint8_t> bytes;
+  bytes.reserve(text.size() / 2);
+  for (size_t i = 0; i < text.size(); ++i) {
+    if (hexDigit(text[i]) < 0)
+      return fail<platform::Data>(error, "--token-hex: character " + std::to_string(i + 1) + " is not a hex digit");
+  }
+  if (text.size() % 2 != 0) return fail<platform::Data>(error, "--token-hex: an odd number of hex digits");
+  for (size_t i = 0; i < text.size(); i += 2)
+    bytes.push_back(static_cast<uint8_t>(hexDigit(text[i]) << 4 | hexDigit(text[i + 1])));
+  return platform::Data(std::move(bytes));
+}
+
+std::optional<platform::Data> parseBase64Token(std::string_view text, std::string* error) {
+  if (auto data = platform::base64DecodeStrict(text)) return data;
+  return fail<platform::Data>(error, "--token-base64: not valid base64 (standard alphabet, '=' padding, no white space)");
+}
+
+std::optional<platform::Data> readTokenFile(const std::filesystem::path& path, std::string* error) {
+  auto failure = [&](int e) { return fail<platform::Data>(error, "--token-file: cannot read " + path.string() + ": " + std::strerror(e)); };
+  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (fd.get() < 0) return failure(errno);
+  std::vector<uint8_t> bytes;
+  uint8_t buffer[8192];
+  for (;;) {
+    ssize_t n = ::read(fd.get(), buffer, sizeof buffer);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return failure(errno);
+    if (n == 0) break;
+    bytes.insert(bytes.end(), buffer, buffer + n);
+    if (bytes.size() > kMaxTokenFileSize)
+      return fail<platform::Data>(error, "--token-file: " + path.string() + " is larger than " + std::to_string(kMaxTokenFileSize) + " bytes");
+  }
+  return platform::Data(std::move(bytes));
+}
+
+std::optional<platform::Dictionary> parseRequestInfo(std::string_view json, std::string* error) {
+  std::string problem;
+  std::optional<platform::Value> value = platform::json::parse(json, &problem);
+  if (!value) return fail<platform::Dictionary>(error, "--request-info: not valid JSON: " + problem);
+  if (!value->dictionary()) return fail<platform::Dictionary>(error, "--request-info: must be a JSON object, not an array");
+  if (auto reason = zlka_client::unsendableReason(*value, "requestInfo")) return fail<platform::Dictionary>(error, "--request-info: " + *reason);
+  return *value->dictionary();
+}
+
+platform::Value parseSettingsValue(std::string_view text) {
+  // The JSON parser takes only objects and arrays at the top: wrap the text as the sole member of
+  // an array, which also accepts scalars and refuses "1,2" (two members).
+  std::optional<platform::Value> wrapped = platform::json::parse("[" + std::string(text) + "]");
+  if (wrapped && wrapped->count() == 1) return wrapped->array()->front();
+  return platform::Value(std::string(text));
+}
+
+std::string hexString(const platform::Data& data) {
+  static constexpr char digits[] = "0123456789abcdef";
+  std::string out;
+  out.reserve(data.length() * 2);
+  for (uint8_t byte : data.span()) {
+    out.push_back(digits[byte >> 4]);
+    out.push_back(digits[byte & 0x0F]);
+  }
+  return out;
+}
+
+}  // namespace zlkactl
