@@ -1,0 +1,194 @@
+#include "devserver/fault_table.h"
+
+#include <algorithm>
+#include <stdexcept>
+
+namespace devserver {
+
+using nlohmann::json;
+
+namespace {
+
+[[noreturn]] void invalid(const std::string& member, const std::string& what) {
+  throw std::invalid_argument("\"" + member + "\" " + what);
+}
+
+int64_t integerMember(const json& value, const std::string& member, int64_t low, int64_t high) {
+  if (!value.is_number_integer()) {
+    invalid(member, "must be an integer");
+  }
+  // Unsigned values above INT64_MAX would wrap: judge them before converting.
+  if (value.is_number_unsigned() && value.get<uint64_t>() > static_cast<uint64_t>(high)) {
+    invalid(member, "must be at most " + std::to_string(high));
+  }
+  const auto number = value.get<int64_t>();
+  if (number < low || number > high) {
+    invalid(member, "must be between " + std::to_string(low) + " and " + std::to_string(high));
+  }
+  return number;
+}
+
+std::size_t slot(Endpoint endpoint) { return static_cast<std::size_t>(endpoint); }
+
+const char* signatureName(SignatureFault mode) {
+  switch (mode) {
+    case SignatureFault::valid:
+      return "valid";
+    case SignatureFault::missing:
+      return "missing";
+    case SignatureFault::corrupt:
+      return "corrupt";
+  }
+  return "";
+}
+
+}  // namespace
+
+FaultRule parseFaultRule(const json& document) {
+  if (!document.is_object()) {
+    throw std::invalid_argument("a fault must be a JSON object");
+  }
+  FaultRule rule;
+  Fault& fault = rule.fault;
+  bool endpointGiven = false;
+  bool faultGiven = false;
+  for (const auto& [member, value] : document.items()) {
+    if (member == "endpoint") {
+      if (!value.is_string()) {
+        invalid(member, "must be a string");
+      }
+      const auto& name = value.get_ref<const std::string&>();
+      if (name != "*") {
+        rule.endpoint = endpointNamed(name);
+        if (!rule.endpoint) {
+          invalid(member,
+                  "must be \"setup.crt\", \"sapSession\", \"queryProductPlan\", "
+                  "\"activateAccessory\", \"ackAccessory\" or \"*\"");
+        }
+      }
+      endpointGiven = true;
+      continue;
+    }
+    if (member == "remaining") {
+      fault.remaining = integerMember(value, member, 1, INT64_MAX);
+      continue;
+    }
+    faultGiven = true;
+    if (member == "status") {
+      fault.status = static_cast<int>(integerMember(value, member, 200, 599));
+    } else if (member == "delay_ms") {
+      const int64_t ms = integerMember(value, member, 0, INT64_MAX);
+      fault.delay = std::min(std::chrono::milliseconds(ms), kLongestFaultDelay);
+    } else if (member == "body") {
+      if (!value.is_string()) {
+        invalid(member, "must be a string");
+      }
+      fault.body = value.get<std::string>();
+    } else if (member == "signature") {
+      const std::string mode = value.is_string() ? value.get<std::string>() : "";
+      if (mode == "valid") {
+        fault.signature = SignatureFault::valid;
+      } else if (mode == "missing") {
+        fault.signature = SignatureFault::missing;
+      } else if (mode == "corrupt") {
+        fault.signature = SignatureFault::corrupt;
+      } else {
+        invalid(member, "must be \"valid\", \"missing\" or \"corrupt\"");
+      }
+    } else if (member == "drop") {
+      if (!value.is_boolean()) {
+        invalid(member, "must be true or false");
+      }
+      fault.drop = value.get<bool>();
+    } else if (member == "session_validity") {
+      fault.sessionValidity = value;
+    } else if (member == "session_info") {
+      if (!value.is_string()) {
+        invalid(member, "must be a string");
+      }
+      fault.sessionInfo = value.get<std::string>();
+    } else {
+      throw std::invalid_argument("unknown member \"" + member + "\"");
+    }
+  }
+  if (!endpointGiven) {
+    invalid("endpoint", "is required");
+  }
+  if (!faultGiven) {
+    throw std::invalid_argument(
+        "no fault given: set at least one of \"status\", \"delay_ms\", \"body\", "
+        "\"signature\", \"drop\", \"session_validity\", \"session_info\"");
+  }
+  return rule;
+}
+
+json faultRuleToJSON(const FaultRule& rule) {
+  const Fault& fault = rule.fault;
+  json out = json::object();
+  out["endpoint"] = rule.endpoint ? std::string(endpointName(*rule.endpoint)) : "*";
+  if (fault.status) {
+    out["status"] = *fault.status;
+  }
+  if (fault.delay.count() > 0) {
+    out["delay_ms"] = fault.delay.count();
+  }
+  if (fault.body) {
+    out["body"] = *fault.body;
+  }
+  if (fault.signature) {
+    out["signature"] = signatureName(*fault.signature);
+  }
+  if (fault.drop) {
+    out["drop"] = true;
+  }
+  if (fault.sessionValidity) {
+    out["session_validity"] = *fault.sessionValidity;
+  }
+  if (fault.sessionInfo) {
+    out["session_info"] = *fault.sessionInfo;
+  }
+  if (fault.remaining) {
+    out["remaining"] = *fault.remaining;
+  }
+  return out;
+}
+
+void FaultTable::set(FaultRule rule) {
+  std::lock_guard lock(mutex_);
+  (rule.endpoint ? byEndpoint_[slot(*rule.endpoint)] : everyEndpoint_) = std::move(rule.fault);
+}
+
+void FaultTable::clear() {
+  std::lock_guard lock(mutex_);
+  byEndpoint_.fill(std::nullopt);
+  everyEndpoint_.reset();
+}
+
+std::optional<Fault> FaultTable::take(Endpoint endpoint) {
+  std::lock_guard lock(mutex_);
+  std::optional<Fault>& entry = byEndpoint_[slot(endpoint)] ? byEndpoint_[slot(endpoint)] : everyEndpoint_;
+  if (!entry) {
+    return std::nullopt;
+  }
+  Fault fault = *entry;
+  if (entry->remaining && --*entry->remaining == 0) {
+    entry.reset();
+  }
+  return fault;
+}
+
+json FaultTable::toJSON() const {
+  std::lock_guard lock(mutex_);
+  json out = json::array();
+  for (const Endpoint endpoint : kAllEndpoints) {
+    if (const auto& fault = byEndpoint_[slot(endpoint)]) {
+      out.push_back(faultRuleToJSON(FaultRule{endpoint, *fault}));
+    }
+  }
+  if (everyEndpoint_) {
+    out.push_back(faultRuleToJSON(FaultRule{std::nullopt, *everyEndpoint_}));
+  }
+  return out;
+}
+
+}  // namespace devserver
