@@ -50,9 +50,9 @@ bool hasControlCharacters(const std::string& s) {
   return false;
 }
 
-void appendNumber(std::string& out, const char* spec, const LogArg::Storage& arg) {
+void appendNumber(std::string& out, const char* directive, const LogArg::Storage& arg) {
   char buf[128];
-  std::string f(spec);
+  std::string f(directive);
   char conv = f.back();
   // Re-emit with a length modifier that matches how the argument is held.
   std::string base = f.substr(0, f.size() - 1);
@@ -252,9 +252,9 @@ std::string formatLogMessage(std::string_view format, std::span<const LogArg> ar
       i = close + 1;
     }
     // flags, width, precision, length modifiers
-    std::string spec = "%";
-    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos) spec += format[i++];
-    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos) spec += format[i++];
+    std::string directive = "%";
+    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos) directive += format[i++];
+    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos) directive += format[i++];
     if (i >= format.size()) {
       out.append(format.substr(start));
       break;
@@ -273,12 +273,12 @@ std::string formatLogMessage(std::string_view format, std::span<const LogArg> ar
       out += "<private>";
       continue;
     }
-    spec += conv;
+    directive += conv;
     switch (conv) {
       case '@':
       case 's': appendObject(out, arg); break;
       case 'p': appendPointer(out, arg); break;
-      default: appendNumber(out, spec.c_str(), arg); break;
+      default: appendNumber(out, directive.c_str(), arg); break;
     }
   }
   return out;
