@@ -12,7 +12,8 @@ using platform::LogLevel;
 namespace {
 
 std::vector<platform::LogEntry>* captureAll() {
-  auto* entries = new std::vector<platform::LogEntry>;
+  static std::vector<platform::LogEntry> storage;
+  auto* entries = &storage;
   platform::configureLog({LogLevel::Debug, false, platform::LogBackend::Stderr, "test"});
   platform::setLogSink([entries](const platform::LogEntry& e) { entries->push_back(e); });
   return entries;
