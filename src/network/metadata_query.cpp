@@ -52,7 +52,9 @@ void ZLKANetwork::requestMetadataForToken(const std::optional<Data>& token, cons
       return fail(ZLKAErrorServer);
     }
     if (!locale->string() || !platform::isAvailableLocaleIdentifier(*locale->string())) {
-      platform::log(LogLevel::Error, "[#TokenAuth] Invalid locale received from server: '%@'", *locale);
+      // The identifier as text, not as a quoted JSON value; anything else as the value it is.
+      platform::log(LogLevel::Error, "[#TokenAuth] Invalid locale received from server: '%@'",
+                    locale->string() ? *locale->string() : locale->description());
       return fail(ZLKAErrorServer);
     }
     reply(*ppid->string(), platform::Locale(*locale->string()), *metadata->dictionary(), std::nullopt);

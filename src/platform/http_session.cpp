@@ -2,7 +2,9 @@
 
 #include <curl/curl.h>
 
+#include <algorithm>
 #include <atomic>
+#include <cstring>
 #include <deque>
 #include <map>
 #include <mutex>
@@ -35,6 +37,7 @@ Error transportError(CURLcode code, const std::string& detail, const std::string
     case CURLE_GOT_NOTHING:
     case CURLE_RECV_ERROR:
     case CURLE_SEND_ERROR:
+    case CURLE_SEND_FAIL_REWIND:
     case CURLE_PARTIAL_FILE: errorCode = HTTPErrorNetworkConnectionLost; text = "The network connection was lost."; break;
     case CURLE_WRITE_ERROR: errorCode = HTTPErrorResourceTooLarge; text = "The answer exceeds the maximum size."; break;
     case CURLE_PEER_FAILED_VERIFICATION:
@@ -69,6 +72,7 @@ struct HTTPTaskState {
   // Owned by the worker thread while the transfer runs.
   CURL* easy = nullptr;
   curl_slist* headers = nullptr;
+  size_t uploaded = 0;  // body bytes handed to libcurl so far
   std::vector<uint8_t> received;
   HTTPHeaderFields responseHeaders;
   char errorBuffer[CURL_ERROR_SIZE] = {};
@@ -141,6 +145,14 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     return n;
   }
 
+  static size_t onUpload(char* buffer, size_t size, size_t count, void* user) {
+    auto* task = static_cast<HTTPTaskState*>(user);
+    size_t n = std::min(size * count, task->body->length() - task->uploaded);
+    if (n > 0) std::memcpy(buffer, task->body->bytes() + task->uploaded, n);
+    task->uploaded += n;
+    return n;
+  }
+
   static size_t onHeader(char* data, size_t size, size_t count, void* user) {
     auto* task = static_cast<HTTPTaskState*>(user);
     size_t n = size * count;
@@ -186,7 +198,13 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
       curl_easy_setopt(e, CURLOPT_CUSTOMREQUEST, t.request.HTTPMethod.c_str());
     }
     if (t.body) {
-      curl_easy_setopt(e, CURLOPT_POSTFIELDS, t.body->bytes() ? reinterpret_cast<const char*>(t.body->bytes()) : "");
+      // libcurl silently sends a request again when the reused connection it went out on dies
+      // before the answer. A body it reads through a callback cannot be rewound, so a request
+      // whose body was sent fails as a lost connection instead of reaching the server twice
+      // (where a signed request would be refused as a replay).
+      curl_easy_setopt(e, CURLOPT_POST, 1L);
+      curl_easy_setopt(e, CURLOPT_READFUNCTION, &Engine::onUpload);
+      curl_easy_setopt(e, CURLOPT_READDATA, &t);
       curl_easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(t.body->length()));
     } else if (t.request.HTTPMethod == "POST") {
       curl_easy_setopt(e, CURLOPT_POSTFIELDS, "");

@@ -4,8 +4,10 @@
 // session's serial callback queue, with (body, response, nullopt) when an answer arrived (whatever
 // its status) or (nullopt, nullopt, error) when none did. TLS verification is always on, with the
 // configured CA file ([tls] ca_file) or the system store; only https is spoken; redirects are not
-// followed. Connections are reused within a session. The ephemeral session keeps no cookies,
-// cache or credentials; the shared session is the process-wide one.
+// followed. Connections are reused within a session; a request whose body has gone out is never
+// sent again, even when the reused connection dies before the answer (the task fails instead).
+// The ephemeral session keeps no cookies, cache or credentials; the shared session is the
+// process-wide one.
 #pragma once
 
 #include <chrono>
