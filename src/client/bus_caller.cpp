@@ -193,7 +193,7 @@ void BusCaller::sendAndWait(const std::string& method, const ArgumentWriter& wri
     platform::Error error = encodingFailure(r);
     return handler(nullptr, &error);
   }
-  sd_bus_error busError = SD_BUS_ERROR_NULL;
+  sd_bus_error busError{};  // no error yet
   sd_bus_message* reply = nullptr;
   r = sd_bus_call(bus_, call, timeoutUsec_, &busError, &reply);
   sd_bus_message_unref(call);

@@ -188,7 +188,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   }
 
   void sendErrorNow(sd_bus_message* call, const BusError& error) {
-    sd_bus_error e = SD_BUS_ERROR_NULL;
+    sd_bus_error e{};  // no error yet
     sd_bus_error_set(&e, error.name.c_str(), error.message.c_str());
     sd_bus_reply_method_error(call, &e);
     sd_bus_error_free(&e);
@@ -203,7 +203,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
 
   std::optional<PeerCredentials> credentialsOf(const char* sender, int& dupedPidfd) {
     sd_bus_message* reply = nullptr;
-    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_error error{};  // no error yet
     int rc = sd_bus_call_method(bus_, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
                                 "GetConnectionCredentials", &error, &reply, "s", sender);
     sd_bus_error_free(&error);
