@@ -27,6 +27,29 @@ void logRequest(const platform::HTTPRequest& request) {
   platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@", Value(request.allHTTPHeaderFields()));
 }
 
+// The checks both legs make of an answer: it arrived, with status 200 and a body. The error to
+// hand the session otherwise. `showBody` adds the body to the debug lines.
+std::optional<Error> checkAnswer(const std::optional<Data>& data, const std::optional<platform::HTTPResponse>& response,
+                                 const std::optional<Error>& taskError, bool showBody) {
+  if (taskError || !response) {
+    platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
+    return sessionError(TarvexSAPSessionErrorTransport, taskError ? taskError->userInfo() : std::nullopt);
+  }
+  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", response->description());
+  platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", data ? data->length() : 0);
+  if (showBody && data && !data->empty())
+    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", std::string(data->view()));
+  if (response->statusCode != 200) {
+    platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!", response->statusCode);
+    return sessionError(TarvexSAPSessionErrorBadResponse);
+  }
+  if (!data || data->empty()) {
+    platform::log(LogLevel::Error, "[#TokenAuth] responseData is empty!");
+    return sessionError(TarvexSAPSessionErrorBadResponse);
+  }
+  return std::nullopt;
+}
+
 }  // namespace
 
 void ZLKANetwork::sessionRequestCertificateWithCompletionHandler(TarvexSAPSession&, TarvexSAPDataCompletion completion) {
@@ -41,23 +64,7 @@ void ZLKANetwork::sessionRequestCertificateWithCompletionHandler(TarvexSAPSessio
   auto task = platform::HTTPSession::sharedSession()->dataTaskWithRequest(
       std::move(request), [completion](std::optional<Data> data, std::optional<platform::HTTPResponse> response,
                                        std::optional<Error> taskError) {
-        if (taskError) {
-          platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
-          completion(std::nullopt, sessionError(TarvexSAPSessionErrorTransport, taskError->userInfo()));
-          return;
-        }
-        platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", response->description());
-        platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", data ? data->length() : 0);
-        if (response->statusCode != 200) {
-          platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!", response->statusCode);
-          completion(std::nullopt, sessionError(TarvexSAPSessionErrorBadResponse));
-          return;
-        }
-        if (!data || data->empty()) {
-          platform::log(LogLevel::Error, "[#TokenAuth] responseData is empty!");
-          completion(std::nullopt, sessionError(TarvexSAPSessionErrorBadResponse));
-          return;
-        }
+        if (auto error = checkAnswer(data, response, taskError, false)) return completion(std::nullopt, std::move(error));
         completion(std::move(data), std::nullopt);
       });
   task->resume();
@@ -105,25 +112,7 @@ void ZLKANetwork::sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSe
       std::move(request), Data::fromString(*body),
       [weakSelf, completion](std::optional<Data> data, std::optional<platform::HTTPResponse> response,
                              std::optional<Error> taskError) {
-        if (taskError) {
-          platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
-          completion(std::nullopt, sessionError(TarvexSAPSessionErrorTransport, taskError->userInfo()));
-          return;
-        }
-        platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", response->description());
-        platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", data ? data->length() : 0);
-        if (data && !data->empty())
-          platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", std::string(data->view()));
-        if (response->statusCode != 200) {
-          platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!", response->statusCode);
-          completion(std::nullopt, sessionError(TarvexSAPSessionErrorBadResponse));
-          return;
-        }
-        if (!data || data->empty()) {
-          platform::log(LogLevel::Error, "[#TokenAuth] responseData is empty!");
-          completion(std::nullopt, sessionError(TarvexSAPSessionErrorBadResponse));
-          return;
-        }
+        if (auto error = checkAnswer(data, response, taskError, true)) return completion(std::nullopt, std::move(error));
         std::string parseError;
         std::optional<Value> responseDict = platform::json::parse(data->view(), &parseError);
         if (!responseDict) {

@@ -17,13 +17,12 @@ namespace platform {
 
 namespace {
 
-std::optional<std::string> checkFile(const std::filesystem::path& path, int fd) {
+std::optional<std::string> checkFile(int fd) {
   struct stat st {};
   if (fstat(fd, &st) != 0) return "cannot be examined";
   if (!S_ISREG(st.st_mode)) return "is not a regular file";
   if (st.st_uid != 0 && st.st_uid != geteuid()) return "is not owned by root or by the daemon's user";
   if (st.st_mode & (S_IWGRP | S_IWOTH)) return "is writable by group or others";
-  (void)path;
   return std::nullopt;
 }
 
@@ -62,7 +61,7 @@ size_t EntitlementManifests::reload() {
       log(LogLevel::Error, "Ignoring entitlement manifest %s: cannot be opened", file.string());
       continue;
     }
-    std::optional<std::string> problem = checkFile(file, fd);
+    std::optional<std::string> problem = checkFile(fd);
     std::string text = problem ? std::string() : readAll(fd);
     ::close(fd);
     if (problem) {
