@@ -10,8 +10,18 @@ Connection::Connection(std::string peerName, EntitlementLookup entitlements)
     : peerName_(std::move(peerName)), entitlements_(std::move(entitlements)) {}
 
 std::optional<Value> Connection::valueForEntitlement(std::string_view entitlement) const {
-  if (!entitlements_) return std::nullopt;
-  return entitlements_(entitlement);
+  EntitlementLookup lookup;
+  {
+    std::lock_guard lock(mutex_);
+    lookup = entitlements_;
+  }
+  if (!lookup) return std::nullopt;
+  return lookup(entitlement);
+}
+
+void Connection::setEntitlementLookup(EntitlementLookup lookup) {
+  std::lock_guard lock(mutex_);
+  entitlements_ = std::move(lookup);
 }
 
 Connection* Connection::currentConnection() { return tCurrent; }

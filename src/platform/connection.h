@@ -1,6 +1,7 @@
 // Connection: one peer of the messaging service. Operations read the connection of the message
 // being served with currentConnection(), a thread-local set while the message is handled, and ask
-// it for the peer's entitlements.
+// it for the peer's entitlements. The listener works out who the peer is on the peer's own queue
+// before any of its calls runs there, so a call always sees the peer's final entitlements.
 #pragma once
 
 #include <functional>
@@ -21,11 +22,15 @@ using EntitlementLookup = std::function<std::optional<Value>(std::string_view en
 
 class Connection : public std::enable_shared_from_this<Connection> {
  public:
-  Connection(std::string peerName, EntitlementLookup entitlements);
+  explicit Connection(std::string peerName, EntitlementLookup entitlements = nullptr);
   virtual ~Connection() = default;
 
   const std::string& peerName() const { return peerName_; }
+  // valueForEntitlement answers the peer's value for an entitlement, or nullopt when the peer does
+  // not hold it or its identity is not (yet) established.
   std::optional<Value> valueForEntitlement(std::string_view entitlement) const;
+  // setEntitlementLookup installs how the peer's entitlements are read; null grants nothing.
+  void setEntitlementLookup(EntitlementLookup lookup);
 
   // Set up by the listener's delegate before resume(); calls arrive only once resumed.
   void setExportedInterface(std::shared_ptr<const Interface> interface);

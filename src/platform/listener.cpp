@@ -13,6 +13,7 @@
 #include <set>
 #include <vector>
 
+#include "platform/handles.h"
 #include "platform/log.h"
 
 namespace platform {
@@ -37,51 +38,43 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
  public:
   Core(ListenerOptions options, Listener& owner) : options_(std::move(options)), owner_(owner) {}
 
-  ~Core() {
-    sd_bus_slot_unref(vtableSlot_);
-    sd_bus_slot_unref(matchSlot_);
-    for (sd_event_source* s : sources_) sd_event_source_unref(s);
-    if (bus_) sd_bus_flush_close_unref(bus_);
-    if (event_) sd_event_unref(event_);
-    if (wakeFd_ >= 0) ::close(wakeFd_);
-  }
-
   int run() {
     if (!options_.interface) {
       log(LogLevel::Fault, "The listener has no interface to export");
       return 1;
     }
-    int rc = sd_event_new(&event_);
+    sd_event* event = nullptr;
+    int rc = sd_event_new(&event);
     if (rc < 0) return fail("cannot create the event loop", rc);
+    event_.reset(event);
     rc = openBus();
     if (rc < 0) return fail("cannot connect to the " + options_.bus + " bus", rc);
-    rc = sd_bus_attach_event(bus_, event_, SD_EVENT_PRIORITY_NORMAL);
+    rc = sd_bus_attach_event(bus_.get(), event_.get(), SD_EVENT_PRIORITY_NORMAL);
     if (rc < 0) return fail("cannot attach the bus to the event loop", rc);
-    wakeFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-    if (wakeFd_ < 0) return fail("cannot create an eventfd", -errno);
-    sd_event_source* source = nullptr;
-    if ((rc = sd_event_add_io(event_, &source, wakeFd_, EPOLLIN, &Core::onPosted, this)) < 0)
+    wakeFd_.reset(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    if (!wakeFd_) return fail("cannot create an eventfd", -errno);
+    if ((rc = addSource(sd_event_add_io, wakeFd_.get(), EPOLLIN, &Core::onPosted)) < 0)
       return fail("cannot watch the eventfd", rc);
-    sources_.push_back(source);
-    for (int sig : {SIGTERM, SIGINT, SIGHUP}) {
-      if ((rc = sd_event_add_signal(event_, &source, sig, &Core::onSignal, this)) < 0)
+    for (int sig : {SIGTERM, SIGINT, SIGHUP})
+      if ((rc = addSource(sd_event_add_signal, sig, &Core::onSignal)) < 0)
         return fail("cannot handle signals (call Listener::blockSignals() first)", rc);
-      sources_.push_back(source);
-    }
     buildVTable();
-    rc = sd_bus_add_object_vtable(bus_, &vtableSlot_, options_.objectPath.c_str(), options_.interface->name.c_str(),
+    sd_bus_slot* slot = nullptr;
+    rc = sd_bus_add_object_vtable(bus_.get(), &slot, options_.objectPath.c_str(), options_.interface->name.c_str(),
                                   vtable_.data(), this);
+    vtableSlot_.reset(slot);
     if (rc < 0) return fail("cannot export " + options_.objectPath, rc);
-    rc = sd_bus_match_signal(bus_, &matchSlot_, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+    rc = sd_bus_match_signal(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
                              "NameOwnerChanged", &Core::onNameOwnerChanged, this);
+    matchSlot_.reset(slot);
     if (rc < 0) return fail("cannot watch peers leaving the bus", rc);
-    rc = sd_bus_request_name(bus_, options_.serviceName.c_str(), 0);
+    rc = sd_bus_request_name(bus_.get(), options_.serviceName.c_str(), 0);
     if (rc < 0) return fail("cannot own the name " + options_.serviceName, rc);
     lastActivity_ = now();
     if (options_.exitOnIdle) armIdleTimer(lastActivity_ + toUsec(*options_.exitOnIdle));
     log(LogLevel::Default, "Listening as %s on %s at %s", options_.serviceName, options_.bus, options_.objectPath);
     if (options_.notifyReady) sd_notify(0, "READY=1\nSTATUS=Serving requests");
-    rc = sd_event_loop(event_);
+    rc = sd_event_loop(event_.get());
     if (options_.notifyReady) sd_notify(0, "STOPPING=1");
     return rc < 0 ? 1 : rc;
   }
@@ -93,7 +86,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       posted_.push_back(std::move(work));
     }
     uint64_t one = 1;
-    if (::write(wakeFd_, &one, sizeof one) < 0) {
+    if (::write(wakeFd_.get(), &one, sizeof one) < 0) {
       // The counter saturating still wakes the loop; nothing else can go wrong here.
     }
   }
@@ -107,11 +100,11 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
 
   // Bus thread: the answer to a call, then its bookkeeping.
   void sendReturn(sd_bus_message* call, const Reply::Writer& writer, uint64_t id) {
-    sd_bus_message* reply = nullptr;
-    int rc = sd_bus_message_new_method_return(call, &reply);
-    if (rc >= 0 && writer) rc = writer(reply);
-    if (rc >= 0) rc = sd_bus_send(bus_, reply, nullptr);
-    sd_bus_message_unref(reply);
+    sd_bus_message* made = nullptr;
+    int rc = sd_bus_message_new_method_return(call, &made);
+    BusMessagePtr reply(made);
+    if (rc >= 0 && writer) rc = writer(reply.get());
+    if (rc >= 0) rc = sd_bus_send(bus_.get(), reply.get(), nullptr);
     if (rc < 0) {
       log(LogLevel::Error, "Could not encode the answer to %s: %s", memberOf(call), std::string(strerror(-rc)));
       sendErrorNow(call, BusError{kBusErrorFailed, "The answer could not be encoded."});
@@ -134,7 +127,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
 
   uint64_t now() const {
     uint64_t t = 0;
-    sd_event_now(event_, CLOCK_MONOTONIC, &t);
+    sd_event_now(event_.get(), CLOCK_MONOTONIC, &t);
     return t;
   }
   static uint64_t toUsec(std::chrono::seconds s) { return static_cast<uint64_t>(s.count()) * 1000000u; }
@@ -145,13 +138,24 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   }
 
   int openBus() {
-    if (options_.bus == "system") return sd_bus_open_system(&bus_);
-    if (options_.bus == "session") return sd_bus_open_user(&bus_);
-    int rc = sd_bus_new(&bus_);
-    if (rc < 0) return rc;
-    if ((rc = sd_bus_set_address(bus_, options_.bus.c_str())) < 0) return rc;
-    if ((rc = sd_bus_set_bus_client(bus_, 1)) < 0) return rc;
-    return sd_bus_start(bus_);
+    sd_bus* bus = nullptr;
+    int rc = options_.bus == "system"    ? sd_bus_open_system(&bus)
+             : options_.bus == "session" ? sd_bus_open_user(&bus)
+                                         : sd_bus_new(&bus);
+    bus_.reset(bus);
+    if (rc < 0 || options_.bus == "system" || options_.bus == "session") return rc;
+    if ((rc = sd_bus_set_address(bus_.get(), options_.bus.c_str())) < 0) return rc;
+    if ((rc = sd_bus_set_bus_client(bus_.get(), 1)) < 0) return rc;
+    return sd_bus_start(bus_.get());
+  }
+
+  // Adds an event source of this core and keeps it until the core goes.
+  template <class Add, class... A>
+  int addSource(Add add, A... arguments) {
+    sd_event_source* source = nullptr;
+    int rc = add(event_.get(), &source, arguments..., this);
+    if (rc >= 0) sources_.emplace_back(source);
+    return rc;
   }
 
   void buildVTable() {
@@ -198,66 +202,118 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     pending_.erase(id);
     inFlight_.fetch_sub(1);
     lastActivity_ = now();
-    if (draining_ && inFlight_.load() == 0) sd_event_exit(event_, 0);
+    if (draining_ && inFlight_.load() == 0) sd_event_exit(event_.get(), 0);
   }
 
-  std::optional<PeerCredentials> credentialsOf(const char* sender, int& dupedPidfd) {
-    sd_bus_message* reply = nullptr;
-    sd_bus_error error{};  // no error yet
-    int rc = sd_bus_call_method(bus_, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
-                                "GetConnectionCredentials", &error, &reply, "s", sender);
-    sd_bus_error_free(&error);
-    if (rc < 0) return std::nullopt;
+  // A peer's calls wait in order in its backlog until the bus has said who it is.
+  struct CredentialsRequest {
+    Core* core;
+    std::string peer;
+  };
+  struct Peer {
+    std::shared_ptr<Connection> connection;  // null: refused by the delegate
+    std::unique_ptr<CredentialsRequest> request;
+    BusSlotPtr credentialsCall;  // declared after `request`, so released before it
+    std::vector<std::pair<MethodInvocation, Reply>> backlog;
+    bool identified = false;
+  };
+
+  Peer& peerFor(const std::string& sender) {
+    auto it = peers_.find(sender);
+    if (it != peers_.end()) return it->second;
+    Peer& peer = peers_[sender];
+    connectionCount_.store(peers_.size());
+    auto connection = std::make_shared<Connection>(sender);
+    std::shared_ptr<ListenerDelegate> delegate = owner_.delegate();
+    if (delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection)) peer.connection = std::move(connection);
+    if (!peer.connection) return peer;
+    // Asked once, without waiting: the answer comes back to this thread like any other message.
+    peer.request = std::make_unique<CredentialsRequest>(CredentialsRequest{this, sender});
+    sd_bus_slot* slot = nullptr;
+    int rc = sd_bus_call_method_async(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                                      "org.freedesktop.DBus", "GetConnectionCredentials", &Core::onCredentials,
+                                      peer.request.get(), "s", sender.c_str());
+    peer.credentialsCall.reset(slot);
+    if (rc < 0) identify(peer, nullptr, std::string(strerror(-rc)));
+    return peer;
+  }
+
+  static int onCredentials(sd_bus_message* reply, void* userdata, sd_bus_error*) {
+    auto* request = static_cast<CredentialsRequest*>(userdata);
+    auto it = request->core->peers_.find(request->peer);
+    if (it == request->core->peers_.end()) return 0;
+    const sd_bus_error* error = sd_bus_message_get_error(reply);
+    request->core->identify(it->second, error ? nullptr : reply, error && error->message ? error->message : "");
+    return 0;
+  }
+
+  // Bus thread: the peer's identity is worked out first on its own queue (reading /proc may be
+  // slow), then its waiting calls follow in order. Without credentials it holds no entitlements.
+  void identify(Peer& peer, sd_bus_message* credentialsReply, const std::string& error) {
+    auto credentials = std::make_shared<std::optional<PeerCredentials>>();
+    if (credentialsReply) *credentials = parseCredentials(credentialsReply);
+    if (!*credentials)
+      log(LogLevel::Error, "No credentials for peer %s%s%s: it holds no entitlements", peer.connection->peerName(),
+          error.empty() ? "" : ": ", error);
+    else if (options_.entitlementsForPeer)
+      peer.connection->queue()->async([connection = peer.connection, credentials, identify = options_.entitlementsForPeer] {
+        connection->setEntitlementLookup(identify(**credentials));
+      });
+    peer.identified = true;
+    for (auto& [invocation, reply] : peer.backlog) schedule(peer.connection, std::move(invocation), std::move(reply));
+    peer.backlog.clear();
+  }
+
+  static std::optional<PeerCredentials> parseCredentials(sd_bus_message* reply) {
     PeerCredentials c;
     bool haveUid = false, havePid = false;
-    if (sd_bus_message_enter_container(reply, 'a', "{sv}") >= 0) {
-      while (sd_bus_message_enter_container(reply, 'e', "sv") > 0) {
-        const char* key = nullptr;
-        sd_bus_message_read_basic(reply, 's', &key);
-        std::string k = key ? key : "";
-        if (k == "UnixUserID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
-          uint32_t v = 0;
-          haveUid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
-          c.uid = v;
-          sd_bus_message_exit_container(reply);
-        } else if (k == "ProcessID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
-          uint32_t v = 0;
-          havePid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
-          c.pid = static_cast<pid_t>(v);
-          sd_bus_message_exit_container(reply);
-        } else if (k == "ProcessFD" && sd_bus_message_enter_container(reply, 'v', "h") > 0) {
-          int fd = -1;
-          if (sd_bus_message_read_basic(reply, 'h', &fd) > 0 && fd >= 0) dupedPidfd = fcntl(fd, F_DUPFD_CLOEXEC, 3);
-          c.pidfd = dupedPidfd;
-          sd_bus_message_exit_container(reply);
-        } else {
-          sd_bus_message_skip(reply, "v");
+    if (sd_bus_message_enter_container(reply, 'a', "{sv}") <= 0) return std::nullopt;
+    while (sd_bus_message_enter_container(reply, 'e', "sv") > 0) {
+      const char* key = nullptr;
+      if (sd_bus_message_read_basic(reply, 's', &key) <= 0) return std::nullopt;
+      std::string_view k = key;
+      if (k == "UnixUserID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
+        uint32_t v = 0;
+        haveUid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
+        c.uid = v;
+        sd_bus_message_exit_container(reply);
+      } else if (k == "ProcessID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
+        uint32_t v = 0;
+        havePid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
+        c.pid = static_cast<pid_t>(v);
+        sd_bus_message_exit_container(reply);
+      } else if (k == "LinuxSecurityLabel" && sd_bus_message_enter_container(reply, 'v', "ay") > 0) {
+        const void* bytes = nullptr;
+        size_t size = 0;
+        if (sd_bus_message_read_array(reply, 'y', &bytes, &size) > 0) {
+          std::string label(static_cast<const char*>(bytes), size);
+          while (!label.empty() && label.back() == '\0') label.pop_back();
+          if (!label.empty()) c.label = std::move(label);
         }
         sd_bus_message_exit_container(reply);
+      } else if (k == "ProcessFD" && sd_bus_message_enter_container(reply, 'v', "h") > 0) {
+        int fd = -1;
+        if (sd_bus_message_read_basic(reply, 'h', &fd) > 0 && fd >= 0) c.pidfd.reset(fcntl(fd, F_DUPFD_CLOEXEC, 3));
+        sd_bus_message_exit_container(reply);
+      } else {
+        sd_bus_message_skip(reply, "v");
       }
       sd_bus_message_exit_container(reply);
     }
-    sd_bus_message_unref(reply);
     if (!haveUid || !havePid) return std::nullopt;
     return c;
   }
 
-  std::shared_ptr<Connection> connectionFor(const std::string& sender) {
-    auto it = connections_.find(sender);
-    if (it != connections_.end()) return it->second;
-    int pidfd = -1;
-    std::optional<PeerCredentials> credentials = credentialsOf(sender.c_str(), pidfd);
-    EntitlementLookup lookup;
-    if (credentials && options_.entitlementsForPeer) lookup = options_.entitlementsForPeer(*credentials);
-    if (pidfd >= 0) ::close(pidfd);
-    if (!credentials) log(LogLevel::Error, "No credentials for peer %s: it holds no entitlements", sender);
-    auto connection = std::make_shared<Connection>(sender, std::move(lookup));
-    std::shared_ptr<ListenerDelegate> delegate = owner_.delegate();
-    bool accepted = delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection);
-    if (!accepted) connection.reset();
-    connections_.emplace(sender, connection);
-    connectionCount_.store(connections_.size());
-    return connection;
+  // Runs a call on its peer's queue, with the peer's connection current.
+  static void schedule(const std::shared_ptr<Connection>& connection, MethodInvocation invocation, Reply reply) {
+    connection->queue()->async([connection, invocation = std::move(invocation), reply = std::move(reply)] {
+      Connection::CurrentScope scope(connection.get());
+      try {
+        invocation(reply);
+      } catch (const std::exception& e) {
+        reply.fail(BusError{kBusErrorFailed, std::string("The operation failed: ") + e.what()});
+      }
+    });
   }
 
   static int onMethodCall(sd_bus_message* m, void* userdata, sd_bus_error*) {
@@ -276,7 +332,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       sendErrorNow(m, BusError{kBusErrorAccessDenied, "Calls must come through the bus."});
       return 1;
     }
-    std::shared_ptr<Connection> connection = connectionFor(senderRaw);
+    Peer& peer = peerFor(senderRaw);
+    std::shared_ptr<Connection> connection = peer.connection;
     if (!connection || !connection->isResumed()) {
       sendErrorNow(m, BusError{kBusErrorAccessDenied, "The connection was not accepted."});
       return 1;
@@ -307,14 +364,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     pending_.emplace(state->id, state);
     inFlight_.fetch_add(1);
     lastActivity_ = now();
-    connection->queue()->async([connection, invocation = std::move(decoded.invocation), reply = Reply(state)] {
-      Connection::CurrentScope scope(connection.get());
-      try {
-        invocation(reply);
-      } catch (const std::exception& e) {
-        reply.fail(BusError{kBusErrorFailed, std::string("The operation failed: ") + e.what()});
-      }
-    });
+    if (peer.identified) schedule(connection, std::move(decoded.invocation), Reply(state));
+    else peer.backlog.emplace_back(std::move(decoded.invocation), Reply(state));
     return 1;
   }
 
@@ -324,8 +375,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     if (sd_bus_message_read(m, "sss", &name, &oldOwner, &newOwner) < 0) return 0;
     // A unique name never comes back: its connection ends with it. Work already queued finishes.
     if (name && name[0] == ':' && newOwner && !*newOwner) {
-      self->connections_.erase(name);
-      self->connectionCount_.store(self->connections_.size());
+      self->peers_.erase(name);
+      self->connectionCount_.store(self->peers_.size());
     }
     return 0;
   }
@@ -361,14 +412,12 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     draining_ = true;
     log(LogLevel::Default, "Shutting down (%s) with %zu call(s) in flight", why, inFlight_.load());
     if (options_.notifyReady) sd_notify(0, "STOPPING=1");
-    sd_bus_release_name(bus_, options_.serviceName.c_str());
+    sd_bus_release_name(bus_.get(), options_.serviceName.c_str());
     if (inFlight_.load() == 0) {
-      sd_event_exit(event_, 0);
+      sd_event_exit(event_.get(), 0);
       return;
     }
-    sd_event_source* timer = nullptr;
-    if (sd_event_add_time_relative(event_, &timer, CLOCK_MONOTONIC, toUsec(options_.drainLimit), 0, &Core::onDrainLimit, this) >= 0)
-      sources_.push_back(timer);
+    addSource(sd_event_add_time_relative, CLOCK_MONOTONIC, toUsec(options_.drainLimit), uint64_t{0}, &Core::onDrainLimit);
   }
 
   static int onDrainLimit(sd_event_source*, uint64_t, void* userdata) {
@@ -381,13 +430,13 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
         state->call = nullptr;
       }
     self->pending_.clear();
-    sd_event_exit(self->event_, 0);
+    sd_event_exit(self->event_.get(), 0);
     return 0;
   }
 
   void armIdleTimer(uint64_t at) {
     if (!idleTimer_) {
-      if (sd_event_add_time(event_, &idleTimer_, CLOCK_MONOTONIC, at, 0, &Core::onIdleTimer, this) >= 0) sources_.push_back(idleTimer_);
+      if (addSource(sd_event_add_time, CLOCK_MONOTONIC, at, uint64_t{0}, &Core::onIdleTimer) >= 0) idleTimer_ = sources_.back().get();
       return;
     }
     sd_event_source_set_time(idleTimer_, at);
@@ -408,18 +457,19 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
 
   ListenerOptions options_;
   Listener& owner_;
-  sd_event* event_ = nullptr;
-  sd_bus* bus_ = nullptr;
-  sd_bus_slot* vtableSlot_ = nullptr;
-  sd_bus_slot* matchSlot_ = nullptr;
-  sd_event_source* idleTimer_ = nullptr;
-  std::vector<sd_event_source*> sources_;
-  std::vector<sd_bus_vtable> vtable_;
+  // Declared in the order they depend on each other, so that they are released in reverse.
+  EventPtr event_;
+  BusPtr bus_;
+  UniqueFd wakeFd_;
+  std::vector<sd_bus_vtable> vtable_;  // read by sd-bus until vtableSlot_ goes
   std::vector<std::string> names_;
-  int wakeFd_ = -1;
+  BusSlotPtr vtableSlot_;
+  BusSlotPtr matchSlot_;
+  sd_event_source* idleTimer_ = nullptr;  // one of sources_
+  std::vector<EventSourcePtr> sources_;
   std::mutex postMutex_;
   std::vector<std::function<void()>> posted_;
-  std::map<std::string, std::shared_ptr<Connection>> connections_;  // null: refused
+  std::map<std::string, Peer> peers_;
   std::atomic<size_t> connectionCount_{0};
   std::map<uint64_t, std::weak_ptr<Reply::State>> pending_;
   std::atomic<size_t> inFlight_{0};

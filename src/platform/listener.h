@@ -25,7 +25,8 @@ struct ListenerOptions {
   std::string serviceName;
   std::string objectPath;
   std::shared_ptr<const Interface> interface;  // registered on the object
-  // The entitlement lookup of a new peer, from the credentials the bus recorded for it.
+  // The entitlement lookup of a new peer, from the credentials the bus recorded for it. Runs once
+  // per peer, on the peer's queue before any of its calls, so it may read /proc at leisure.
   std::function<EntitlementLookup(const PeerCredentials&)> entitlementsForPeer;
   std::function<void()> onReload;              // SIGHUP
   std::optional<std::chrono::seconds> exitOnIdle;

@@ -101,15 +101,10 @@ std::optional<int> setUpDaemon(int argc, char** argv) {
   options.objectPath = kZLKAObjectPath;
   options.interface = ZLKANetworkProtocolInterface();
   options.entitlementsForPeer = [manifests](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
-    std::optional<std::string> executable = platform::peerExecutable(credentials);
-    if (!executable) {
-      platform::log(LogLevel::Error, "Cannot establish the executable of pid %d: it holds no entitlements", credentials.pid);
-      return nullptr;
-    }
-    platform::log(LogLevel::Info, "Peer pid %d uid %u runs %s", credentials.pid, credentials.uid, *executable);
-    return [manifests, executable = *executable, uid = credentials.uid](std::string_view key) {
-      return manifests->valueFor(executable, uid, key);
-    };
+    platform::PeerIdentity peer = platform::peerIdentity(credentials);
+    platform::log(LogLevel::Info, "Peer pid %d uid %u label %@ runs %s", peer.pid, peer.uid, peer.label,
+                  peer.executable.value_or("an executable that cannot be established"));
+    return [manifests, peer = std::move(peer)](std::string_view key) { return manifests->valueFor(peer, key); };
   };
   options.onReload = [manifests] {
     size_t n = manifests->reload();

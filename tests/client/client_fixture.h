@@ -12,7 +12,7 @@
 
 #include "client/zlka_client.h"
 #include "echo_service.h"
-#include "private_bus.h"
+#include "common/private_bus.h"
 
 namespace client_test {
 

@@ -108,13 +108,16 @@ RunResult runToEnd(const std::vector<std::string>& argv, const std::filesystem::
   return r;
 }
 
-Harness::Harness() : directory_(uniqueDirectory()) {
+Harness::Harness(bool anyUser) : directory_(uniqueDirectory()), bus_(anyUser) {
   devserver::DevServerOptions options;
   options.stateDir = stateDirectory();
   options.admin = true;
   server_ = std::make_unique<devserver::DevServer>(options);
   if (auto error = server_->start()) ADD_FAILURE() << "zlka-devserver did not start: " << *error;
   std::filesystem::create_directories(entitlementsDirectory());
+  if (anyUser)
+    for (const auto& dir : {directory_, stateDirectory(), entitlementsDirectory()})
+      std::filesystem::permissions(dir, std::filesystem::perms(0755));
 }
 
 Harness::~Harness() {
@@ -129,9 +132,11 @@ Harness::~Harness() {
   std::filesystem::remove_all(directory_, ec);
 }
 
-void Harness::writeManifest(const std::string& name, const std::string& executable, const platform::Value& value, mode_t mode) {
-  platform::Value manifest(platform::Dictionary{
-      {"executable", executable}, {"entitlements", platform::Dictionary{{"com.kestro.ZLKAuthentication", value}}}});
+void Harness::writeManifest(const std::string& name, const std::string& executable, const platform::Value& value, mode_t mode,
+                            uid_t uid) {
+  platform::Value manifest(platform::Dictionary{{"uid", uid},
+                                                {"executable", executable},
+                                                {"entitlements", platform::Dictionary{{"com.kestro.ZLKAuthentication", value}}}});
   auto path = entitlementsDirectory() / (name + ".json");
   std::ofstream(path) << *platform::json::serialize(manifest);
   std::filesystem::permissions(path, static_cast<std::filesystem::perms>(mode));
@@ -145,16 +150,19 @@ std::string Harness::copyOfZlkactl(const std::string& name) {
   return path.string();
 }
 
-bool Harness::startDaemon(const std::vector<std::string>& extraArguments) {
+bool Harness::startDaemon(const std::vector<std::string>& extraArguments, const std::vector<std::string>& launcher) {
   auto socketPath = directory_ / "notify.sock";
   notifySocket_ = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   std::snprintf(address.sun_path, sizeof address.sun_path, "%s", socketPath.c_str());
   if (::bind(notifySocket_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return false;
-  std::vector<std::string> argv = {ZLKAD_PATH, "--config", configFile().string(), "--bus", busAddress(), "--log", "stderr",
+  std::filesystem::permissions(socketPath, std::filesystem::perms(0666));  // a daemon of any user may notify
+  std::vector<std::string> argv = launcher;
+  std::vector<std::string> daemon = {ZLKAD_PATH, "--config", configFile().string(), "--bus", busAddress(), "--log", "stderr",
                                    "--log-level", "info"};
-  argv.insert(argv.end(), extraArguments.begin(), extraArguments.end());
+  daemon.insert(daemon.end(), extraArguments.begin(), extraArguments.end());
+  argv.insert(argv.end(), daemon.begin(), daemon.end());
   daemon_ = std::make_unique<ChildProcess>(argv, directory_, std::vector<std::string>{"NOTIFY_SOCKET=" + socketPath.string()});
   // READY=1 arrives once the daemon owns its name; a daemon that dies first never sends it.
   pollfd p{notifySocket_, POLLIN, 0};

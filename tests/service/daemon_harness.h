@@ -5,6 +5,7 @@
 #pragma once
 
 #include <sys/types.h>
+#include <unistd.h>
 
 #include <chrono>
 #include <filesystem>
@@ -14,7 +15,7 @@
 #include <string>
 #include <vector>
 
-#include "client/private_bus.h"
+#include "common/private_bus.h"
 #include "devserver/dev_server.h"
 #include "platform/value.h"
 
@@ -49,7 +50,8 @@ RunResult runToEnd(const std::vector<std::string>& argv, const std::filesystem::
 
 class Harness {
  public:
-  Harness();
+  // With `anyUser`, processes of every user may reach the bus and read the daemon's files.
+  explicit Harness(bool anyUser = false);
   ~Harness();
 
   const std::filesystem::path& directory() const { return directory_; }
@@ -59,14 +61,15 @@ class Harness {
   const std::string& busAddress() const { return bus_.address(); }
   devserver::DevServer& server() { return *server_; }
 
-  // Writes a manifest file for `executable` (mode 0644 unless given).
+  // Writes a manifest file that gives `executable` run by `uid` the entitlement value.
   void writeManifest(const std::string& name, const std::string& executable, const platform::Value& entitlementValue,
-                     mode_t mode = 0644);
+                     mode_t mode = 0644, uid_t uid = getuid());
   // A copy of zlkactl at its own path, so that it is a client of its own identity.
   std::string copyOfZlkactl(const std::string& name);
 
-  // Starts zlkad on the private bus with the generated configuration; true once it is ready.
-  bool startDaemon(const std::vector<std::string>& extraArguments = {});
+  // Starts zlkad on the private bus with the generated configuration, through `launcher` (a
+  // command line that ends by running the rest of its arguments) when given; true once it is ready.
+  bool startDaemon(const std::vector<std::string>& extraArguments = {}, const std::vector<std::string>& launcher = {});
   ChildProcess* daemon() { return daemon_.get(); }
 
   // Admin requests to the server.

@@ -1,4 +1,4 @@
-#include "private_bus.h"
+#include "common/private_bus.h"
 
 #include <fcntl.h>
 #include <signal.h>
@@ -18,13 +18,14 @@ extern char** environ;
 
 namespace client_test {
 
-PrivateBus::PrivateBus() {
+PrivateBus::PrivateBus(bool anyUser) {
   char pattern[] = "/tmp/zlka-client-bus-XXXXXX";
   if (!::mkdtemp(pattern)) {
     ADD_FAILURE() << "mkdtemp failed";
     return;
   }
   directory_ = pattern;
+  if (anyUser) std::filesystem::permissions(directory_, std::filesystem::perms(0755));
   std::filesystem::path config = directory_ / "bus.conf";
   std::ofstream(config) << "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
                            " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
@@ -33,6 +34,7 @@ PrivateBus::PrivateBus() {
                            "  <listen>unix:path=" << (directory_ / "socket").string() << "</listen>\n"
                            "  <auth>EXTERNAL</auth>\n"
                            "  <policy context=\"default\">\n"
+                        << (anyUser ? "    <allow user=\"*\"/>\n" : "") <<
                            "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
                            "    <allow eavesdrop=\"true\"/>\n"
                            "    <allow own=\"*\"/>\n"

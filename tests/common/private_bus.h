@@ -1,5 +1,6 @@
 // A private D-Bus daemon for one test: started from a temporary configuration that lets anyone
-// own any name, stopped (by its pid) when the object goes away.
+// own any name, stopped (by its pid) when the object goes away. With `anyUser`, processes of every
+// user in the user database may connect, as on the system bus.
 #pragma once
 
 #include <sys/types.h>
@@ -11,7 +12,8 @@ namespace client_test {
 
 class PrivateBus {
  public:
-  PrivateBus();  // fails the current test (ADD_FAILURE) when the daemon does not start
+  // Fails the current test (ADD_FAILURE) when the daemon does not start.
+  explicit PrivateBus(bool anyUser = false);
   ~PrivateBus();
   PrivateBus(const PrivateBus&) = delete;
   PrivateBus& operator=(const PrivateBus&) = delete;

@@ -1,0 +1,137 @@
+// Who a manifest entry admits: the user the bus recorded is the boundary; label and executable
+// only narrow it, and anything that would silently widen an entry voids it.
+#include "platform/entitlement_manifests.h"
+
+#include <gtest/gtest.h>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <fstream>
+
+#include "platform/log.h"
+
+using platform::ManifestEntry;
+using platform::PeerIdentity;
+using platform::Value;
+
+namespace {
+
+constexpr char kGrant[] = R"("entitlements": {"com.kestro.ZLKAuthentication": ["token-auth"]})";
+
+std::string entry(const std::string& fields) { return "{" + fields + (fields.empty() ? "" : ", ") + kGrant + "}"; }
+
+}  // namespace
+
+TEST(ManifestEntry, EveryEntryPinsExactlyOneUserAndNothingUnknown) {
+  struct Row {
+    const char* name;
+    std::string text;
+    const char* refusal;  // null: accepted
+  };
+  // clang-format off
+  const Row rows[] = {
+      {"uid", entry(R"("uid": 0)"), nullptr},
+      {"user name", entry(R"("user": "root")"), nullptr},
+      {"every refinement", entry(R"("uid": 7, "label": "accessoryd", "executable": "/usr/bin/env")"), nullptr},
+      {"no user", entry(R"("executable": "/usr/bin/env")"), "pins no user"},
+      {"both uid and user", entry(R"("uid": 0, "user": "root")"), "gives both"},
+      {"unknown user", entry(R"("user": "no-such-user-zlka")"), "names an unknown user \"no-such-user-zlka\""},
+      {"negative uid", entry(R"("uid": -1)"), "not a user id"},
+      {"uid -1 as unsigned", entry(R"("uid": 4294967295)"), "not a user id"},  // the kernel's "no user"
+      {"uid as text", entry(R"("uid": "0")"), "not a user id"},
+      {"empty label", entry(R"("uid": 0, "label": "")"), "\"label\""},
+      {"relative executable", entry(R"("uid": 0, "executable": "bin/env")"), "\"executable\""},
+      {"misspelt refinement", entry(R"("uid": 0, "lable": "x")"), "unknown key \"lable\""},  // would widen it
+      {"no entitlements", R"({"uid": 0})", "no \"entitlements\""},
+      {"array", "[]", "not a JSON object"},
+      {"broken JSON", "{\"uid\": ", "does not parse"},
+  };
+  // clang-format on
+  for (const Row& row : rows) {
+    platform::Result<ManifestEntry> parsed = platform::parseManifestEntry(row.text);
+    if (!row.refusal) {
+      EXPECT_TRUE(parsed.ok()) << row.name << ": " << (parsed ? "" : parsed.error());
+      continue;
+    }
+    ASSERT_FALSE(parsed.ok()) << row.name;
+    EXPECT_NE(parsed.error().find(row.refusal), std::string::npos) << row.name << ": " << parsed.error();
+  }
+  EXPECT_EQ(platform::parseManifestEntry(entry(R"("user": "root")"))->uid, 0u);
+}
+
+TEST(ManifestEntry, RefinementsOnlyNarrowTheUser) {
+  struct Row {
+    const char* name;
+    std::optional<std::string> entryLabel, entryExecutable;
+    PeerIdentity peer;
+    bool matches;
+  };
+  const PeerIdentity plain{100, 1, std::nullopt, "/usr/libexec/accessoryd"};
+  const PeerIdentity labelled{100, 1, "accessoryd", "/usr/libexec/accessoryd"};
+  // clang-format off
+  const Row rows[] = {
+      {"same user", {}, {}, plain, true},
+      {"other user", {}, {}, PeerIdentity{101, 1, "accessoryd", "/usr/libexec/accessoryd"}, false},
+      {"label equal", "accessoryd", {}, labelled, true},
+      {"label differs", "accessoryd", {}, PeerIdentity{100, 1, "accessoryd_t", std::nullopt}, false},
+      {"label is a prefix", "accessory", {}, labelled, false},
+      {"peer has no label", "accessoryd", {}, plain, false},  // no LSM: never matches a pinned label
+      {"entry pins no label", {}, {}, labelled, true},
+      {"executable equal", {}, "/usr/libexec/accessoryd", plain, true},
+      {"executable differs", {}, "/usr/libexec/other", plain, false},
+      {"executable unknown", {}, "/usr/libexec/accessoryd", PeerIdentity{100, 1, std::nullopt, std::nullopt}, false},
+  };
+  // clang-format on
+  for (const Row& row : rows) {
+    ManifestEntry e{100, row.entryLabel, row.entryExecutable, {}};
+    EXPECT_EQ(e.matches(row.peer), row.matches) << row.name;
+  }
+}
+
+TEST(EntitlementManifests, LaterFilesWinAndIgnoredFilesAreNamedWithTheirReason) {
+  char pattern[] = "/tmp/zlka-manifests-XXXXXX";
+  ASSERT_NE(mkdtemp(pattern), nullptr);
+  std::filesystem::path dir = pattern;
+  auto write = [&](const std::string& name, const std::string& text, mode_t mode) {
+    std::ofstream(dir / name) << text;
+    chmod((dir / name).c_str(), mode);
+  };
+  const std::string me = std::to_string(getuid());
+  write("10-first.json", R"({"uid": )" + me + R"(, "entitlements": {"k": 1, "only-first": true}})", 0644);
+  write("20-second.json", R"({"uid": )" + me + R"(, "entitlements": {"k": 2}})", 0644);
+  write("30-loose.json", R"({"uid": )" + me + R"(, "entitlements": {"k": 3}})", 0664);
+  write("40-anyone.json", R"({"executable": "/usr/bin/env", "entitlements": {"k": 4}})", 0644);
+  write("50-other-user.json", R"({"uid": )" + std::to_string(getuid() + 1) + R"(, "entitlements": {"k": 5}})", 0644);
+  write("notes.txt", "not a manifest", 0644);
+
+  std::vector<std::string> lines;
+  platform::setLogSink([&](const platform::LogEntry& e) { lines.push_back(e.message); });
+  platform::EntitlementManifests manifests(dir);
+  EXPECT_EQ(manifests.reload(), 3u);
+  platform::setLogSink(nullptr);
+
+  PeerIdentity peer{getuid(), getpid(), std::nullopt, std::nullopt};
+  EXPECT_EQ(manifests.valueFor(peer, "k"), Value(2));
+  EXPECT_EQ(manifests.valueFor(peer, "only-first"), Value(true));
+  EXPECT_EQ(manifests.valueFor(peer, "absent"), std::nullopt);
+  const std::string expected[] = {
+      "Ignoring entitlement manifest " + (dir / "30-loose.json").string() + ": it is writable by group or others",
+      "Ignoring entitlement manifest " + (dir / "40-anyone.json").string() + ": it pins no user",
+  };
+  ASSERT_EQ(lines.size(), 2u);
+  for (size_t i = 0; i < 2; ++i) EXPECT_TRUE(lines[i].starts_with(expected[i])) << lines[i];
+  std::filesystem::remove_all(dir);
+}
+
+TEST(PeerIdentity, TheExecutableIsReadOnlyForTheRecordedUser) {
+  platform::PeerCredentials self;
+  self.uid = getuid();
+  self.pid = getpid();
+  EXPECT_EQ(platform::peerIdentity(self).executable, std::filesystem::read_symlink("/proc/self/exe").string());
+  // A pid the bus recorded for another user (a recycled pid, or a setuid exec) shows no executable.
+  self.uid = getuid() + 1;
+  PeerIdentity other = platform::peerIdentity(self);
+  EXPECT_EQ(other.uid, getuid() + 1);
+  EXPECT_EQ(other.executable, std::nullopt);
+}
