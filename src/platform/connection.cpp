@@ -1,5 +1,7 @@
 #include "platform/connection.h"
 
+#include "platform/worker_pool.h"
+
 namespace platform {
 
 namespace {
@@ -58,7 +60,7 @@ bool Connection::isResumed() const {
 
 std::shared_ptr<Queue> Connection::queue() {
   std::lock_guard lock(mutex_);
-  if (!queue_) queue_ = Queue::serial("Connection." + peerName_);
+  if (!queue_) queue_ = Queue::serial("Connection." + peerName_, &WorkerPool::connections());
   return queue_;
 }
 

@@ -2,20 +2,21 @@
 
 // Work queues: every object that needs its own ordering of work owns one.
 //
-// A serial queue runs one item at a time, in submission order, on a thread of its own. A
-// concurrent queue runs up to `width` items at once on threads of its own; barrier items on it
-// run alone, after everything submitted before them and before anything submitted after them.
-// Because no queue shares threads with another, a queue whose work blocks for a long time
-// delays nothing but itself.
+// A queue is an ordering, not a thread: its work runs on the workers of a WorkerPool that many
+// queues share (the shared pool unless another is given). A serial queue runs one item at a time,
+// in submission order. A concurrent queue runs up to `width` items at once; barrier items on it run
+// alone, after everything submitted before them and before anything submitted after them.
 //
-// async() never blocks. sync() and barrierSync() wait until the work has run; calling them from
-// work running on the same queue is a programming error (it would wait for itself) and aborts.
-// An exception escaping a work item is reported on stderr with the queue's label and then
-// terminates the process: the submitter has long gone and nobody else could handle it.
+// async() never blocks and costs at most one wake-up of a worker. sync() and barrierSync() wait
+// until the work has run; on an idle serial queue, sync() runs the work right away on the calling
+// thread, with the queue marked current. Calling them from work running on the same queue is a
+// programming error (it would wait for itself) and aborts. An exception escaping a work item is
+// reported on stderr with the queue's label and then terminates the process: the submitter has
+// long gone and nobody else could handle it.
 //
-// Queues live in shared_ptrs. Dropping the last reference runs everything already submitted,
-// then stops the queue's threads; it waits for that, unless the reference is dropped by the
-// queue's own work, in which case the queue finishes and winds down in the background.
+// Queues live in shared_ptrs. Dropping the last reference waits until everything already
+// submitted has run, unless the reference is dropped by the queue's own work, in which case the
+// rest of its work still runs, in the background.
 
 #include <functional>
 #include <memory>
@@ -23,15 +24,17 @@
 
 namespace platform {
 
+class WorkerPool;
 namespace detail {
 class QueueEngine;
 }
 
 class Queue {
  public:
-  static std::shared_ptr<Queue> serial(std::string label);
-  // Throws std::invalid_argument if `width` is 0.
-  static std::shared_ptr<Queue> concurrent(std::string label, unsigned width = 4);
+  // serial makes a serial queue whose work runs on `pool` (WorkerPool::shared() when null).
+  static std::shared_ptr<Queue> serial(std::string label, WorkerPool* pool = nullptr);
+  // concurrent makes a concurrent queue of `width`; it throws std::invalid_argument if `width` is 0.
+  static std::shared_ptr<Queue> concurrent(std::string label, unsigned width = 4, WorkerPool* pool = nullptr);
 
   Queue(const Queue&) = delete;
   Queue& operator=(const Queue&) = delete;
@@ -53,14 +56,14 @@ class Queue {
   static const Queue* current() noexcept;
 
  private:
-  Queue(std::string label, bool serial, unsigned width);
+  Queue(std::string label, bool serial, unsigned width, WorkerPool& pool);
   static void release(Queue* queue) noexcept;
   void submit(std::function<void()> work, bool barrier);
   void submitAndWait(std::function<void()> work, bool barrier, const char* operation);
 
   std::string label_;
   bool serial_;
-  std::unique_ptr<detail::QueueEngine> engine_;
+  std::shared_ptr<detail::QueueEngine> engine_;
 };
 
 }  // namespace platform

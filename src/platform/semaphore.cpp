@@ -1,7 +1,10 @@
 #include "platform/semaphore.h"
 
 #include <limits>
+#include <optional>
 #include <stdexcept>
+
+#include "platform/worker_pool.h"
 
 namespace platform {
 
@@ -16,8 +19,16 @@ void Semaphore::signal() {
   available_.notify_one();
 }
 
+// A worker of a pool that waits here tells its pool, so that the pool may start another worker
+// meanwhile; taking a signal that is already there costs nothing of the kind.
 void Semaphore::wait() {
+  std::optional<WorkerPool::Blocking> blocking;
   std::unique_lock lock(mutex_);
+  if (count_ == 0) {
+    lock.unlock();
+    blocking.emplace();
+    lock.lock();
+  }
   available_.wait(lock, [this] { return count_ > 0; });
   --count_;
 }
@@ -34,7 +45,13 @@ bool Semaphore::waitFor(std::chrono::nanoseconds timeout) {
 }
 
 bool Semaphore::waitUntil(std::chrono::steady_clock::time_point deadline) {
+  std::optional<WorkerPool::Blocking> blocking;
   std::unique_lock lock(mutex_);
+  if (count_ == 0 && deadline > std::chrono::steady_clock::now()) {
+    lock.unlock();
+    blocking.emplace();
+    lock.lock();
+  }
   if (!available_.wait_until(lock, deadline, [this] { return count_ > 0; })) return false;
   --count_;
   return true;

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "platform/semaphore.h"
+#include "platform/worker_pool.h"
 
 namespace {
 
@@ -335,30 +336,43 @@ TEST(Queue, LastReferenceDroppedByItsOwnWork) {
   }
 }
 
-TEST(SerialQueue, HundredBlockedQueuesDoNotStarveEachOtherOrOthers) {
+TEST(SerialQueue, BlockedQueuesTakeAtMostThePoolsBoundAndAllComplete) {
   constexpr int kQueues = 100;
+  constexpr unsigned kBound = 8;
+  platform::WorkerPool pool("test.bounded", {.minimum = 1, .maximum = kBound});
   std::vector<std::shared_ptr<Queue>> queues;
-  Semaphore started;
-  Semaphore release;
-  Semaphore finished;
+  Semaphore started, release, finished;
   for (int i = 0; i < kQueues; ++i) {
-    queues.push_back(Queue::serial("test.blocked." + std::to_string(i)));
+    queues.push_back(Queue::serial("test.blocked." + std::to_string(i), &pool));
     queues.back()->async([&] {
       started.signal();
       EXPECT_TRUE(arrives(release));
       finished.signal();
     });
   }
-  // All of them are blocked at the same time...
-  ASSERT_TRUE(arrivesTimes(started, kQueues));
-  // ...and another queue still runs work meanwhile.
-  auto other = Queue::serial("test.blocked.other");
-  bool otherRan = false;
-  other->sync([&] { otherRan = true; });
-  EXPECT_TRUE(otherRan);
+  // The pool grows while its workers block, up to its bound; the other queues wait their turn...
+  ASSERT_TRUE(arrivesTimes(started, kBound));
+  EXPECT_FALSE(started.waitFor(kShort));
+  EXPECT_EQ(pool.threads(), kBound);
+  // ...and queues on another pool are not held up meanwhile.
+  Semaphore otherRan;
+  Queue::serial("test.blocked.other")->async([&] { otherRan.signal(); });
+  EXPECT_TRUE(arrives(otherRan));
 
   for (int i = 0; i < kQueues; ++i) release.signal();
   EXPECT_TRUE(arrivesTimes(finished, kQueues));
+}
+
+TEST(SerialQueue, SyncOnAnIdleQueueRunsOnTheCallingThreadAsTheQueue) {
+  auto queue = Queue::serial("test.inline");
+  std::thread::id ranOn;
+  const Queue* current = nullptr;
+  queue->sync([&] {
+    ranOn = std::this_thread::get_id();
+    current = Queue::current();
+  });
+  EXPECT_EQ(ranOn, std::this_thread::get_id());
+  EXPECT_EQ(current, queue.get());
 }
 
 TEST(Queue, RejectsEmptyWorkAndZeroWidth) {

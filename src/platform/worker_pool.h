@@ -1,0 +1,90 @@
+// WorkerPool: the threads that queues run their work on. A queue is an ordering, not a thread:
+// serial and concurrent queues hand their work to a pool, and any number of queues share one.
+//
+// A pool keeps `minimum` workers. It starts another only while no worker is free and at least one
+// of its workers is blocked (waiting on a Semaphore inside a work item), up to `maximum`: a pool
+// whose work never blocks stays at its minimum, and one whose workers all wait for something still
+// makes progress. Workers above the minimum end after `idleTimeout` without work. When a thread
+// cannot be started (a task limit, memory), the work waits for a worker that exists: a shortage of
+// threads delays work, it never fails it and never throws.
+//
+// The daemon has two pools: shared() for its own queues (the secure-association session's, the HTTP
+// sessions' callbacks), and connections() for the peers' queues, whose work may block for minutes
+// on a session opening; so blocked connection work can never starve the session or HTTP callbacks.
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <cstddef>
+#include <deque>
+#include <functional>
+#include <mutex>
+#include <string>
+
+namespace platform {
+
+class WorkerPool {
+ public:
+  struct Limits {
+    unsigned minimum = 1;
+    unsigned maximum = 64;
+    std::chrono::milliseconds idleTimeout{10000};
+  };
+
+  // Starts the minimum of workers, as many as the system allows.
+  WorkerPool(std::string name, Limits limits);
+  // Runs everything posted (and whatever that posts), then joins the workers. Must not be called
+  // from one of them.
+  ~WorkerPool();
+  WorkerPool(const WorkerPool&) = delete;
+  WorkerPool& operator=(const WorkerPool&) = delete;
+
+  // post runs `job` on a worker, in the order posted among jobs that wait. It fails only by
+  // throwing std::bad_alloc, when the job cannot be stored.
+  void post(std::function<void()> job);
+  // setMaximum changes how many workers the pool may grow to (at least its minimum).
+  void setMaximum(unsigned maximum);
+
+  const std::string& name() const { return name_; }
+  // threads counts the workers alive now.
+  size_t threads() const;
+  // threadStartFailures counts the workers that could not be started since the pool was made.
+  size_t threadStartFailures() const;
+
+  // The process-wide pools; never destroyed, since their workers may still be blocked at exit.
+  static WorkerPool& shared();
+  static WorkerPool& connections();
+
+  // Marks the calling thread, if it is a worker of a pool, as blocked while the object lives.
+  class Blocking {
+   public:
+    Blocking();
+    ~Blocking();
+    Blocking(const Blocking&) = delete;
+    Blocking& operator=(const Blocking&) = delete;
+
+   private:
+    WorkerPool* pool_;
+  };
+
+ private:
+  void work();
+  // Both called with mutex_ held.
+  void growIfNeeded();
+  bool startWorker();
+  void setBlocked(bool blocked);
+
+  const std::string name_;
+  mutable std::mutex mutex_;
+  std::condition_variable available_;  // a job was posted, or the pool is shutting down
+  std::condition_variable ended_;      // a worker ended
+  Limits limits_;
+  std::deque<std::function<void()>> jobs_;
+  size_t threads_ = 0;
+  size_t idle_ = 0;     // waiting for a job
+  size_t blocked_ = 0;  // running a job that waits for something
+  size_t startFailures_ = 0;
+  bool stopping_ = false;
+};
+
+}  // namespace platform
