@@ -52,6 +52,16 @@ class Reader {
     return true;
   }
 
+  bool count(std::string_view key, unsigned& out, int64_t lowest, int64_t highest) {
+    const toml::node* n = node(key);
+    if (!n) return true;
+    const toml::value<int64_t>* v = n->as_integer();
+    if (!v || v->get() < lowest || v->get() > highest)
+      return fail(std::string(key), "expected a whole number from " + std::to_string(lowest) + " to " + std::to_string(highest));
+    out = static_cast<unsigned>(v->get());
+    return true;
+  }
+
   bool url(std::string_view key, std::string& out) {
     std::string raw;
     if (!string(key, raw, true)) return false;
@@ -69,7 +79,7 @@ class Reader {
 
 void collectUnknownKeys(const toml::table& table, const std::string& prefix, std::vector<std::string>& unknown) {
   static const std::map<std::string, std::vector<std::string>, std::less<>> known = {
-      {"", {"device", "servers", "tls", "sap", "settings", "entitlements", "log"}},
+      {"", {"device", "servers", "tls", "sap", "settings", "entitlements", "log", "service"}},
       {"device", {"internal_build", "device_class"}},
       {"servers", {"prod", "it", "ut", "maint"}},
       {"servers.prod", {"static_content", "api"}},
@@ -80,6 +90,7 @@ void collectUnknownKeys(const toml::table& table, const std::string& prefix, std
       {"sap", {"trust_anchor"}},
       {"settings", {"suite_dir"}},
       {"entitlements", {"dir"}},
+      {"service", {"max_workers"}},
       {"log", {"level", "private_data"}},
   };
   auto allowed = known.find(prefix);
@@ -163,6 +174,8 @@ std::optional<Configuration> loadConfiguration(const std::filesystem::path& path
     if (!parsed) ok = r.fail("log.level", "'" + level + "' is not one of debug, info, default, error, fault");
     else c.logLevel = *parsed;
   }
+  // Each connection worker costs a thread; past a few thousand the bound no longer protects anything.
+  ok = ok && r.count("service.max_workers", c.maxWorkers, 2, 4096);
   if (!ok) return failWith(r.error());
 
   std::vector<std::string> unknown;

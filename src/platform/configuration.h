@@ -2,8 +2,8 @@
 //
 // Required: [device] internal_build and device_class, [servers.prod] static_content and api,
 // [sap] trust_anchor. Optional: [servers.it], [servers.ut], [servers.maint] (each complete when
-// present), [tls] ca_file, [settings] suite_dir, [entitlements] dir, [log] level and
-// private_data. Server values are absolute https base URLs; a trailing slash is dropped. Any
+// present), [tls] ca_file, [settings] suite_dir, [entitlements] dir, [service] max_workers,
+// [log] level and private_data. Server values are absolute https base URLs; a trailing slash is dropped. Any
 // problem is an error naming the file and the key; unknown keys are collected as warnings.
 #pragma once
 
@@ -34,6 +34,7 @@ struct Configuration {
   std::filesystem::path entitlementsDirectory = "/etc/zlka/entitlements.d";
   LogLevel logLevel = LogLevel::Default;
   bool privateData = false;
+  unsigned maxWorkers = 64;  // [service] max_workers: threads that connection work may use
   std::vector<std::string> warnings;  // "zlkad.toml: unknown key 'x.y'"
 
   static constexpr char kDefaultPath[] = "/etc/zlka/zlkad.toml";

@@ -19,6 +19,24 @@
 namespace platform {
 
 namespace {
+// sd-bus and sd-event call back through C, where no exception may pass: a handler that runs out
+// of a resource logs it and the loop serves on.
+template <auto Handler>
+struct Guarded;
+template <class R, class... A, R (*Handler)(A...)>
+struct Guarded<Handler> {
+  static R call(A... arguments) noexcept {
+    try {
+      return Handler(arguments...);
+    } catch (const std::exception& e) {
+      log(LogLevel::Error, "Messaging: a handler failed: %s", e.what());
+    } catch (...) {
+      log(LogLevel::Error, "Messaging: a handler failed");
+    }
+    return R{};
+  }
+};
+
 ListenerOptions& configuredOptions() {
   static ListenerOptions options;
   return options;
@@ -53,10 +71,10 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     if (rc < 0) return fail("cannot attach the bus to the event loop", rc);
     wakeFd_.reset(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
     if (!wakeFd_) return fail("cannot create an eventfd", -errno);
-    if ((rc = addSource(sd_event_add_io, wakeFd_.get(), EPOLLIN, &Core::onPosted)) < 0)
+    if ((rc = addSource(sd_event_add_io, wakeFd_.get(), EPOLLIN, &Guarded<&Core::onPosted>::call)) < 0)
       return fail("cannot watch the eventfd", rc);
     for (int sig : {SIGTERM, SIGINT, SIGHUP})
-      if ((rc = addSource(sd_event_add_signal, sig, &Core::onSignal)) < 0)
+      if ((rc = addSource(sd_event_add_signal, sig, &Guarded<&Core::onSignal>::call)) < 0)
         return fail("cannot handle signals (call Listener::blockSignals() first)", rc);
     buildVTable();
     sd_bus_slot* slot = nullptr;
@@ -65,7 +83,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     vtableSlot_.reset(slot);
     if (rc < 0) return fail("cannot export " + options_.objectPath, rc);
     rc = sd_bus_match_signal(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
-                             "NameOwnerChanged", &Core::onNameOwnerChanged, this);
+                             "NameOwnerChanged", &Guarded<&Core::onNameOwnerChanged>::call, this);
     matchSlot_.reset(slot);
     if (rc < 0) return fail("cannot watch peers leaving the bus", rc);
     rc = sd_bus_request_name(bus_.get(), options_.serviceName.c_str(), 0);
@@ -80,10 +98,14 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   }
 
   // Runs `work` on the bus thread.
-  void post(std::function<void()> work) {
-    {
+  // Runs `work` on the bus thread. Fails only for want of memory, and then drops the work.
+  void post(std::function<void()> work) noexcept {
+    try {
       std::lock_guard lock(postMutex_);
       posted_.push_back(std::move(work));
+    } catch (const std::exception& e) {
+      log(LogLevel::Error, "Messaging: cannot hand work to the bus thread: %s", e.what());
+      return;
     }
     uint64_t one = 1;
     if (::write(wakeFd_.get(), &one, sizeof one) < 0) {
@@ -218,21 +240,24 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     bool identified = false;
   };
 
+  // The peer's entry, made at its first message. Nothing is recorded when making it fails (the
+  // delegate may run out of threads or memory), so that the peer's next message tries again.
   Peer& peerFor(const std::string& sender) {
     auto it = peers_.find(sender);
     if (it != peers_.end()) return it->second;
-    Peer& peer = peers_[sender];
-    connectionCount_.store(peers_.size());
+    Peer made;
     auto connection = std::make_shared<Connection>(sender);
     std::shared_ptr<ListenerDelegate> delegate = owner_.delegate();
-    if (delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection)) peer.connection = std::move(connection);
+    if (delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection)) made.connection = std::move(connection);
+    if (made.connection) made.request = std::make_unique<CredentialsRequest>(CredentialsRequest{this, sender});
+    Peer& peer = peers_.emplace(sender, std::move(made)).first->second;
+    connectionCount_.store(peers_.size());
     if (!peer.connection) return peer;
     // Asked once, without waiting: the answer comes back to this thread like any other message.
-    peer.request = std::make_unique<CredentialsRequest>(CredentialsRequest{this, sender});
     sd_bus_slot* slot = nullptr;
     int rc = sd_bus_call_method_async(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                                      "org.freedesktop.DBus", "GetConnectionCredentials", &Core::onCredentials,
-                                      peer.request.get(), "s", sender.c_str());
+                                      "org.freedesktop.DBus", "GetConnectionCredentials",
+                                      &Guarded<&Core::onCredentials>::call, peer.request.get(), "s", sender.c_str());
     peer.credentialsCall.reset(slot);
     if (rc < 0) identify(peer, nullptr, std::string(strerror(-rc)));
     return peer;
@@ -316,9 +341,16 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     });
   }
 
-  static int onMethodCall(sd_bus_message* m, void* userdata, sd_bus_error*) {
+  static int onMethodCall(sd_bus_message* m, void* userdata, sd_bus_error*) noexcept {
     auto* self = static_cast<Core*>(userdata);
-    return self->dispatch(m);
+    try {
+      return self->dispatch(m);
+    } catch (const std::exception& e) {
+      // Before its reply state exists (dispatch's last step), a call is answered here.
+      log(LogLevel::Error, "Cannot serve a call to %s: %s", memberOf(m), e.what());
+      self->sendErrorNow(m, BusError{kBusErrorFailed, "The service is short of resources; try again."});
+    }
+    return 1;
   }
 
   int dispatch(sd_bus_message* m) {
@@ -359,13 +391,20 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     }
     auto state = std::make_shared<Reply::State>();
     state->core = weak_from_this();
-    state->call = sd_bus_message_ref(m);
     state->id = ++nextId_;
     pending_.emplace(state->id, state);
+    // From here on the call is answered exactly once through its state: dropped unanswered (as
+    // when it cannot be queued for want of memory), the state answers with an error itself.
+    state->call = sd_bus_message_ref(m);
     inFlight_.fetch_add(1);
     lastActivity_ = now();
-    if (peer.identified) schedule(connection, std::move(decoded.invocation), Reply(state));
-    else peer.backlog.emplace_back(std::move(decoded.invocation), Reply(state));
+    Reply reply(state);
+    try {
+      if (peer.identified) schedule(connection, std::move(decoded.invocation), reply);
+      else peer.backlog.emplace_back(std::move(decoded.invocation), reply);
+    } catch (const std::exception& e) {
+      log(LogLevel::Error, "Cannot queue a call to %s: %s", member, e.what());
+    }
     return 1;
   }
 
@@ -392,7 +431,13 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       std::lock_guard lock(self->postMutex_);
       work.swap(self->posted_);
     }
-    for (auto& w : work) w();
+    for (auto& w : work) {
+      try {
+        w();
+      } catch (const std::exception& e) {
+        log(LogLevel::Error, "Messaging: work on the bus thread failed: %s", e.what());
+      }
+    }
     return 0;
   }
 
@@ -417,7 +462,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       sd_event_exit(event_.get(), 0);
       return;
     }
-    addSource(sd_event_add_time_relative, CLOCK_MONOTONIC, toUsec(options_.drainLimit), uint64_t{0}, &Core::onDrainLimit);
+    addSource(sd_event_add_time_relative, CLOCK_MONOTONIC, toUsec(options_.drainLimit), uint64_t{0}, &Guarded<&Core::onDrainLimit>::call);
   }
 
   static int onDrainLimit(sd_event_source*, uint64_t, void* userdata) {
@@ -436,7 +481,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
 
   void armIdleTimer(uint64_t at) {
     if (!idleTimer_) {
-      if (addSource(sd_event_add_time, CLOCK_MONOTONIC, at, uint64_t{0}, &Core::onIdleTimer) >= 0) idleTimer_ = sources_.back().get();
+      if (addSource(sd_event_add_time, CLOCK_MONOTONIC, at, uint64_t{0}, &Guarded<&Core::onIdleTimer>::call) >= 0) idleTimer_ = sources_.back().get();
       return;
     }
     sd_event_source_set_time(idleTimer_, at);

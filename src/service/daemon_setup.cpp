@@ -10,6 +10,7 @@
 #include "platform/entitlement_manifests.h"
 #include "platform/listener.h"
 #include "platform/log.h"
+#include "platform/worker_pool.h"
 #include "service/zlka_network_bus_interface.h"
 #include "tarvexsap/tarvex_sap.h"
 
@@ -91,6 +92,7 @@ std::optional<int> setUpDaemon(int argc, char** argv) {
   }
 
   platform::setDeviceFacts(config->device);
+  platform::WorkerPool::connections().setMaximum(config->maxWorkers);
   auto manifests = std::make_shared<platform::EntitlementManifests>(config->entitlementsDirectory);
   size_t entries = manifests->reload();
   platform::log(LogLevel::Info, "Loaded %zu entitlement manifest entr(ies) from %s", entries, config->entitlementsDirectory.string());
