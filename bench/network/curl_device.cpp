@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/base64.h"
+#include "platform/uuid.h"
 #include "sap/tarvex_sap_primitives.h"
 
 namespace netbench {
@@ -33,7 +34,8 @@ size_t onHeader(char* data, size_t size, size_t count, void* user) {
 
 }  // namespace
 
-CurlDevice::CurlDevice(std::string baseURL, const std::filesystem::path& caFile) : baseURL_(std::move(baseURL)) {
+CurlDevice::CurlDevice(std::string baseURL, const std::filesystem::path& caFile)
+    : baseURL_(std::move(baseURL)), sessionId_(platform::UUID().UUIDString()) {
   easy_ = curl_easy_init();
   if (!easy_) throw std::runtime_error("curl_easy_init failed");
   curl_easy_setopt(easy_, CURLOPT_CAINFO, caFile.c_str());

@@ -39,7 +39,7 @@ class CurlDevice {
   CURL* easy_ = nullptr;
   QVSAPContextOpaque_* context_ = nullptr;
   TarvexHWInfo_ hw_{};
-  std::string sessionId_ = "8F14E45F-CEEA-467F-A3F2-5C4F9B1E2D7A";
+  std::string sessionId_;  // one association per device: a second handshake under an id replaces the first
 };
 
 }  // namespace netbench

@@ -1,21 +1,45 @@
-// D-Bus round trips through zlkad against zlka-devserver on loopback, and the daemon's memory.
+// zlkad through D-Bus against zlka-devserver on loopback, each figure beside its floor measured in
+// the same run:
+// - the D-Bus floor: org.freedesktop.DBus.Peer.Ping to zlkad through the same bus;
+// - the HTTPS floor: the same signed POSTs made with bare libcurl on one reused connection;
+// - each operation's p50/p99 and its p50 as a multiple of the two floors' p50s added up;
+// - throughput with 1, 8, 64 and 256 concurrent clients beside the floors' at the same concurrency;
+// - zlkad's threads and unique memory (Private_Clean + Private_Dirty) idle, under 64 clients, and
+//   with 1,000 idle peers that have each called once (and a new caller still answered).
 #include <benchmark/benchmark.h>
+#include <sys/resource.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <fstream>
-#include <future>
+#include <map>
 #include <memory>
+#include <nlohmann/json.hpp>
+#include <thread>
 #include <vector>
 
+#include "../network/curl_device.h"
 #include "client/zlka_client.h"
+#include "platform/base64.h"
+#include "platform/handles.h"
 #include "service/daemon_harness.h"
+#include "tarvexsap/tarvex_sap.h"
 
 namespace {
 
+using Clock = std::chrono::steady_clock;
+constexpr char kName[] = "com.kestro.ZLKAuthentication.ZLKANetwork";
+constexpr char kPath[] = "/com/kestro/ZLKAuthentication/ZLKANetwork";
+constexpr char kInterface[] = "com.kestro.ZLKAuthentication.ZLKANetworkProtocol";
+constexpr char kUUID[] = "3F2504E0-4F89-11D3-9A0C-0305E82C3301";
+
+enum class Operation { metadata, activation, confirmation };
+
 struct Stack {
   service_test::Harness harness;
-  std::unique_ptr<zlka_client::ZLKAClient> client;
+  std::string trustAnchor;
   bool ready = false;
   Stack() {
     harness.writeManifest("bench", std::filesystem::read_symlink("/proc/self/exe").string(),
@@ -24,13 +48,12 @@ struct Stack {
       std::fprintf(stderr, "zlkad did not start:\n%s\n", harness.daemon() ? harness.daemon()->standardError().c_str() : "");
       return;
     }
-    auto made = zlka_client::ZLKAClient::connect({.bus = harness.busAddress()});
-    if (!made.ok()) return;
-    client = std::move(made).value();
-    auto opened = client->confirmActivation({.token = service_test::sampleToken(), .uuid = "U"});  // opens the session
-    ready = opened.ok();
-    if (!ready) std::fprintf(stderr, "first call failed: %s\n%s\n", opened.error().description().c_str(),
-                             harness.daemon()->standardError().c_str());
+    std::ifstream in(harness.stateDirectory() / "sap-root.pem", std::ios::binary);
+    trustAnchor.assign(std::istreambuf_iterator<char>(in), {});
+    TarvexSAPConfig sap{reinterpret_cast<const uint8_t*>(trustAnchor.data()), trustAnchor.size(), nullptr};
+    auto client = zlka_client::ZLKAClient::connect({.bus = harness.busAddress()});
+    ready = TarvexSAPConfigure(&sap) == 0 && client.ok() &&
+            client.value()->confirmActivation({.token = service_test::sampleToken(), .uuid = kUUID}).ok();  // opens the session
   }
 };
 
@@ -39,72 +62,228 @@ Stack& stack() {
   return s;
 }
 
-uint64_t daemonKiB(const char* field) {
-  std::ifstream in("/proc/" + std::to_string(stack().harness.daemon()->pid()) + "/status");
-  std::string line;
-  while (std::getline(in, line))
-    if (line.rfind(field, 0) == 0) return std::stoull(line.substr(std::string(field).size()));
-  return 0;
+pid_t daemonPid() { return stack().harness.daemon()->pid(); }
+
+size_t daemonThreads() {
+  auto tasks = std::filesystem::directory_iterator("/proc/" + std::to_string(daemonPid()) + "/task");
+  return static_cast<size_t>(std::distance(begin(tasks), end(tasks)));
 }
 
-template <class Call>
-void roundTrips(benchmark::State& state, Call call) {
+// Memory that is the daemon's alone: what a second instance would add.
+double daemonUniqueKiB() {
+  std::ifstream in("/proc/" + std::to_string(daemonPid()) + "/smaps_rollup");
+  double kib = 0;
+  for (std::string line; std::getline(in, line);)
+    if (line.starts_with("Private_Clean:") || line.starts_with("Private_Dirty:")) kib += std::stod(line.substr(line.find(':') + 1));
+  return kib;
+}
+
+struct Percentiles {
+  double p50 = 0, p99 = 0;
+};
+Percentiles percentiles(std::vector<double> samples) {
+  if (samples.empty()) return {};
+  std::sort(samples.begin(), samples.end());
+  auto at = [&](double q) { return samples[std::min(samples.size() - 1, static_cast<size_t>(q * double(samples.size())))]; };
+  return {at(0.50), at(0.99)};
+}
+
+std::map<std::string, Percentiles> gFloor;  // "dbus", and each endpoint
+std::map<int, double> gFloorRate;           // clients -> operations per second
+
+const char* endpointOf(Operation op) {
+  return op == Operation::metadata ? "queryProductPlan" : op == Operation::activation ? "activateAccessory" : "ackAccessory";
+}
+
+// The body zlkad sends for the operation, byte for byte.
+std::string bodyOf(Operation op) {
+  nlohmann::json body{{"tokens", {platform::base64Encode(service_test::sampleToken().span())}}, {"uuid", kUUID}};
+  if (op == Operation::metadata) body["locale"] = "en_US";
+  return body.dump();
+}
+
+platform::BusPtr connectRaw() {
+  sd_bus* bus = nullptr;
+  if (sd_bus_new(&bus) < 0) return nullptr;
+  platform::BusPtr owned(bus);
+  if (sd_bus_set_address(bus, stack().harness.busAddress().c_str()) < 0 || sd_bus_set_bus_client(bus, 1) < 0 || sd_bus_start(bus) < 0)
+    return nullptr;
+  return owned;
+}
+
+bool ping(sd_bus* bus) {
+  return sd_bus_call_method(bus, kName, kPath, "org.freedesktop.DBus.Peer", "Ping", nullptr, nullptr, "") >= 0;
+}
+
+template <class R>
+bool succeeded(const R& result) {
+  if (!result.ok()) std::fprintf(stderr, "bench_service: %s\n", result.error().description().c_str());
+  return result.ok();
+}
+
+bool call(zlka_client::ZLKAClient& client, Operation op) {
+  switch (op) {
+    case Operation::metadata:
+      return succeeded(client.requestMetadata({.token = service_test::sampleToken(), .uuid = kUUID, .requestedLocale = "en_US"}));
+    case Operation::activation:
+      return succeeded(client.requestActivation({.token = service_test::sampleToken(), .uuid = kUUID}));
+    case Operation::confirmation:
+      return succeeded(client.confirmActivation({.token = service_test::sampleToken(), .uuid = kUUID}));
+  }
+  return false;
+}
+
+template <class Step>
+void timed(benchmark::State& state, const std::string& floorKey, Step step) {
   if (!stack().ready) return state.SkipWithError("the daemon did not start");
   std::vector<double> micros;
   for (auto _ : state) {
-    auto start = std::chrono::steady_clock::now();
-    if (!call(*stack().client)) return state.SkipWithError("an operation failed");
-    micros.push_back(std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count());
+    auto start = Clock::now();
+    if (!step()) return state.SkipWithError("a round trip failed");
+    micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
   }
-  std::sort(micros.begin(), micros.end());
-  auto pct = [&](double p) { return micros.empty() ? 0.0 : micros[std::min(micros.size() - 1, size_t(p * micros.size()))]; };
-  state.counters["p50_us"] = pct(0.50);
-  state.counters["p90_us"] = pct(0.90);
-  state.counters["p99_us"] = pct(0.99);
-  state.counters["ops_per_second"] = benchmark::Counter(double(state.iterations()), benchmark::Counter::kIsRate);
+  Percentiles p = percentiles(std::move(micros));
+  state.counters["p50_us"] = p.p50;
+  state.counters["p99_us"] = p.p99;
+  if (!floorKey.empty()) gFloor[floorKey] = p;
 }
 
-void BM_DBusMetadata(benchmark::State& state) {
-  roundTrips(state, [](zlka_client::ZLKAClient& c) {
-    return c.requestMetadata({.token = service_test::sampleToken(), .uuid = "U", .requestedLocale = "en_US"}).ok();
-  });
-}
-void BM_DBusActivation(benchmark::State& state) {
-  roundTrips(state, [](zlka_client::ZLKAClient& c) { return c.requestActivation({.token = service_test::sampleToken(), .uuid = "U"}).ok(); });
-}
-void BM_DBusConfirmation(benchmark::State& state) {
-  roundTrips(state, [](zlka_client::ZLKAClient& c) { return c.confirmActivation({.token = service_test::sampleToken(), .uuid = "U"}).ok(); });
+void BM_FloorDBusPing(benchmark::State& state) {
+  platform::BusPtr bus = connectRaw();
+  timed(state, "dbus", [&] { return bus && ping(bus.get()); });
 }
 
-// Resident memory of the daemon after start-up, and its high-water mark while 64 clients, each on
-// its own connection, have a call in flight at once.
-void BM_DaemonMemory(benchmark::State& state) {
+void BM_FloorHTTPS(benchmark::State& state, Operation op) {
+  netbench::CurlDevice device(stack().harness.server().baseURL(), stack().harness.stateDirectory() / "ca.pem");
+  device.associate();
+  const std::string body = bodyOf(op);
+  netbench::CurlAnswer answer;
+  timed(state, endpointOf(op), [&] { return device.post(endpointOf(op), body, answer); });
+}
+
+void BM_Operation(benchmark::State& state, Operation op) {
+  auto client = zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()});
+  if (!client.ok()) return state.SkipWithError("no bus");
+  timed(state, "", [&] { return call(*client.value(), op); });
+  double floor = gFloor["dbus"].p50 + gFloor[endpointOf(op)].p50;
+  if (floor > 0) state.counters["p50_over_floor"] = state.counters["p50_us"] / floor;
+}
+
+// Operations per second with `clients` callers each on a connection of its own, calling in a loop
+// for a fixed time; the floor does the same with a Ping and a bare signed POST per operation.
+template <class Worker>
+double rate(int clients, std::chrono::milliseconds duration, Worker makeWorker) {
+  using Step = decltype(makeWorker());
+  std::vector<Step> steps;
+  for (int i = 0; i < clients; ++i) steps.push_back(makeWorker());
+  std::atomic<long> done{0};
+  std::atomic<bool> failed{false};
+  const auto stop = Clock::now() + duration;
+  {
+    std::vector<std::jthread> threads;
+    for (Step& step : steps)
+      threads.emplace_back([&] {
+        while (Clock::now() < stop && !failed)
+          if (step()) ++done;
+          else failed = true;
+      });
+  }
+  return failed ? -1 : double(done) / std::chrono::duration<double>(duration).count();
+}
+
+void BM_ThroughputFloor(benchmark::State& state) {
   if (!stack().ready) return state.SkipWithError("the daemon did not start");
-  uint64_t idle = daemonKiB("VmRSS:");
-  for (auto _ : state) {
-    std::vector<std::unique_ptr<zlka_client::ZLKAClient>> clients;
-    for (int i = 0; i < 64; ++i) {
-      auto made = zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()});
-      if (!made.ok()) return state.SkipWithError("no bus");
-      clients.push_back(std::move(made).value());
-    }
-    std::vector<std::promise<bool>> done(clients.size());
-    for (size_t i = 0; i < clients.size(); ++i)
-      clients[i]->requestActivationAsync({.token = service_test::sampleToken(), .uuid = "U"},
-                                         [&done, i](auto r) { done[i].set_value(r.ok()); });
-    for (auto& d : done)
-      if (!d.get_future().get()) return state.SkipWithError("an operation failed");
-  }
-  state.counters["rss_idle_KiB"] = double(idle);
-  state.counters["rss_peak_64_clients_KiB"] = double(daemonKiB("VmHWM:"));
-  state.counters["rss_after_KiB"] = double(daemonKiB("VmRSS:"));
+  const int clients = static_cast<int>(state.range(0));
+  double perSecond = 0;
+  for (auto _ : state)
+    perSecond = rate(clients, std::chrono::milliseconds(1500), [] {
+      auto bus = std::make_shared<platform::BusPtr>(connectRaw());
+      auto device = std::make_shared<netbench::CurlDevice>(stack().harness.server().baseURL(), stack().harness.stateDirectory() / "ca.pem");
+      device->associate();
+      auto body = bodyOf(Operation::confirmation);
+      return [bus, device, body] {
+        netbench::CurlAnswer answer;
+        return *bus && ping(bus->get()) && device->post("ackAccessory", body, answer);
+      };
+    });
+  if (perSecond < 0) return state.SkipWithError("a floor operation failed");
+  gFloorRate[clients] = perSecond;
+  state.counters["ops_per_second"] = perSecond;
 }
 
-BENCHMARK(BM_DBusMetadata)->UseRealTime();
-BENCHMARK(BM_DBusActivation)->UseRealTime();
-BENCHMARK(BM_DBusConfirmation)->UseRealTime();
-BENCHMARK(BM_DaemonMemory)->UseRealTime()->Iterations(3);
+void BM_Throughput(benchmark::State& state) {
+  if (!stack().ready) return state.SkipWithError("the daemon did not start");
+  const int clients = static_cast<int>(state.range(0));
+  double perSecond = 0;
+  std::atomic<size_t> peakThreads{0};
+  std::atomic<bool> measuring{true};
+  std::jthread sampler([&] {
+    while (measuring) {
+      peakThreads = std::max(peakThreads.load(), daemonThreads());
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+  });
+  for (auto _ : state)
+    perSecond = rate(clients, std::chrono::milliseconds(1500), [&] {
+      auto client = std::shared_ptr<zlka_client::ZLKAClient>(
+          zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()}).value().release());
+      return [client] { return call(*client, Operation::confirmation); };
+    });
+  measuring = false;
+  if (perSecond < 0) return state.SkipWithError("an operation failed");
+  state.counters["ops_per_second"] = perSecond;
+  if (gFloorRate.count(clients)) state.counters["over_floor"] = perSecond / gFloorRate[clients];
+  state.counters["daemon_threads_peak"] = double(peakThreads.load());
+  if (clients == 64) state.counters["unique_KiB_after_64"] = daemonUniqueKiB();
+}
+
+void BM_Resources(benchmark::State& state) {
+  if (!stack().ready) return state.SkipWithError("the daemon did not start");
+  for (auto _ : state) {
+    std::this_thread::sleep_for(std::chrono::seconds(1));
+    state.counters["idle_threads"] = double(daemonThreads());
+    state.counters["idle_unique_KiB"] = daemonUniqueKiB();
+    // A thousand peers that have each called once and stay connected.
+    std::vector<platform::BusPtr> peers;
+    for (int i = 0; i < 1000; ++i) {
+      platform::BusPtr peer = connectRaw();
+      if (!peer) return state.SkipWithError("cannot connect 1,000 peers");
+      sd_bus_message* answer = nullptr;
+      if (sd_bus_call_method(peer.get(), kName, kPath, kInterface, "ConfirmActivationForToken", nullptr, &answer, "a{sv}", 2,
+                             "token", "ay", 2, 0x30, 0x00, "uuid", "s", kUUID) < 0)
+        return state.SkipWithError("a peer's call was not answered");
+      sd_bus_message_unref(answer);
+      peers.push_back(std::move(peer));
+    }
+    state.counters["threads_1000_peers"] = double(daemonThreads());
+    state.counters["unique_KiB_1000_peers"] = daemonUniqueKiB();
+    auto newcomer = zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()});
+    state.counters["new_caller_answered"] = newcomer.ok() && call(*newcomer.value(), Operation::confirmation);
+  }
+}
+
+BENCHMARK(BM_FloorDBusPing)->UseRealTime();
+BENCHMARK_CAPTURE(BM_FloorHTTPS, metadata, Operation::metadata)->UseRealTime();
+BENCHMARK_CAPTURE(BM_FloorHTTPS, activation, Operation::activation)->UseRealTime();
+BENCHMARK_CAPTURE(BM_FloorHTTPS, confirmation, Operation::confirmation)->UseRealTime();
+BENCHMARK_CAPTURE(BM_Operation, metadata, Operation::metadata)->UseRealTime();
+BENCHMARK_CAPTURE(BM_Operation, activation, Operation::activation)->UseRealTime();
+BENCHMARK_CAPTURE(BM_Operation, confirmation, Operation::confirmation)->UseRealTime();
+BENCHMARK(BM_ThroughputFloor)->Arg(1)->Arg(8)->Arg(64)->Arg(256)->UseRealTime()->Iterations(1);
+BENCHMARK(BM_Throughput)->Arg(1)->Arg(8)->Arg(64)->Arg(256)->UseRealTime()->Iterations(1);
+BENCHMARK(BM_Resources)->UseRealTime()->Iterations(1);
 
 }  // namespace
 
-BENCHMARK_MAIN();
+int main(int argc, char** argv) {
+  // A thousand peers need a thousand descriptors here.
+  rlimit files{};
+  if (getrlimit(RLIMIT_NOFILE, &files) == 0) {
+    files.rlim_cur = files.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &files);
+  }
+  benchmark::Initialize(&argc, argv);
+  benchmark::RunSpecifiedBenchmarks();
+  benchmark::Shutdown();
+  return 0;
+}

@@ -33,6 +33,9 @@ PrivateBus::PrivateBus(bool anyUser) {
                            "  <type>session</type>\n"
                            "  <listen>unix:path=" << (directory_ / "socket").string() << "</listen>\n"
                            "  <auth>EXTERNAL</auth>\n"
+                           // Room for the benchmark's thousand idle peers.
+                           "  <limit name=\"max_completed_connections\">4096</limit>\n"
+                           "  <limit name=\"max_connections_per_user\">4096</limit>\n"
                            "  <policy context=\"default\">\n"
                         << (anyUser ? "    <allow user=\"*\"/>\n" : "") <<
                            "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
