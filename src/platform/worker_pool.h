@@ -28,7 +28,7 @@ class WorkerPool {
   struct Limits {
     unsigned minimum = 1;
     unsigned maximum = 64;
-    std::chrono::milliseconds idleTimeout{10000};
+    std::chrono::milliseconds idleTimeout{5000};
   };
 
   // Starts the minimum of workers, as many as the system allows.
