@@ -1,7 +1,11 @@
 #include "tsap_test_support.h"
 
+#include "tarvexsap/tsap_crypto.h"
+#include "tarvexsap/tsap_protocol.h"
+
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdlib>
 
 namespace tsaptest {
@@ -10,14 +14,23 @@ Bytes bytesOf(std::string_view text) {
     return Bytes(text.begin(), text.end());
 }
 
-TestPKI TestPKI::make(const std::string &name, const TarvexSAPValidity &setupValidity) {
-    TestPKI pki;
-    pki.root = TarvexSAPMakeRoot(name + " SAP Root");
-    pki.setup = TarvexSAPIssueSetupCertificate(pki.root, name + " Setup", setupValidity);
-    pki.rootPEM = TarvexSAPCertToPEM(pki.root.certificate.get());
-    pki.setupDER = TarvexSAPCertToDER(pki.setup.certificate.get());
-    return pki;
+Bytes operator+(Bytes a, const Bytes &b) {
+    a.insert(a.end(), b.begin(), b.end());
+    return a;
 }
+
+Bytes fromHex(std::string_view hex) {
+    Bytes out;
+    for (std::size_t i = 0; i + 1 < hex.size(); i += 2) {
+        out.push_back(static_cast<uint8_t>(std::stoul(std::string(hex.substr(i, 2)), nullptr, 16)));
+    }
+    return out;
+}
+
+TestPKI::TestPKI(const std::string &name, const TarvexSAPValidity &setupValidity)
+    : root(TarvexSAPMakeRoot(name + " SAP Root")),
+      setup(TarvexSAPIssueSetupCertificate(root, name + " Setup", setupValidity)),
+      rootPEM(TarvexSAPCertToPEM(root.certificate.get())), setupDER(TarvexSAPCertToDER(setup.certificate.get())) {}
 
 void TestPKI::trust(const char *machineIDPath) const {
     const TarvexSAPConfig config{reinterpret_cast<const uint8_t *>(rootPEM.data()), rootPEM.size(), machineIDPath};
@@ -28,24 +41,19 @@ std::unique_ptr<TarvexSAPServer> TestPKI::server(TarvexSAPServer::Clock clock) c
     return std::make_unique<TarvexSAPServer>(setupDER, setup.key.get(), std::move(clock));
 }
 
-Device::Device() : Device(TarvexHWInfo_{}) {}
-
-Device::Device(const TarvexHWInfo_ &hw) : hw_(hw) {
-    initStatus_ = TarvexSAPInit(&handle_, &hw_);
-}
+Device::Device(const TarvexHWInfo_ &hwInfo) : hw(hwInfo), initStatus(TarvexSAPInit(&handle, &hw)) {}
 
 Device::~Device() {
-    if (initStatus_ == kTarvexSAPOK) {
-        TarvexSAPTeardown(handle_);
+    if (initStatus == kTarvexSAPOK) {
+        TarvexSAPTeardown(handle);
     }
 }
 
-ExchangeResult Device::exchange(const Bytes &in, int32_t selector) {
-    ExchangeResult result;
+Exchanged Device::exchange(const Bytes &in, int32_t selector) {
+    Exchanged result;
     uint8_t *out = nullptr;
     uint32_t outLen = 0;
-    result.status =
-        TarvexSAPExchange(selector, &hw_, handle_, in.data(), in.size(), &out, &outLen, &result.returnCode);
+    result.status = TarvexSAPExchange(selector, &hw, handle, in.data(), in.size(), &out, &outLen, &result.returnCode);
     if (out != nullptr) {
         result.outReturned = true;
         result.out.assign(out, out + outLen);
@@ -54,53 +62,46 @@ ExchangeResult Device::exchange(const Bytes &in, int32_t selector) {
     return result;
 }
 
-std::optional<Bytes> Device::sign(const Bytes &data, int32_t *status) {
+int32_t Device::sign(const Bytes &data, Bytes *signature) {
     uint8_t *sig = nullptr;
     uint32_t sigLen = 0;
-    const int32_t s = TarvexSAPSign(handle_, data.data(), data.size(), &sig, &sigLen);
-    if (status != nullptr) {
-        *status = s;
+    const int32_t status = TarvexSAPSign(handle, data.data(), data.size(), &sig, &sigLen);
+    EXPECT_EQ(sig != nullptr, status == kTarvexSAPOK) << "a signature buffer only on success";
+    if (signature != nullptr && sig != nullptr) {
+        signature->assign(sig, sig + sigLen);
     }
-    if (sig == nullptr) {
-        return std::nullopt;
-    }
-    Bytes out(sig, sig + sigLen);
     std::free(sig);
-    if (s != kTarvexSAPOK) {
-        ADD_FAILURE() << "signature buffer returned with failure status " << s;
-        return std::nullopt;
-    }
-    return out;
+    return status;
 }
 
-int32_t Device::verify(const Bytes &signature, const Bytes &data) {
-    Bytes copy = data; // the primitive may write to it
-    return TarvexSAPVerify(handle_, signature.data(), signature.size(), copy.data(), copy.size());
+int32_t Device::verify(const Bytes &signature, Bytes data) {
+    return TarvexSAPVerify(handle, signature.data(), signature.size(), data.data(), data.size());
 }
 
-bool associate(Device &device, TarvexSAPServer &server, const std::string &sessionId, const Bytes &certificate,
-               std::chrono::seconds ttl) {
-    if (device.initStatus() != kTarvexSAPOK) {
-        ADD_FAILURE() << "init failed: " << device.initStatus();
-        return false;
-    }
-    const ExchangeResult request = device.exchange(certificate);
-    if (request.status != kTarvexSAPOK || request.returnCode != 1 || request.out.size() != 90) {
-        ADD_FAILURE() << "certificate exchange: status " << request.status << " returnCode "
-                      << int(request.returnCode) << " size " << request.out.size();
-        return false;
-    }
-    const auto answer = server.handshake(sessionId, request.out, ttl);
-    if (answer.status != TarvexSAPServerStatus::ok) {
-        ADD_FAILURE() << "server handshake: " << TarvexSAPServerStatusName(answer.status);
-        return false;
-    }
-    const ExchangeResult done = device.exchange(Bytes(answer.sessionInfo.begin(), answer.sessionInfo.end()));
-    if (done.status != kTarvexSAPOK || done.returnCode != 0 || done.outReturned) {
-        ADD_FAILURE() << "session-info exchange: status " << done.status << " returnCode " << int(done.returnCode);
-        return false;
-    }
-    return true;
+bool associate(Device &device, TarvexSAPServer &server, const std::string &sessionId, const Bytes &certificate) {
+    const Exchanged request = device.exchange(certificate);
+    const auto answer = server.handshake(sessionId, request.out, std::chrono::hours(1));
+    const Exchanged done = device.exchange(Bytes(answer.sessionInfo.begin(), answer.sessionInfo.end()));
+    const bool associated = device.initStatus == kTarvexSAPOK && request.status == kTarvexSAPOK &&
+                            request.returnCode == 1 && request.out.size() == 90 &&
+                            answer.status == TarvexSAPServerStatus::ok && done.status == kTarvexSAPOK &&
+                            done.returnCode == 0 && !done.outReturned;
+    EXPECT_TRUE(associated) << "init " << device.initStatus << ", request " << request.status << ", server "
+                            << TarvexSAPServerStatusName(answer.status) << ", session info " << done.status;
+    return associated;
+}
+
+Bytes resign(const Bytes &request, Bytes info, EVP_PKEY *signer) {
+    tsap::RequestBytes requestBytes{};
+    tsap::SessionInfoBytes infoBytes{};
+    std::copy_n(request.begin(), std::min(request.size(), requestBytes.size()), requestBytes.begin());
+    std::copy_n(info.begin(), 65, infoBytes.begin());
+    tsap::Digest t{};
+    std::array<uint8_t, 64> signature{};
+    EXPECT_TRUE(tsap::transcriptHash(requestBytes, infoBytes, t) && tsap::ed25519Sign(signer, t, signature));
+    info.resize(65);
+    info.insert(info.end(), signature.begin(), signature.end());
+    return info;
 }
 
 } // namespace tsaptest
