@@ -328,8 +328,8 @@ const TemplateRow kTemplates[] = {
 TEST(DERParseSequenceContent, MatchesItemsToTemplateRowsInOrder) {
   for (const TemplateRow& row : kTemplates) {
     SCOPED_TRACE(std::string(row.fields) + " / " + row.content);
-    const std::vector<DERFieldSpec> spec = fields(row.fields);
-    const auto count = static_cast<std::uint16_t>(spec.size());
+    const std::vector<DERFieldSpec> layout = fields(row.fields);
+    const auto count = static_cast<std::uint16_t>(layout.size());
     // The same content as an encoded SEQUENCE gives the same answer.
     const Input content = hex(row.content);
     Input sequence = content;
@@ -337,8 +337,8 @@ TEST(DERParseSequenceContent, MatchesItemsToTemplateRowsInOrder) {
     sequence.size += 2;
     for (const bool wrapped : {false, true}) {
       Record r;
-      const DERStatus status = wrapped ? DERParseSequence(sequence.slice(), count, spec.data(), &r, sizeof r)
-                                       : DERParseSequenceContent(content.slice(), count, spec.data(), &r, sizeof r);
+      const DERStatus status = wrapped ? DERParseSequence(sequence.slice(), count, layout.data(), &r, sizeof r)
+                                       : DERParseSequenceContent(content.slice(), count, layout.data(), &r, sizeof r);
       ASSERT_EQ(status, row.status) << (wrapped ? "as a SEQUENCE" : "as content");
       if (status != OK) continue;
       const std::uint8_t* start = wrapped ? sequence.at(2) : content.at(0);
@@ -369,9 +369,9 @@ TEST(DERParseSequenceContent, DestinationSizeBoundsClearingAndWriting) {
   for (const std::uint64_t offset : {kLastSlot + 1, kMax64 - 4}) {
     const DERFieldSpec badFirst[] = {{offset, DER_TAG_INTEGER, DER_FIELD_OPTIONAL}, {0, DER_TAG_BOOLEAN, 0}};
     const DERFieldSpec badSecond[] = {{0, DER_TAG_INTEGER, 0}, {offset, DER_TAG_BOOLEAN, DER_FIELD_OPTIONAL}};
-    for (const DERFieldSpec* spec : {badFirst, badSecond}) {
+    for (const DERFieldSpec* layout : {badFirst, badSecond}) {
       r.field[0].length = 7;
-      EXPECT_EQ(DERParseSequenceContent(content.slice(), 2, spec, &r, kSize), BAD);
+      EXPECT_EQ(DERParseSequenceContent(content.slice(), 2, layout, &r, kSize), BAD);
       EXPECT_EQ(r.field[0].length, 0u);
     }
   }
