@@ -8,6 +8,7 @@
 #include <deque>
 #include <map>
 #include <mutex>
+#include <system_error>
 #include <thread>
 #include <vector>
 
@@ -92,26 +93,47 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     curl_multi_cleanup(multi_);
   }
 
-  void startWorker() { worker_ = std::thread([this] { run(); }); }
 
   const std::shared_ptr<Queue>& callbackQueue() const { return callbackQueue_; }
 
   void submit(const std::shared_ptr<HTTPTaskState>& task) {
+    bool stopping;
     {
       std::lock_guard lock(mutex_);
-      if (!stopping_) {
+      stopping = stopping_;
+      if (!stopping && startWorker()) {
         toAdd_.push_back(task);
         curl_multi_wakeup(multi_);
         return;
       }
     }
-    complete(task, std::nullopt, std::nullopt, cancelledError(task->request.URL));
+    complete(task, std::nullopt, std::nullopt,
+             stopping ? cancelledError(task->request.URL)
+                      : transportError(CURLE_OUT_OF_MEMORY, "no thread could be started for the transfer", task->request.URL));
   }
 
   void cancel(const std::shared_ptr<HTTPTaskState>& task) {
     std::lock_guard lock(mutex_);
     toCancel_.push_back(task);
     curl_multi_wakeup(multi_);
+  }
+
+  // Starts the worker now if a thread is to be had; otherwise the first task tries again.
+  void prepare() {
+    std::lock_guard lock(mutex_);
+    startWorker();
+  }
+
+  // Called with mutex_ held. The worker starts with the first task, and with a later one when it
+  // could not start before: a shortage of threads fails the transfers concerned, never the process.
+  bool startWorker() {
+    if (worker_.joinable()) return true;
+    try {
+      worker_ = std::thread([this] { run(); });
+      return true;
+    } catch (const std::system_error&) {
+      return false;
+    }
   }
 
   void stop() {
@@ -338,7 +360,7 @@ const HTTPRequest& HTTPTask::originalRequest() const { return state_->request; }
 
 HTTPSession::HTTPSession(HTTPSessionConfiguration configuration)
     : engine_(std::make_shared<Engine>(std::move(configuration))) {
-  engine_->startWorker();
+  engine_->prepare();
 }
 
 HTTPSession::~HTTPSession() { engine_->stop(); }
