@@ -26,7 +26,7 @@ using EventSourcePtr = std::unique_ptr<sd_event_source, HandleReleaser<sd_event_
 
 // An sd_bus_error that frees its strings when it goes out of scope.
 struct BusErrorGuard {
-  sd_bus_error error = SD_BUS_ERROR_NULL;
+  sd_bus_error error{};  // SD_BUS_ERROR_NULL is a compound literal, which pedantic C++ refuses
   BusErrorGuard() = default;
   BusErrorGuard(const BusErrorGuard&) = delete;
   BusErrorGuard& operator=(const BusErrorGuard&) = delete;
