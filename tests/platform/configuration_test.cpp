@@ -1,126 +1,137 @@
+#include "platform/configuration.h"
+
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
 
-#include "platform/configuration.h"
+#include "platform/device_facts.h"
+#include "platform/process_memory.h"
 
 namespace {
 
-class ConfigurationTest : public testing::Test {
- protected:
-  std::filesystem::path dir = std::filesystem::temp_directory_path() / ("zlka-config-" + std::to_string(getpid()));
-  std::filesystem::path file = dir / "zlkad.toml";
-  void SetUp() override { std::filesystem::create_directories(dir); }
-  void TearDown() override { std::filesystem::remove_all(dir); }
+namespace fs = std::filesystem;
 
-  std::optional<platform::Configuration> load(const std::string& text, std::string* error) {
-    std::ofstream(file) << text;
-    return platform::loadConfiguration(file, error);
-  }
-};
+const std::string kMinimal = "[device]\ninternal_build = true\ndevice_class = \"AccessoryHub\"\n[servers.prod]\n"
+                             "static_content = \"https://static.example.net/\"\napi = \"https://api.example.net:8443\"\n"
+                             "[sap]\ntrust_anchor = \"/etc/zlka/sap-root.pem\"\n";
+const fs::path kFile = fs::temp_directory_path() / ("zlkad-" + std::to_string(getpid()) + ".toml");
 
-const char kMinimal[] = R"(
-[device]
-internal_build = true
-device_class = "AccessoryHub"
-[servers.prod]
-static_content = "https://static.example.net/"
-api = "https://api.example.net:8443"
-[sap]
-trust_anchor = "/etc/zlka/sap-root.pem"
-)";
+std::string replaced(std::string text, const std::string& from, const std::string& to) {
+  return text.replace(text.find(from), from.size(), to);
+}
+std::optional<platform::Configuration> load(const std::string& text, std::string* error) {
+  std::ofstream(kFile) << text;
+  auto c = platform::loadConfiguration(kFile, error);
+  fs::remove(kFile);
+  return c;
+}
 
-}  // namespace
-
-TEST_F(ConfigurationTest, MinimalFileGetsDefaultsForOptionalKeys) {
+TEST(Configuration, MinimalFileGetsTheDefaultsAndAFullOneWarnsOfUnknownKeys) {
   std::string error;
   auto c = load(kMinimal, &error);
   ASSERT_TRUE(c) << error;
-  EXPECT_TRUE(c->device.internalBuild);
-  EXPECT_EQ(c->device.deviceClass, "AccessoryHub");
+  EXPECT_EQ(std::tie(c->device.internalBuild, c->device.deviceClass), std::tuple(true, "AccessoryHub"));
   EXPECT_EQ(c->servers.at("prod").staticContent, "https://static.example.net");  // trailing slash dropped
   EXPECT_EQ(c->servers.at("prod").api, "https://api.example.net:8443");
-  EXPECT_EQ(c->servers.count("it"), 0u);
-  EXPECT_EQ(c->caFile, "");
-  EXPECT_EQ(c->settingsDirectory, "/var/lib/zlka/defaults");
-  EXPECT_EQ(c->entitlementsDirectory, "/etc/zlka/entitlements.d");
-  EXPECT_EQ(c->logLevel, platform::LogLevel::Default);
-  EXPECT_FALSE(c->privateData);
+  EXPECT_EQ(c->servers.size(), 1u);
+  EXPECT_EQ(std::tie(c->trustAnchor, c->caFile, c->settingsDirectory, c->entitlementsDirectory),
+            std::tuple("/etc/zlka/sap-root.pem", "", "/var/lib/zlka/defaults", "/etc/zlka/entitlements.d"));
+  EXPECT_EQ(std::tie(c->logLevel, c->privateData, c->maxWorkers), std::tuple(platform::LogLevel::Default, false, 64u));
   EXPECT_TRUE(c->warnings.empty());
-}
 
-TEST_F(ConfigurationTest, FullFileAndUnknownKeysAreReported) {
-  std::string error;
-  auto c = load(std::string(kMinimal) + R"(
-[servers.ut]
-static_content = "https://ut-static.example.net"
-api = "https://ut-api.example.net"
-[tls]
-ca_file = "/tmp/ca.pem"
-[settings]
-suite_dir = "/tmp/defaults"
-[log]
-level = "debug"
-private_data = true
-colour = "blue"
-[extra]
-x = 1
-)",
-                &error);
+  c = load(kMinimal + "[servers.ut]\nstatic_content = \"https://s\"\napi = \"https://a\"\n[tls]\nca_file = \"/ca.pem\"\n"
+                      "[settings]\nsuite_dir = \"/d\"\n[entitlements]\ndir = \"/e\"\n[log]\nlevel = \"debug\"\n"
+                      "private_data = true\ncolour = \"blue\"\n[service]\nmax_workers = 2\n[extra]\nx = 1\n", &error);
   ASSERT_TRUE(c) << error;
-  EXPECT_EQ(c->servers.at("ut").api, "https://ut-api.example.net");
-  EXPECT_EQ(c->caFile, "/tmp/ca.pem");
-  EXPECT_EQ(c->logLevel, platform::LogLevel::Debug);
-  EXPECT_TRUE(c->privateData);
-  ASSERT_EQ(c->warnings.size(), 2u);
-  EXPECT_NE(c->warnings[0].find("'extra'"), std::string::npos);
-  EXPECT_NE(c->warnings[1].find("'log.colour'"), std::string::npos);
+  EXPECT_EQ(c->servers.at("ut").api, "https://a");
+  EXPECT_EQ(std::tie(c->caFile, c->settingsDirectory, c->entitlementsDirectory), std::tuple("/ca.pem", "/d", "/e"));
+  EXPECT_EQ(std::tie(c->logLevel, c->privateData, c->maxWorkers), std::tuple(platform::LogLevel::Debug, true, 2u));
+  EXPECT_EQ(c->warnings, (std::vector<std::string>{kFile.string() + ": unknown key 'extra' ignored",
+                                                    kFile.string() + ": unknown key 'log.colour' ignored"}));
+  EXPECT_EQ(load(kMinimal + "[service]\nmax_workers = 4096\n", &error)->maxWorkers, 4096u);
 }
 
-TEST_F(ConfigurationTest, ErrorsNameTheFileAndTheKey) {
-  struct Case {
-    std::string text;
-    std::string key;
+TEST(Configuration, EveryProblemNamesTheFileAndTheKey) {
+  const std::string api = "https://api.example.net:8443";
+  // clang-format off
+  const std::pair<std::string, std::string> rows[] = {  // the file's text, the error after "<file>: "
+      {replaced(kMinimal, "internal_build = true\n", ""), "device.internal_build: missing (expected true or false)"},
+      {replaced(kMinimal, "internal_build = true", "internal_build = \"yes\""), "device.internal_build: expected true or false"},
+      {replaced(kMinimal, "device_class = \"AccessoryHub\"", "device_class = 3"), "device.device_class: expected a string"},
+      {replaced(kMinimal, api, "http://api.example.net"), "servers.prod.api: 'http://api.example.net' is not an absolute https base URL"},
+      {replaced(kMinimal, api, "https://api.example.net/v1"), "servers.prod.api: "},
+      {replaced(kMinimal, "[servers.prod]", "[servers.other]"), "servers.prod: missing table"},
+      {kMinimal + "[servers.it]\napi = \"https://it.example.net\"\n", "servers.it.static_content: missing"},  // all or nothing
+      {kMinimal + "[servers]\nmaint = 1\n", "servers.maint: missing table"},
+      {replaced(kMinimal, "\"/etc/zlka/sap-root.pem\"", "\"\""), "sap.trust_anchor: must name a PEM file"},
+      {replaced(kMinimal, "trust_anchor", "anchor"), "sap.trust_anchor: missing"},
+      {kMinimal + "[tls]\nca_file = true\n", "tls.ca_file: expected a string"},
+      {kMinimal + "[settings]\nsuite_dir = \"\"\n", "settings.suite_dir: must not be empty"},
+      {kMinimal + "[entitlements]\ndir = \"\"\n", "entitlements.dir: must not be empty"},
+      {kMinimal + "[log]\nlevel = \"verbose\"\n", "log.level: 'verbose' is not one of debug, info, default, error, fault"},
+      {kMinimal + "[log]\nprivate_data = 1\n", "log.private_data: expected true or false"},
+      {kMinimal + "[service]\nmax_workers = 1\n", "service.max_workers: expected a whole number from 2 to 4096"},
+      {kMinimal + "[service]\nmax_workers = 4097\n", "service.max_workers: expected a whole number from 2 to 4096"},
+      {kMinimal + "[service]\nmax_workers = \"8\"\n", "service.max_workers: expected a whole number from 2 to 4096"},
+      {"[device\n", ":1: "},  // a parse error names the line instead
   };
-  std::string noDevice = kMinimal;
-  noDevice.replace(noDevice.find("internal_build = true\n"), 22, "");
-  std::string badURL = kMinimal;
-  badURL.replace(badURL.find("https://api.example.net:8443"), 28, "http://api.example.net");
-  std::string pathURL = kMinimal;
-  pathURL.replace(pathURL.find("https://api.example.net:8443"), 28, "https://api.example.net/v1");
-  std::string wrongType = kMinimal;
-  wrongType.replace(wrongType.find("internal_build = true"), 21, "internal_build = \"yes\"");
-  const Case cases[] = {
-      {noDevice, "device.internal_build"},
-      {badURL, "servers.prod.api"},
-      {pathURL, "servers.prod.api"},
-      {wrongType, "device.internal_build"},
-      {std::string(kMinimal) + "[servers.it]\napi = \"https://it.example.net\"\n", "servers.it.static_content"},
-      {std::string(kMinimal) + "[log]\nlevel = \"verbose\"\n", "log.level"},
-      {"[device]\ninternal_build = false\ndevice_class = \"x\"\n[sap]\ntrust_anchor = \"/a\"\n", "servers.prod"},
-  };
-  for (const Case& c : cases) {
+  // clang-format on
+  for (const auto& [text, message] : rows) {
     std::string error;
-    EXPECT_FALSE(load(c.text, &error)) << c.key;
-    EXPECT_NE(error.find(file.string()), std::string::npos) << error;
-    EXPECT_NE(error.find(c.key), std::string::npos) << error;
+    EXPECT_FALSE(load(text, &error)) << message;
+    std::string expected = kFile.string() + (message[0] == ':' ? message : ": " + message);
+    EXPECT_EQ(error.substr(0, expected.size()), expected);
   }
-}
-
-TEST_F(ConfigurationTest, MissingAndUnparsableFilesAreErrors) {
   std::string error;
-  EXPECT_FALSE(platform::loadConfiguration(dir / "absent.toml", &error));
-  EXPECT_NE(error.find("absent.toml"), std::string::npos);
-  EXPECT_FALSE(load("[device\n", &error));
-  EXPECT_NE(error.find("zlkad.toml:1"), std::string::npos) << error;
+  EXPECT_FALSE(platform::loadConfiguration(kFile.parent_path(), &error));
+  EXPECT_EQ(error, kFile.parent_path().string() + ": cannot read the configuration file (missing or not a file)");
 }
 
-TEST(BaseURL, OnlyAbsoluteHttpsWithoutPath) {
+TEST(Configuration, BaseURLsAreAbsoluteHttpsWithoutPathQueryOrUser) {
   EXPECT_EQ(platform::normalizedBaseURL("https://h"), "https://h");
   EXPECT_EQ(platform::normalizedBaseURL("https://127.0.0.1:4443/"), "https://127.0.0.1:4443");
   EXPECT_EQ(platform::normalizedBaseURL("https://[::1]:4443"), "https://[::1]:4443");
-  for (const char* bad : {"", "h", "http://h", "https://", "https://h/p", "https://h?q=1", "https://u:p@h", "ftp://h"})
+  for (const char* bad : {"", "h", "http://h", "https://", "https://h/p", "https://h?q=1", "https://h#f", "https://u:p@h", "ftp://h"})
     EXPECT_FALSE(platform::normalizedBaseURL(bad)) << bad;
 }
+
+// Device facts are read once per process, so each scenario runs in a child process, which exits
+// 0 when the facts are as expected. No text: no file.
+void expectFacts(const char* text, bool internal, std::optional<std::string> deviceClass, const char* logged = "") {
+  EXPECT_EXIT(
+      {
+        if (text) std::ofstream(kFile) << text;
+        platform::setDeviceConfigPath(kFile);
+        bool ok = platform::deviceAnswerBool("InternalBuild") == internal && !platform::deviceAnswerBool("Unknown") &&
+                  platform::deviceAnswerString("DeviceClass") == deviceClass && !platform::deviceAnswerString("Unknown");
+        std::ofstream(kFile) << "[device]\ninternal_build = " << (internal ? "false" : "true") << "\n";
+        ok = ok && platform::deviceAnswerBool("InternalBuild") == internal;  // not read again
+        fs::remove(kFile);
+        std::exit(ok ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), logged);
+}
+
+TEST(DeviceFacts, AreReadOnceFromTheDeviceTableAndAMissingOrBrokenFileAnswersProduction) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");  // the shared pool's workers may be alive already
+  expectFacts("[device]\ninternal_build = true\ndevice_class = \"AccessoryHub\"\n", true, "AccessoryHub");
+  expectFacts("[device]\ndevice_class = \"Hub\"\n", false, "Hub");
+  expectFacts(nullptr, false, std::nullopt);
+  expectFacts("[device\ninternal_build = true\n", false, std::nullopt, "Could not read device facts");
+}
+
+TEST(ProcessMemory, FootprintGrowsWithTouchedMemory) {
+  auto before = platform::readProcessMemory();
+  ASSERT_TRUE(before);
+  EXPECT_GE(before->virtualSize, before->resident);
+  std::vector<char> block(64 << 20, 1);
+  auto after = platform::readProcessMemory();
+  ASSERT_TRUE(after);
+  EXPECT_GT(after->footprint, before->footprint + (32u << 20));
+  EXPECT_GT(after->resident, before->resident + (32u << 20));
+  EXPECT_EQ(block[12345], 1);
+}
+
+}  // namespace

@@ -1,138 +1,114 @@
-#include <gtest/gtest.h>
+#include "platform/log.h"
 
-#include <mutex>
-#include <thread>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
 #include <vector>
 
 #include "platform/data.h"
 #include "platform/error.h"
-#include "platform/log.h"
 
+using platform::LogArg;
 using platform::LogLevel;
 
 namespace {
 
 struct Capture {
-  std::mutex mutex;
   std::vector<platform::LogEntry> entries;
-  explicit Capture(LogLevel minimum = LogLevel::Debug, bool privateData = false) {
+  explicit Capture(LogLevel minimum, bool privateData) {
     platform::configureLog({minimum, privateData, platform::LogBackend::Stderr, "test"});
-    platform::setLogSink([this](const platform::LogEntry& e) {
-      std::lock_guard lock(mutex);
-      entries.push_back(e);
-    });
+    platform::setLogSink([this](const platform::LogEntry& e) { entries.push_back(e); });
   }
   ~Capture() {
     platform::setLogSink({});
     platform::configureLog({});
   }
-  std::string last() { return entries.empty() ? "" : entries.back().message; }
 };
 
-template <class... A>
-std::string fmt(std::string_view f, const A&... a) {
-  if constexpr (sizeof...(A) == 0) {
-    return platform::formatLogMessage(f, {}, false);
-  } else {
-    const platform::LogArg args[] = {platform::LogArg(a)...};
-    return platform::formatLogMessage(f, args, false);
-  }
-}
+struct Counting {  // counts how often it is formatted
+  int* calls;
+  std::string description() const { return std::to_string(++*calls); }
+};
 
-}  // namespace
-
-TEST(LogFormat, IntegerAndFloatDirectives) {
-  EXPECT_EQ(fmt("%d %ld %lu %zu", -5, -6L, 7UL, size_t{8}), "-5 -6 7 8");
-  EXPECT_EQ(fmt("%f|%.2f", 1.5, 2.0), "1.500000|2.00");
-  EXPECT_EQ(fmt("%x %03d %%", 255u, 7), "ff 007 %");
-  EXPECT_EQ(fmt("%d", uint64_t{18446744073709551615ULL}), "-1");
-}
-
-TEST(LogFormat, ObjectsStringsAndNil) {
-  std::optional<platform::Error> none;
-  std::optional<std::string> some = "x";
-  EXPECT_EQ(fmt("%@ %@ %s %@", std::string("str"), platform::Data::fromString("\x01"), "cstr", none),
-            "str {length = 1, bytes = 0x01} cstr (null)");
-  EXPECT_EQ(fmt("%@", some), "x");
-  EXPECT_EQ(fmt("%@", platform::Error("D", 3)), R"x(Error Domain=D Code=3 "The operation couldn't be completed. (D error 3.)")x");
+TEST(LogFormat, DirectivesFormatTheirArgumentsAndPrivateOnesAreRedacted) {
   const char* nullText = nullptr;
-  EXPECT_EQ(fmt("%s", nullText), "(null)");
-}
-
-TEST(LogFormat, PrivacyMarkers) {
-  const platform::LogArg args[] = {std::string("secret"), std::string("open"), 42};
-  EXPECT_EQ(platform::formatLogMessage("%{private}@ %{public}@ %{private}d", args, false), "<private> open <private>");
-  EXPECT_EQ(platform::formatLogMessage("%{private}@ %{public}@ %{private}d", args, true), "secret open 42");
-}
-
-TEST(LogFormat, PointersAndMalformedFormats) {
-  EXPECT_EQ(fmt("%p", uintptr_t{0x1234}), "0x1234");
-  EXPECT_EQ(fmt("%p", static_cast<const void*>(nullptr)), "0x0");
-  EXPECT_EQ(fmt("%d %d", 1), "1 <missing>");
-  EXPECT_EQ(fmt("tail %"), "tail %");
-  EXPECT_EQ(fmt("%{private"), "%{private");
-  EXPECT_EQ(fmt("%q", 1), "%q");
-}
-
-TEST(Log, LevelsBelowTheMinimumAreNotFormatted) {
-  Capture capture(LogLevel::Default);
-  struct Counting {
-    int* calls;
-    std::string description() const {
-      ++*calls;
-      return "c";
-    }
+  const std::optional<platform::Error> none;
+  const std::optional<std::string> some = "x";
+  struct Row {
+    const char* format;
+    std::vector<LogArg> args;
+    std::string redacted;
+    std::string shown = "";  // with private data on, when it differs
   };
-  int calls = 0;
-  platform::log(LogLevel::Debug, "%@", Counting{&calls});
-  platform::log(LogLevel::Info, "%@", Counting{&calls});
-  EXPECT_EQ(calls, 0);
-  EXPECT_TRUE(capture.entries.empty());
-  platform::log(LogLevel::Default, "%@", Counting{&calls});
-  platform::log(LogLevel::Fault, "f");
-  EXPECT_EQ(calls, 1);
-  ASSERT_EQ(capture.entries.size(), 2u);
-  EXPECT_EQ(capture.entries[1].level, LogLevel::Fault);
-}
-
-TEST(Log, PrivateDataSettingRevealsPrivateArguments) {
-  {
-    Capture capture(LogLevel::Debug, false);
-    platform::log(LogLevel::Default, "token: %{private}@", std::string("abc"));
-    EXPECT_EQ(capture.last(), "token: <private>");
+  // clang-format off
+  const Row rows[] = {
+      {"%d %i %ld %lu %zu %hhd", {-5, 4, -6L, 7UL, size_t{8}, 9}, "-5 4 -6 7 8 9"},
+      {"%x %X %o %03d %-3d| %+d %%", {255u, 255u, 8u, 7, 7, 7}, "ff FF 10 007 7  | +7 %"},
+      {"%d %u", {UINT64_MAX, -1}, "-1 18446744073709551615"},  // read as the directive says
+      {"%f|%.2f|%e|%g|%d", {1.5, 2, 1.0, 0.25, 3.9}, "1.500000|2.00|1.000000e+00|0.25|3"},
+      {"%c%c", {'o', 107}, "ok"},
+      {"%@ %@ %s %@ %@ %s", {std::string("str"), platform::Data::fromString("\x01"), "cstr", none, some, nullText},
+       "str {length = 1, bytes = 0x01} cstr (null) x (null)"},
+      {"%@ %@ %@", {42, -1.5, true}, "42 -1.5 1"},
+      {"%@", {platform::Error("D", 3)}, R"x(Error Domain=D Code=3 "The operation couldn't be completed. (D error 3.)")x"},
+      {"%p %p", {uintptr_t{0x1234}, static_cast<const void*>(nullptr)}, "0x1234 0x0"},
+      {"%d %d", {1}, "1 <missing>"},
+      {"%q %d", {1}, "%q 1"},  // an unknown directive stays visible and takes no argument
+      {"tail %", {}, "tail %"},
+      {"%{private", {1}, "%{private"},
+      {"%5", {1}, "%5"}, {"%5l", {1}, "%5l"},  // cut short in the flags, in the length
+      {"%{private}@ %{public}@ %{private}d %{ private, mask }s", {std::string("secret"), std::string("open"), 42, "m"},
+       "<private> open <private> <private>", "secret open 42 m"},
+  };
+  // clang-format on
+  for (const Row& r : rows) {
+    EXPECT_EQ(platform::formatLogMessage(r.format, r.args, false), r.redacted) << r.format;
+    EXPECT_EQ(platform::formatLogMessage(r.format, r.args, true), r.shown.empty() ? r.redacted : r.shown) << r.format;
   }
-  Capture capture(LogLevel::Debug, true);
-  platform::log(LogLevel::Default, "token: %{private}@", std::string("abc"));
-  EXPECT_EQ(capture.last(), "token: abc");
 }
 
-TEST(Log, ModuleObjectsCarrySubsystemAndCategory) {
-  Capture capture;
-  auto log = platform::Log::create("com.example.sub", "cat");
-  ASSERT_TRUE(log);
-  platform::log(*log, LogLevel::Error, "x");
-  ASSERT_EQ(capture.entries.size(), 1u);
-  EXPECT_EQ(capture.entries[0].subsystem, "com.example.sub");
-  EXPECT_EQ(capture.entries[0].category, "cat");
-  EXPECT_FALSE(platform::Log::create("", "cat"));
-  EXPECT_FALSE(platform::Log::create("sub", "bad\ncat"));
+TEST(Log, EntriesBelowTheMinimumAreNeitherFormattedNorWrittenAndPrivateDataRevealsPrivateArguments) {
+  for (bool privateData : {false, true}) {
+    Capture capture(LogLevel::Default, privateData);
+    int calls = 0;
+    platform::log(LogLevel::Debug, "%@", Counting{&calls});
+    platform::log(LogLevel::Info, "%@", Counting{&calls});
+    EXPECT_EQ(calls, 0);
+    platform::log(LogLevel::Default, "%@ %{private}@", Counting{&calls}, std::string("abc"));
+    platform::log(*platform::Log::create("com.example.sub", "cat"), LogLevel::Fault, "f");
+    ASSERT_EQ(capture.entries.size(), 2u);
+    EXPECT_EQ(capture.entries[0].message, privateData ? "1 abc" : "1 <private>");
+    EXPECT_EQ(capture.entries[0].subsystem + capture.entries[0].category, "");  // the default log object
+    EXPECT_EQ(capture.entries[1].level, LogLevel::Fault);
+    EXPECT_EQ(capture.entries[1].subsystem + "/" + capture.entries[1].category, "com.example.sub/cat");
+  }
 }
 
-TEST(Log, ConcurrentWritersLoseNothing) {
-  Capture capture;
-  std::vector<std::thread> threads;
-  for (int t = 0; t < 4; ++t)
-    threads.emplace_back([t] {
-      for (int i = 0; i < 200; ++i) platform::log(LogLevel::Info, "t%d i%d", t, i);
-    });
-  for (auto& th : threads) th.join();
-  EXPECT_EQ(capture.entries.size(), 800u);
+TEST(Log, StderrLinesCarryTimeIdentifierLevelAndModuleAndStayOneLine) {
+  platform::configureLog({LogLevel::Debug, false, platform::LogBackend::Stderr, "test"});
+  testing::internal::CaptureStderr();
+  platform::log(*platform::Log::create("com.example.sub", "cat"), LogLevel::Error, "a\nb");
+  platform::log(LogLevel::Info, "plain");
+  const std::string out = testing::internal::GetCapturedStderr(), pid = std::to_string(getpid());
+  platform::configureLog({});
+  const std::string stamp = "[0-9]{4}-[0-9]{2}-[0-9]{2} [0-9]{2}:[0-9]{2}:[0-9]{2}\\.[0-9]{3} test\\[" + pid + "\\] ";
+  EXPECT_THAT(out, testing::MatchesRegex(stamp + "<error> \\[com\\.example\\.sub:cat\\] a\\\\nb\n" + stamp + "<info> plain\n"));
+  using Names = std::pair<const char*, const char*>;  // module names must be printable and not empty
+  for (auto [subsystem, category] : {Names{"", "cat"}, Names{"sub", ""}, Names{"sub", "bad\ncat"}, Names{"bad\x7f", "c"}, Names{"s\x1f", "c"}})
+    EXPECT_FALSE(platform::Log::create(subsystem, category)) << subsystem << "/" << category;
+  EXPECT_TRUE(platform::Log::create("sub system", "a category"));
 }
 
 TEST(Log, LevelNamesAndJournalPriorities) {
-  EXPECT_EQ(platform::logLevelFromName("fault"), LogLevel::Fault);
+  const std::tuple<LogLevel, const char*, int> rows[] = {{LogLevel::Debug, "debug", 7}, {LogLevel::Info, "info", 6},
+      {LogLevel::Default, "default", 5}, {LogLevel::Error, "error", 3}, {LogLevel::Fault, "fault", 2}};
+  for (const auto& [level, name, priority] : rows) {
+    EXPECT_EQ(platform::logLevelName(level), name);
+    EXPECT_EQ(platform::logLevelFromName(name), level);
+    EXPECT_EQ(platform::journalPriority(level), priority);
+  }
   EXPECT_EQ(platform::logLevelFromName("notice"), std::nullopt);
-  EXPECT_EQ(platform::journalPriority(LogLevel::Fault), 2);
-  EXPECT_EQ(platform::journalPriority(LogLevel::Default), 5);
-  EXPECT_EQ(platform::journalPriority(LogLevel::Debug), 7);
 }
+
+}  // namespace

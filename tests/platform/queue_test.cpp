@@ -2,14 +2,11 @@
 
 #include <gtest/gtest.h>
 
-#include <array>
 #include <atomic>
 #include <chrono>
-#include <memory>
 #include <stdexcept>
 #include <string>
 #include <thread>
-#include <utility>
 #include <vector>
 
 #include "platform/semaphore.h"
@@ -21,328 +18,144 @@ using platform::Queue;
 using platform::Semaphore;
 using namespace std::chrono_literals;
 
-// Only bounds waits that must succeed, so that a fault fails the test instead of hanging it.
-constexpr auto kBound = 30s;
-// For checking that something has NOT happened while it must not.
-constexpr auto kShort = 20ms;
-
-bool arrives(Semaphore& s) { return s.waitFor(kBound); }
-
-bool arrivesTimes(Semaphore& s, int times) {
-  for (int i = 0; i < times; ++i) {
-    if (!arrives(s)) return false;
-  }
+// Bounds only waits that must succeed, so that a fault fails the test instead of hanging it.
+bool arrives(Semaphore& s, int times = 1) {
+  for (int i = 0; i < times; ++i)
+    if (!s.waitFor(30s)) return false;
   return true;
 }
+// For checking that something has NOT happened while it must not.
+bool staysAway(Semaphore& s) { return !s.waitFor(20ms); }
 
-enum class Kind { serial, concurrent };
-constexpr Kind kBothKinds[] = {Kind::serial, Kind::concurrent};
-
-// The only reference to a new queue of that kind.
-std::shared_ptr<Queue> make(Kind kind, const std::string& name) {
-  return kind == Kind::serial ? Queue::serial(name + ".serial")
-                              : Queue::concurrent(name + ".concurrent");
+std::shared_ptr<Queue> make(bool serial, const std::string& name) {
+  return serial ? Queue::serial(name + ".serial") : Queue::concurrent(name + ".concurrent");
 }
 
 TEST(SerialQueue, RunsItemsOneAtATimeInSubmissionOrderAcrossProducers) {
-  constexpr int kProducers = 4;
-  constexpr int kEach = 2000;
   auto queue = Queue::serial("test.serial.order");
-  std::vector<std::pair<int, int>> ran;  // plain on purpose: only the queue's work touches it
+  std::vector<int> ran[2];  // plain on purpose: only the queue's work touches them
   std::atomic<int> inside{0};
   std::atomic<bool> overlapped{false};
-
-  std::vector<std::thread> producers;
-  for (int p = 0; p < kProducers; ++p) {
-    producers.emplace_back([&, p] {
-      for (int i = 0; i < kEach; ++i) {
-        queue->async([&, p, i] {
-          if (inside.fetch_add(1) != 0) overlapped = true;
-          ran.emplace_back(p, i);
-          inside.fetch_sub(1);
-        });
-      }
-    });
-  }
-  for (auto& t : producers) t.join();
-  queue->sync([] {});
-
+  auto produce = [&](int p) {
+    for (int i = 0; i < 2000; ++i)
+      queue->async([&, p, i] {
+        overlapped = overlapped || inside.fetch_add(1) != 0;
+        ran[p].push_back(i);
+        inside.fetch_sub(1);
+      });
+  };
+  std::thread other(produce, 1);
+  produce(0);
+  other.join();
+  queue->sync([] {});  // returns once everything submitted before it has run
   EXPECT_FALSE(overlapped.load());
-  ASSERT_EQ(ran.size(), static_cast<std::size_t>(kProducers * kEach));
-  std::array<int, kProducers> next{};
-  for (const auto& [p, i] : ran) {
-    ASSERT_EQ(i, next[static_cast<std::size_t>(p)]) << "producer " << p;
-    ++next[static_cast<std::size_t>(p)];
+  for (const auto& r : ran) {
+    ASSERT_EQ(r.size(), 2000u);
+    for (int i = 0; i < 2000; ++i) ASSERT_EQ(r[size_t(i)], i);
   }
 }
 
 TEST(SerialQueue, WorkSubmittedFromItsOwnWorkKeepsItsPlace) {
-  // B is submitted by A; C is submitted by another thread after that, while A is still running.
+  // A submits B; another thread submits C while A still runs. A one-thread pool without a strand
+  // would let C overtake B.
   auto queue = Queue::serial("test.serial.self-submit");
-  std::vector<char> ran;
-  Semaphore bSubmitted;
-  Semaphore cSubmitted;
+  std::string ran;
+  Semaphore bSubmitted, cSubmitted;
   queue->async([&] {
-    ran.push_back('A');
-    queue->async([&] { ran.push_back('B'); });
+    queue->async([&] { ran += 'B'; });
     bSubmitted.signal();
     EXPECT_TRUE(arrives(cSubmitted));
   });
   ASSERT_TRUE(arrives(bSubmitted));
-  queue->async([&] { ran.push_back('C'); });
+  queue->async([&] { ran += 'C'; });
   cSubmitted.signal();
   queue->sync([] {});
-  EXPECT_EQ(std::string(ran.begin(), ran.end()), "ABC");
+  EXPECT_EQ(ran, "BC");
 }
 
-TEST(Queue, SyncReturnsAfterTheWorkRanAndSeesItsEffects) {
-  for (Kind kind : kBothKinds) {
-    auto queue = make(kind, "test.sync");
-    SCOPED_TRACE(queue->label());
-    int value = 0;  // plain on purpose: sync must order the work before the caller's next read
-    queue->sync([&] { value = 42; });
-    EXPECT_EQ(value, 42);
-    queue->barrierSync([&] { value += 1; });
-    EXPECT_EQ(value, 43);
-  }
-
-  // On a serial queue, and behind a barrier, everything submitted earlier has run too.
-  auto serial = Queue::serial("test.sync.after-async");
-  int count = 0;
-  for (int i = 0; i < 100; ++i) serial->async([&] { ++count; });
-  int seen = -1;
-  serial->sync([&] { seen = count; });
-  EXPECT_EQ(seen, 100);
-
-  auto concurrent = Queue::concurrent("test.sync.after-async.concurrent");
+TEST(ConcurrentQueue, RunsWidthItemsAtOnceAndABarrierAloneBetweenWhatCameBeforeAndAfter) {
+  auto queue = Queue::concurrent("test.concurrent", 3);
+  Semaphore started, release, barrierStarted, releaseBarrier, afterStarted;
   std::atomic<int> done{0};
-  for (int i = 0; i < 100; ++i) concurrent->async([&] { done.fetch_add(1); });
-  concurrent->barrierSync([] {});
-  EXPECT_EQ(done.load(), 100);
-
-  // sync onto one queue from another queue's work is fine.
-  auto caller = Queue::serial("test.sync.caller");
-  int fromOther = 0;
-  caller->sync([&] { serial->sync([&] { fromOther = 7; }); });
-  EXPECT_EQ(fromOther, 7);
-}
-
-TEST(ConcurrentQueue, RunsUpToWidthItemsAtOnce) {
-  // Two items that each wait for the other can only both finish if they run at the same time.
-  auto pair = Queue::concurrent("test.concurrent.pair", 2);
-  Semaphore a;
-  Semaphore b;
-  std::atomic<int> bothSawEachOther{0};
-  pair->async([&] {
-    a.signal();
-    if (arrives(b)) bothSawEachOther.fetch_add(1);
-  });
-  pair->async([&] {
-    b.signal();
-    if (arrives(a)) bothSawEachOther.fetch_add(1);
-  });
-  pair->barrierSync([] {});
-  EXPECT_EQ(bothSawEachOther.load(), 2);
-
-  // Exactly `width` items run at once: the next one waits for a free thread.
-  constexpr int kWidth = 4;
-  auto queue = Queue::concurrent("test.concurrent.width", kWidth);
-  Semaphore arrived;
-  Semaphore go;
-  for (int i = 0; i < kWidth + 1; ++i) {
+  for (int i = 0; i < 4; ++i)
     queue->async([&] {
-      arrived.signal();
-      EXPECT_TRUE(arrives(go));
+      started.signal();
+      EXPECT_TRUE(arrives(release));
+      done.fetch_add(1);
     });
-  }
-  EXPECT_TRUE(arrivesTimes(arrived, kWidth));
-  EXPECT_FALSE(arrived.waitFor(kShort));
-  go.signal();
-  EXPECT_TRUE(arrives(arrived));
-  for (int i = 0; i < kWidth; ++i) go.signal();
-  queue->barrierSync([] {});
-}
-
-TEST(ConcurrentQueue, BarrierWaitsForEarlierItemsAndHoldsBackLaterOnes) {
-  auto queue = Queue::concurrent("test.concurrent.barrier", 4);
-  Semaphore beforeStarted;
-  Semaphore releaseBefore;
-  Semaphore barrierStarted;
-  Semaphore releaseBarrier;
-  Semaphore afterStarted;
-  std::atomic<int> beforeDone{0};
-  std::atomic<bool> barrierDone{false};
-  int beforeDoneSeenByBarrier = -1;
-  bool afterSawBarrierDone = false;
-
-  for (int i = 0; i < 2; ++i) {
-    queue->async([&] {
-      beforeStarted.signal();
-      EXPECT_TRUE(arrives(releaseBefore));
-      beforeDone.fetch_add(1);
-    });
-  }
-  ASSERT_TRUE(arrivesTimes(beforeStarted, 2));
+  EXPECT_TRUE(arrives(started, 3));
+  EXPECT_TRUE(staysAway(started));  // the fourth waits for a free thread
   queue->barrierAsync([&] {
-    beforeDoneSeenByBarrier = beforeDone.load();
+    EXPECT_EQ(done.load(), 4);
     barrierStarted.signal();
     EXPECT_TRUE(arrives(releaseBarrier));
-    barrierDone = true;
+    done.fetch_add(1);
   });
-  queue->async([&] {
-    afterSawBarrierDone = barrierDone.load();
-    afterStarted.signal();
-  });
-
-  // Two threads are free, yet neither the barrier nor the item after it may start.
-  EXPECT_FALSE(barrierStarted.waitFor(kShort));
-  EXPECT_FALSE(afterStarted.waitFor(kShort));
-  releaseBefore.signal();
-  releaseBefore.signal();
-  ASSERT_TRUE(arrives(barrierStarted));
-  EXPECT_FALSE(afterStarted.waitFor(kShort));
-  releaseBarrier.signal();
-  ASSERT_TRUE(arrives(afterStarted));
-  queue->barrierSync([] {});
-
-  EXPECT_EQ(beforeDoneSeenByBarrier, 2);
-  EXPECT_TRUE(afterSawBarrierDone);
-}
-
-TEST(ConcurrentQueue, BarriersSplitAStreamOfItemsIntoRounds) {
-  constexpr int kRounds = 50;
-  constexpr int kItems = 20;
-  auto queue = Queue::concurrent("test.concurrent.rounds", 4);
-  std::atomic<int> active{0};
-  std::atomic<int> barriersDone{0};
-  std::array<std::atomic<int>, kRounds> itemsDone{};
-  std::atomic<int> faults{0};
-
-  for (int round = 0; round < kRounds; ++round) {
-    for (int i = 0; i < kItems; ++i) {
-      queue->async([&, round] {
-        active.fetch_add(1);
-        if (barriersDone.load() != round) faults.fetch_add(1);
-        std::this_thread::yield();  // widens the window in which a misplaced item would overlap
-        itemsDone[static_cast<std::size_t>(round)].fetch_add(1);
-        if (barriersDone.load() != round) faults.fetch_add(1);
-        active.fetch_sub(1);
-      });
-    }
-    queue->barrierAsync([&, round] {
-      if (active.load() != 0) faults.fetch_add(1);
-      if (itemsDone[static_cast<std::size_t>(round)].load() != kItems) faults.fetch_add(1);
-      std::this_thread::yield();
-      if (active.load() != 0) faults.fetch_add(1);
-      barriersDone.fetch_add(1);
+  for (int i = 0; i < 2; ++i)
+    queue->async([&] {
+      EXPECT_EQ(done.load(), 5);
+      afterStarted.signal();
     });
-  }
+  release.signal();
+  EXPECT_TRUE(arrives(started));  // the fourth takes the freed thread
+  release.signal();               // this one stays free
+  EXPECT_TRUE(staysAway(barrierStarted));
+  EXPECT_TRUE(staysAway(afterStarted));
+  release.signal();
+  release.signal();
+  ASSERT_TRUE(arrives(barrierStarted));
+  EXPECT_TRUE(staysAway(afterStarted));  // threads are free, but the barrier runs alone
+  releaseBarrier.signal();
+  EXPECT_TRUE(arrives(afterStarted, 2));
   queue->barrierSync([] {});
-  EXPECT_EQ(faults.load(), 0);
-  EXPECT_EQ(barriersDone.load(), kRounds);
 }
 
 TEST(Queue, CurrentIsTheQueueRunningTheCallersWork) {
   auto serial = Queue::serial("test.current.serial");
   auto concurrent = Queue::concurrent("test.current.concurrent");
   EXPECT_EQ(Queue::current(), nullptr);
-  EXPECT_FALSE(serial->isCurrent());
-
-  const Queue* inSerial = nullptr;
-  bool serialIsCurrent = false;
-  bool concurrentIsCurrentInSerial = true;
-  const Queue* nested = nullptr;
-  const Queue* afterNested = nullptr;
   serial->sync([&] {
-    inSerial = Queue::current();
-    serialIsCurrent = serial->isCurrent();
-    concurrentIsCurrentInSerial = concurrent->isCurrent();
-    concurrent->sync([&] { nested = Queue::current(); });
-    afterNested = Queue::current();
+    EXPECT_TRUE(serial->isCurrent());
+    EXPECT_FALSE(concurrent->isCurrent());
+    concurrent->sync([&] { EXPECT_EQ(Queue::current(), concurrent.get()); });  // sync onto another queue is fine
+    EXPECT_EQ(Queue::current(), serial.get());
   });
-  EXPECT_EQ(inSerial, serial.get());
-  EXPECT_TRUE(serialIsCurrent);
-  EXPECT_FALSE(concurrentIsCurrentInSerial);
-  EXPECT_EQ(nested, concurrent.get());
-  EXPECT_EQ(afterNested, serial.get());
-
-  std::atomic<const Queue*> inAsync{nullptr};
-  std::atomic<const Queue*> inBarrier{nullptr};
-  concurrent->async([&] { inAsync = Queue::current(); });
-  concurrent->barrierSync([&] { inBarrier = Queue::current(); });
-  EXPECT_EQ(inAsync.load(), concurrent.get());
-  EXPECT_EQ(inBarrier.load(), concurrent.get());
-  EXPECT_EQ(Queue::current(), nullptr);
+  concurrent->async([&] { EXPECT_EQ(Queue::current(), concurrent.get()); });
+  concurrent->barrierSync([&] { EXPECT_EQ(Queue::current(), concurrent.get()); });
+  EXPECT_FALSE(serial->isCurrent());
 }
 
-TEST(Queue, DroppingTheLastReferenceRunsEverythingAlreadySubmitted) {
-  constexpr int kItems = 200;
-  for (Kind kind : kBothKinds) {
-    auto queue = make(kind, "test.drain");
-    SCOPED_TRACE(queue->label());
-    Queue* raw = queue.get();
-    Semaphore gate;
-    Semaphore dropping;
-    std::atomic<int> ran{0};
-    queue->async([&] { EXPECT_TRUE(arrives(gate)); });
-    for (int i = 0; i < kItems; ++i) {
-      if (i == kItems / 2) queue->barrierAsync([&] { ran.fetch_add(1); });
-      queue->async([&] { ran.fetch_add(1); });
-    }
-    // Work that the draining work submits runs as well.
-    queue->async([&, raw] { raw->async([&] { ran.fetch_add(1); }); });
-
-    ASSERT_EQ(queue.use_count(), 1);
-    std::thread dropper([&dropping, queue = std::move(queue)]() mutable {
-      dropping.signal();
-      queue.reset();
-    });
-    ASSERT_TRUE(arrives(dropping));
-    gate.signal();
-    dropper.join();
-    EXPECT_EQ(ran.load(), kItems + 2);
-  }
-}
-
-TEST(Queue, LastReferenceDroppedByItsOwnWork) {
-  for (bool inBody : {true, false}) {
-    for (Kind kind : kBothKinds) {
-      auto queue = make(kind, inBody ? "test.self-drop.body" : "test.self-drop.capture");
-      SCOPED_TRACE(queue->label());
-      const Queue* raw = queue.get();
-      Semaphore gate;
-      Semaphore laterRan;
-      std::atomic<const Queue*> laterSaw{nullptr};
-      if (inBody) {
-        queue->async([self = queue, &gate]() mutable {
-          EXPECT_TRUE(arrives(gate));
-          self.reset();
-        });
-      } else {
-        // Released with the item's captures once it has run.
-        queue->async([self = queue, &gate] { EXPECT_TRUE(arrives(gate)); });
-      }
-      queue->barrierAsync([&] {
-        laterSaw = Queue::current();
-        laterRan.signal();
-      });
-      ASSERT_EQ(queue.use_count(), 2);
-      queue.reset();
+TEST(Queue, DroppingTheLastReferenceStillRunsEverythingSubmitted) {
+  // Dropped by another thread, the drop waits for the work; dropped with the captures of the
+  // queue's own work, the queue winds down in the background.
+  for (bool fromOwnWork : {false, true}) {
+    for (bool serial : {true, false}) {
+      auto queue = make(serial, "test.drop");
+      Queue* raw = queue.get();
+      Semaphore gate, all, dropping;
+      std::atomic<int> count{0};
+      auto item = [&] {
+        if (count.fetch_add(1) == 100) all.signal();
+      };
+      queue->async([&gate, self = fromOwnWork ? queue : nullptr] { EXPECT_TRUE(arrives(gate)); });
+      for (int i = 0; i < 100; ++i) i == 50 ? queue->barrierAsync(item) : queue->async(item);
+      queue->async([&, raw] { raw->async([&, raw] { EXPECT_EQ(Queue::current(), raw); item(); }); });  // while draining
+      std::thread dropper([&dropping, last = std::move(queue)]() mutable { dropping.signal(), last.reset(); });
+      ASSERT_TRUE(arrives(dropping));
       gate.signal();
-      // The queue winds down on its own: the later item still runs, on the same queue.
-      ASSERT_TRUE(arrives(laterRan));
-      EXPECT_EQ(laterSaw.load(), raw);
+      dropper.join();
+      EXPECT_TRUE(fromOwnWork || count.load() == 101);
+      EXPECT_TRUE(arrives(all)) << fromOwnWork << serial;
     }
   }
 }
 
 TEST(SerialQueue, BlockedQueuesTakeAtMostThePoolsBoundAndAllComplete) {
-  constexpr int kQueues = 100;
   constexpr unsigned kBound = 8;
   platform::WorkerPool pool("test.bounded", {.minimum = 1, .maximum = kBound});
+  Semaphore started, release, finished;  // outlive the queues, which drain when the vector goes
   std::vector<std::shared_ptr<Queue>> queues;
-  Semaphore started, release, finished;
-  for (int i = 0; i < kQueues; ++i) {
+  for (int i = 0; i < 100; ++i) {
     queues.push_back(Queue::serial("test.blocked." + std::to_string(i), &pool));
     queues.back()->async([&] {
       started.signal();
@@ -351,16 +164,15 @@ TEST(SerialQueue, BlockedQueuesTakeAtMostThePoolsBoundAndAllComplete) {
     });
   }
   // The pool grows while its workers block, up to its bound; the other queues wait their turn...
-  ASSERT_TRUE(arrivesTimes(started, kBound));
-  EXPECT_FALSE(started.waitFor(kShort));
+  ASSERT_TRUE(arrives(started, kBound));
+  EXPECT_TRUE(staysAway(started));
   EXPECT_EQ(pool.threads(), kBound);
-  // ...and queues on another pool are not held up meanwhile.
+  // ...and a queue on another pool is not held up meanwhile.
   Semaphore otherRan;
   Queue::serial("test.blocked.other")->async([&] { otherRan.signal(); });
   EXPECT_TRUE(arrives(otherRan));
-
-  for (int i = 0; i < kQueues; ++i) release.signal();
-  EXPECT_TRUE(arrivesTimes(finished, kQueues));
+  for (int i = 0; i < 100; ++i) release.signal();
+  EXPECT_TRUE(arrives(finished, 100));
 }
 
 TEST(SerialQueue, SyncOnAnIdleQueueRunsOnTheCallingThreadAsTheQueue) {
@@ -375,52 +187,67 @@ TEST(SerialQueue, SyncOnAnIdleQueueRunsOnTheCallingThreadAsTheQueue) {
   EXPECT_EQ(current, queue.get());
 }
 
-TEST(Queue, RejectsEmptyWorkAndZeroWidth) {
-  for (Kind kind : kBothKinds) {
-    auto queue = make(kind, "test.reject");
+TEST(WorkerPool, GrowsOnlyWhileWorkBlocksShrinksBackWhenIdleAndRunsEverythingPostedBeforeItGoes) {
+  std::vector<int> ran;  // plain on purpose: one worker runs the work that never blocks, in order
+  std::atomic<int> late{0};
+  {
+    Semaphore started, go;  // outlive the pool, whose end waits for the work
+    platform::WorkerPool pool("test.pool", {.minimum = 1, .maximum = 3, .idleTimeout = 50ms});
+    for (int i = 0; i < 100; ++i) pool.post([&, i] { ran.push_back(i); });
+    EXPECT_EQ(pool.threads(), 1u);
+    for (int i = 0; i < 4; ++i)
+      pool.post([&] {
+        started.signal();
+        EXPECT_TRUE(arrives(go));
+      });
+    EXPECT_TRUE(arrives(started, 3));  // blocked workers make room for more, up to the maximum
+    EXPECT_TRUE(staysAway(started));
+    EXPECT_EQ(pool.threads(), 3u);
+    for (int i = 0; i < 4; ++i) go.signal();
+    EXPECT_TRUE(arrives(started));
+    for (int i = 0; i < 1000 && pool.threads() > 1; ++i) std::this_thread::sleep_for(10ms);
+    EXPECT_EQ(pool.threads(), 1u);  // workers above the minimum end once idle
+    for (int i = 0; i < 50; ++i)
+      pool.post([&] {
+        std::this_thread::sleep_for(1ms);
+        late.fetch_add(1);
+      });
+  }
+  EXPECT_EQ(late.load(), 50);
+  ASSERT_EQ(ran.size(), 100u);
+  for (int i = 0; i < 100; ++i) EXPECT_EQ(ran[size_t(i)], i);
+  Semaphore woken;  // a job wakes an idle worker: this one would otherwise idle for an hour
+  platform::WorkerPool sleepy("test.sleepy", {.minimum = 1, .maximum = 1, .idleTimeout = 1h});
+  for (int i = 0; i < 20; ++i) {
+    sleepy.post([&] { woken.signal(); });
+    ASSERT_TRUE(arrives(woken));
+  }
+}
+
+TEST(QueueDeathTest, EmptyWorkAndZeroWidthThrowWaitingOnItselfAbortsAThrowingItemOrASelfDestroyingPoolEndsTheProcess) {
+  for (bool serial : {true, false}) {
+    auto queue = make(serial, "test.reject");
     EXPECT_THROW(queue->async({}), std::invalid_argument);
     EXPECT_THROW(queue->sync({}), std::invalid_argument);
     EXPECT_THROW(queue->barrierAsync({}), std::invalid_argument);
     EXPECT_THROW(queue->barrierSync({}), std::invalid_argument);
   }
   EXPECT_THROW(Queue::concurrent("test.reject.width", 0), std::invalid_argument);
-}
-
-class QueueDeathTest : public ::testing::Test {
- protected:
   // The child re-runs the test binary instead of forking a process that has queue threads.
-  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
-};
-
-TEST_F(QueueDeathTest, WaitingOnTheQueueThatRunsTheCallerAborts) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH({ auto q = Queue::serial("test.death.s"); q->sync([&] { q->sync([] {}); }); }, "death\\.s.*sync");
+  EXPECT_DEATH({ auto q = Queue::concurrent("test.death.c"); q->sync([&] { q->sync([] {}); }); }, "death\\.c.*sync");
+  EXPECT_DEATH({ auto q = Queue::concurrent("test.death.b"); q->async([&] { q->barrierSync([] {}); }); q->barrierSync([] {}); },
+               "death\\.b.*barrierSync");
   EXPECT_DEATH(
       {
-        auto queue = Queue::serial("test.death.serial");
-        queue->sync([&] { queue->sync([] {}); });
+        auto* pool = new platform::WorkerPool("test.death.pool", {});
+        pool->post([pool] { delete pool; });
+        std::this_thread::sleep_for(30s);
       },
-      "test\\.death\\.serial.*sync");
-  EXPECT_DEATH(
-      {
-        auto queue = Queue::concurrent("test.death.barrier");
-        queue->async([&] { queue->barrierSync([] {}); });
-        queue->barrierSync([] {});
-      },
-      "test\\.death\\.barrier.*barrierSync");
-  EXPECT_DEATH(
-      {
-        auto queue = Queue::concurrent("test.death.concurrent");
-        queue->sync([&] { queue->sync([] {}); });
-      },
-      "test\\.death\\.concurrent.*sync");
-}
-
-TEST_F(QueueDeathTest, ExceptionEscapingAWorkItemIsReportedAndTerminates) {
-  EXPECT_DEATH(
-      {
-        auto queue = Queue::serial("test.death.throw");
-        queue->sync([] { throw std::runtime_error("item failed"); });
-      },
-      "test\\.death\\.throw.*item failed");
+      "test\\.death\\.pool.*destroyed by its own worker");
+  EXPECT_DEATH(Queue::serial("test.death.throw")->sync([] { throw std::runtime_error("item failed"); }),
+               "test\\.death\\.throw.*item failed");
 }
 
 }  // namespace

@@ -1,3 +1,5 @@
+#include "platform/settings_store.h"
+
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -7,64 +9,67 @@
 #include <vector>
 
 #include "platform/log.h"
-#include "platform/settings_store.h"
 
 using platform::SettingsStore;
 using platform::Value;
 
 namespace {
+
+namespace fs = std::filesystem;
+
 class SettingsStoreTest : public testing::Test {
  protected:
-  std::filesystem::path dir = std::filesystem::temp_directory_path() / ("zlka-settings-" + std::to_string(getpid()));
-  void SetUp() override { std::filesystem::create_directories(dir); }
-  void TearDown() override { std::filesystem::remove_all(dir); }
+  fs::path dir = fs::temp_directory_path() / ("zlka-settings-" + std::to_string(getpid()));
+  SettingsStore store{"suite", dir};
+  void SetUp() override { fs::create_directories(dir); }
+  void TearDown() override { fs::remove_all(dir); }
   void write(const std::string& text) { std::ofstream(dir / "suite.json") << text; }
 };
-}  // namespace
 
-TEST_F(SettingsStoreTest, BooleanLookupAcceptsTheUsualSpellings) {
-  write(R"({"t": true, "f": false, "one": 1, "zero": 0, "half": 0.5, "YES": "YES", "yes": "yEs", "true": "TRUE",
-            "s1": "1", "no": "no", "s2": "2", "arr": [1], "null": null})");
-  SettingsStore store("suite", dir);
-  for (const char* key : {"t", "one", "half", "YES", "yes", "true", "s1"}) EXPECT_TRUE(store.boolForKey(key)) << key;
-  for (const char* key : {"f", "zero", "no", "s2", "arr", "null", "missing"}) EXPECT_FALSE(store.boolForKey(key)) << key;
-  EXPECT_EQ(store.stringForKey("no"), "no");
-  EXPECT_EQ(store.stringForKey("one"), std::nullopt);
-  EXPECT_EQ(store.stringForKey("missing"), std::nullopt);
+TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {
+  // clang-format off
+  const std::pair<const char*, bool> rows[] = {
+      {"true", true}, {"1", true}, {"0.5", true}, {"-1", true}, {"\"YES\"", true}, {"\"yEs\"", true}, {"\"TRUE\"", true},
+      {"\"1\"", true}, {"false", false}, {"0", false}, {"\"no\"", false}, {"\"2\"", false}, {"\"yes \"", false},
+      {"\"\"", false}, {"[1]", false}, {"{\"a\": 1}", false}, {"null", false},
+  };
+  // clang-format on
+  std::string suite = "{";
+  for (size_t i = 0; i < std::size(rows); ++i) suite += "\"k" + std::to_string(i) + "\": " + rows[i].first + ", ";
+  write(suite + R"("s": "ut"})");
+  for (size_t i = 0; i < std::size(rows); ++i) EXPECT_EQ(store.boolForKey("k" + std::to_string(i)), rows[i].second) << rows[i].first;
+  EXPECT_FALSE(store.boolForKey("missing"));
+  EXPECT_EQ(store.stringForKey("s"), "ut");
+  EXPECT_EQ(store.stringForKey("k1"), std::nullopt);  // strings only
 }
 
-TEST_F(SettingsStoreTest, ChangesActAtTheNextLookup) {
-  SettingsStore store("suite", dir);
-  EXPECT_EQ(store.stringForKey("Server"), std::nullopt);  // no file yet
-  write(R"({"Server": "ut"})");
-  EXPECT_EQ(store.stringForKey("Server"), "ut");
-  write(R"({"Server": "maint", "CustomServer": "https://x"})");  // same size class, new content
-  EXPECT_EQ(store.stringForKey("Server"), "maint");
-  std::filesystem::remove(dir / "suite.json");
-  EXPECT_EQ(store.stringForKey("Server"), std::nullopt);
-}
-
-TEST_F(SettingsStoreTest, UnparsableFileReadsEmptyAndIsLoggedOncePerChange) {
+TEST_F(SettingsStoreTest, EveryLookupSeesTheFileAsItIsNowAndABrokenOneIsLoggedOncePerChange) {
   std::vector<std::string> lines;
-  platform::configureLog({platform::LogLevel::Debug, false, platform::LogBackend::Stderr, "test"});
   platform::setLogSink([&](const platform::LogEntry& e) { lines.push_back(e.message); });
-  write("{broken");
-  SettingsStore store("suite", dir);
-  EXPECT_FALSE(store.boolForKey("a"));
-  EXPECT_FALSE(store.boolForKey("a"));
-  EXPECT_EQ(lines.size(), 1u);
-  write("[\"an array is not a suite\"]");
-  EXPECT_FALSE(store.boolForKey("a"));
-  EXPECT_EQ(lines.size(), 2u);
+  const std::pair<std::string, std::optional<std::string>> steps[] = {  // the file, then what "Server" reads
+      {"", std::nullopt},  // no file
+      {R"({"Server": "ut"})", "ut"},
+      {R"({"Server": "maint", "Custom": "x"})", "maint"},
+      {"{broken", std::nullopt},  // empty, not the last good file
+      {R"(["an array is not a suite"])", std::nullopt},
+      {R"({"Server": "it"})", "it"},
+      {"", std::nullopt},  // removed
+  };
+  for (const auto& [text, server] : steps) {
+    text.empty() ? void(fs::remove(dir / "suite.json")) : write(text);
+    EXPECT_EQ(store.stringForKey("Server"), server) << text;
+    EXPECT_EQ(store.stringForKey("Server"), server) << text;  // the unchanged file is not logged again
+  }
   platform::setLogSink({});
-  platform::configureLog({});
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_EQ(lines[0].rfind("Settings suite suite is unreadable (" + (dir / "suite.json").string() + "): ", 0), 0u);
+  EXPECT_NE(lines[1].find("not a JSON object"), std::string::npos);
 }
 
 TEST_F(SettingsStoreTest, WritesAreAtomicAndConcurrentWritersLoseNothing) {
-  SettingsStore a("suite", dir / "new-dir");
-  ASSERT_TRUE(a.setObject("x", Value(true)));
-  EXPECT_TRUE(a.boolForKey("x"));
-  EXPECT_FALSE(a.setObject("bad", Value(platform::Data::fromString("bytes"))));
+  SettingsStore fresh("suite", dir / "new-dir");
+  ASSERT_TRUE(fresh.setObject("x", Value(true)));
+  EXPECT_FALSE(fresh.setObject("bad", Value(platform::Data::fromString("bytes"))));  // no JSON form
   std::vector<std::thread> threads;
   for (int t = 0; t < 4; ++t)
     threads.emplace_back([&, t] {
@@ -72,10 +77,11 @@ TEST_F(SettingsStoreTest, WritesAreAtomicAndConcurrentWritersLoseNothing) {
       for (int i = 0; i < 10; ++i) own.setObject("k" + std::to_string(t) + "_" + std::to_string(i), Value(i));
     });
   for (auto& th : threads) th.join();
-  EXPECT_EQ(a.dictionaryRepresentation().size(), 41u);
-  ASSERT_TRUE(a.removeObject("x"));
-  EXPECT_FALSE(a.objectForKey("x"));
-  EXPECT_TRUE(a.removeObject("never-there"));
-  for (const auto& entry : std::filesystem::directory_iterator(dir / "new-dir"))
+  EXPECT_EQ(fresh.dictionaryRepresentation().size(), 41u);
+  ASSERT_TRUE(fresh.removeObject("x") && fresh.removeObject("never-there"));
+  EXPECT_FALSE(fresh.objectForKey("x"));
+  for (const auto& entry : fs::directory_iterator(dir / "new-dir"))  // no temporary left behind
     EXPECT_TRUE(entry.path().filename() == "suite.json" || entry.path().filename() == "suite.json.lock") << entry.path();
 }
+
+}  // namespace

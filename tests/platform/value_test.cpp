@@ -1,137 +1,165 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <cstdlib>
 #include <cstring>
 #include <limits>
 
-#include "platform/data.h"
+#include "platform/base64.h"
 #include "platform/error.h"
 #include "platform/json.h"
-#include "platform/value.h"
+#include "platform/locale.h"
 
 using platform::Array;
 using platform::Data;
 using platform::Dictionary;
 using platform::Value;
 
-TEST(Data, CopiesShareBytesAndCompareByContent) {
+namespace {
+
+constexpr uint64_t kU64Max = std::numeric_limits<uint64_t>::max();
+std::string nested(int depth, const std::string& inner = "") {
+  return std::string(size_t(depth), '[') + inner + std::string(size_t(depth), ']');
+}
+
+TEST(Data, ComparesByContentSharesCopiesFreesAnAdoptedBufferOnceAndDescribesLongOnesByTheirEnds) {
   const uint8_t raw[] = {1, 2, 3};
-  Data a(raw, 3);
-  Data b = a;
-  EXPECT_EQ(a.bytes(), b.bytes());
+  Data a(raw, 3), copy = a;
+  EXPECT_EQ(copy.bytes(), a.bytes());
   EXPECT_EQ(a, Data(std::vector<uint8_t>{1, 2, 3}));
   EXPECT_NE(a, Data(raw, 2));
+  EXPECT_NE(a, Data(std::vector<uint8_t>{1, 2, 4}));
   EXPECT_EQ(Data(), Data(raw, 0));
-}
-
-TEST(Data, AdoptsMallocBufferAndFreesItOnce) {
   auto* p = static_cast<uint8_t*>(std::malloc(4));
   std::memcpy(p, "abcd", 4);
-  {
-    Data d = Data::adoptMalloc(p, 4);
-    Data copy = d;
-    EXPECT_EQ(copy.view(), "abcd");
-  }  // the sanitizer builds report a leak or a double free here if ownership is wrong
+  EXPECT_EQ(Data(Data::adoptMalloc(p, 4)).view(), "abcd");  // the sanitizer builds catch a leak or a double free
   EXPECT_TRUE(Data::adoptMalloc(nullptr, 0).empty());
-}
-
-TEST(Data, DescriptionShowsLengthAndBytes) {
+  std::string bytes;
+  for (int i = 0; i < 49; ++i) bytes += char(i);
   EXPECT_EQ(Data::fromString("\x01\xab").description(), "{length = 2, bytes = 0x01ab}");
-  std::string big(100, '\x11');
-  std::string d = Data::fromString(big).description();
-  EXPECT_NE(d.find("length = 100"), std::string::npos);
-  EXPECT_NE(d.find(" ... "), std::string::npos);
+  EXPECT_EQ(Data::fromString(bytes.substr(0, 48)).description().find("..."), std::string::npos);
+  EXPECT_EQ(Data::fromString(bytes).description(),
+            "{length = 49, bytes = 0x000102030405060708090a0b0c0d0e0f1011121314151617 ... 292a2b2c2d2e2f30}");
 }
 
-TEST(Value, BooleansAreNumbersButEqualOnlyToBooleans) {
-  Value t(true);
-  EXPECT_TRUE(t.isNumber());
-  EXPECT_EQ(t.numberValue(), 1.0);
-  EXPECT_TRUE(t.boolValue());
-  EXPECT_FALSE(Value(0).boolValue());
-  EXPECT_TRUE(Value(-2).boolValue());
-  EXPECT_TRUE(Value(0.5).boolValue());
-  EXPECT_FALSE(Value("YES").boolValue());
-  EXPECT_NE(t, Value(1));
-  EXPECT_EQ(Value(3), Value(3.0));
-  EXPECT_EQ(Value(int64_t{5}), Value(uint64_t{5}));
-  EXPECT_NE(Value(int64_t{-1}), Value(std::numeric_limits<uint64_t>::max()));
+TEST(Value, BooleansEqualOnlyBooleansAndNumbersCompareByValue) {
+  struct Row {
+    Value a, b;
+    bool equal;
+  };
+  // clang-format off
+  const Row rows[] = {
+      {true, true, true}, {true, false, false}, {true, 1, false}, {0, false, false},  // read as 0 and 1, equal to neither
+      {3, 3.0, true}, {int64_t{5}, uint64_t{5}, true}, {int64_t{0}, uint64_t{0}, true}, {3, 3.5, false}, {uint64_t{2}, 2.0, true},
+      {int64_t{-1}, kU64Max, false}, {kU64Max, int64_t{-1}, false},  // no wrap-around
+      {"1", 1, false}, {Value(), platform::Null{}, true}, {Value(), 0, false}, {Data::fromString("x"), "x", false},
+      {Array{}, Dictionary{}, false}, {platform::Opaque{"fd"}, platform::Opaque{"x"}, false},
+      {Dictionary{{"k", Array{1, "x", Value()}}}, Dictionary{{"k", Array{1.0, "x", platform::Null{}}}}, true},
+      {Dictionary{{"k", Array{1, "x"}}}, Dictionary{{"k", Array{1, "y"}}}, false},
+  };
+  const std::pair<Value, bool> truth[] = {{true, true}, {false, false}, {-2, true}, {0, false}, {uint64_t{7}, true},
+      {uint64_t{0}, false}, {0.5, true}, {0.0, false}, {"YES", false}, {Value(), false}, {Array{1}, false}};
+  // clang-format on
+  for (const Row& r : rows) EXPECT_EQ(r.a == r.b, r.equal) << r.a.description() << " vs " << r.b.description();
+  for (const auto& [v, t] : truth) EXPECT_EQ(v.boolValue(), t) << v.description();
+  EXPECT_EQ(Value(true).numberValue(), 1.0);
+  EXPECT_EQ(Value("1").numberValue(), std::nullopt);
 }
 
-TEST(Value, ContainersCompareDeeplyAndLookUpMembers) {
-  Value a(Dictionary{{"k", Array{1, "x", Value()}}});
-  Value b(Dictionary{{"k", Array{1.0, "x", platform::Null{}}}});
-  EXPECT_EQ(a, b);
-  EXPECT_NE(a, Value(Dictionary{{"k", Array{1, "y", Value()}}}));
-  ASSERT_NE(a.find("k"), nullptr);
-  EXPECT_EQ(a.find("k")->count(), 3u);
-  EXPECT_EQ(a.find("missing"), nullptr);
-  EXPECT_EQ(Value("s").find("k"), nullptr);
-  EXPECT_EQ(Value(Array{}).count(), 0u);
+TEST(Value, MembersAndDescription) {
+  Value v(Dictionary{{"a", Array{1, true, "q\"\\\n\x01"}}, {"b", Data::fromString("\x0f")}, {"c", platform::Opaque{"fd"}},
+                     {"d", 0.25}, {"e", kU64Max}});
+  EXPECT_EQ(v.description(), R"({"a": [1, true, "q\"\\\n\u0001"], "b": {length = 1, bytes = 0x0f}, "c": <fd>, )"
+                             R"("d": 0.25, "e": 18446744073709551615})");
+  EXPECT_EQ(v.find("a")->count(), 3u);
+  EXPECT_EQ(v.count(), 5u);
+  EXPECT_EQ(v.find("missing"), nullptr);
+  EXPECT_EQ(Value("s").find("a"), nullptr);
+  EXPECT_EQ(Value("s").count(), 0u);
 }
 
-TEST(Value, DescriptionIsReadable) {
-  Value v(Dictionary{{"a", Array{1, true, "q\"\n"}}, {"b", Data::fromString("\x0f")}, {"c", platform::Opaque{"fd"}}});
-  EXPECT_EQ(v.description(), R"({"a": [1, true, "q\"\n"], "b": {length = 1, bytes = 0x0f}, "c": <fd>})");
-}
+TEST(Json, OnlyArraysAndObjectsOfJSONKindsAreWrittenAndTheRoundTripKeepsTheKinds) {
+  // clang-format off
+  const std::pair<Value, bool> rows[] = {
+      {Dictionary{{"a", Array{1, -2.5, "s", true, Value(), kU64Max}}}, true}, {Array{}, true},
+      {"top-level string", false}, {1, false}, {Array{Data::fromString("x")}, false},  // bytes have no JSON form
+      {Array{std::nan("")}, false}, {Dictionary{{"x", std::numeric_limits<double>::infinity()}}, false},
+      {Array{Array{platform::Opaque{"fd"}}}, false},  // found at any depth
+  };
+  // clang-format on
+  for (const auto& [v, valid] : rows) EXPECT_EQ(platform::json::isValidJSONObject(v), valid) << v.description();
+  std::string error;
+  EXPECT_FALSE(platform::json::serialize(Value(1), false, &error));
+  EXPECT_EQ(error, "Invalid type in JSON write");
 
-TEST(Json, ValidityFollowsTheWriterRules) {
-  using platform::json::isValidJSONObject;
-  EXPECT_TRUE(isValidJSONObject(Value(Dictionary{{"a", Array{1, 2.5, "s", true, Value()}}})));
-  EXPECT_TRUE(isValidJSONObject(Value(Array{})));
-  EXPECT_FALSE(isValidJSONObject(Value("top-level string")));
-  EXPECT_FALSE(isValidJSONObject(Value(1)));
-  EXPECT_FALSE(isValidJSONObject(Value(Array{Data::fromString("x")})));
-  EXPECT_FALSE(isValidJSONObject(Value(Array{std::nan("")})));
-  EXPECT_FALSE(isValidJSONObject(Value(Dictionary{{"x", std::numeric_limits<double>::infinity()}})));
-  EXPECT_FALSE(isValidJSONObject(Value(Array{platform::Opaque{"fd"}})));
-}
-
-TEST(Json, RoundTripKeepsTypes) {
-  Value v(Dictionary{{"b", true}, {"i", -3}, {"u", std::numeric_limits<uint64_t>::max()}, {"d", 0.25}, {"n", Value()}, {"s", "é"}});
+  Value v(Dictionary{{"b", true}, {"i", -3}, {"u", kU64Max}, {"d", 0.25}, {"n", Value()}, {"s", "é"}, {"a", Array{false}}});
   auto text = platform::json::serialize(v);
   ASSERT_TRUE(text);
   EXPECT_EQ(text->find('\n'), std::string::npos);
+  EXPECT_NE(platform::json::serialize(v, true)->find("\n  \"a\""), std::string::npos);
   auto back = platform::json::parse(*text);
   ASSERT_TRUE(back);
-  EXPECT_EQ(*back, v);
-  EXPECT_TRUE(back->find("b")->isBool());
-  EXPECT_TRUE(back->find("i")->integer());
-  EXPECT_NE(platform::json::serialize(v, true)->find('\n'), std::string::npos);
+  EXPECT_EQ(*back, v);  // Booleans stay Booleans: they equal nothing else
+  EXPECT_TRUE(back->find("i")->integer() && back->find("u")->unsignedInteger() && back->find("d")->real());
 }
 
-TEST(Json, ParsingIsStrict) {
-  std::string err;
-  EXPECT_FALSE(platform::json::parse("\"fragment\"", &err));
-  EXPECT_FALSE(err.empty());
-  EXPECT_FALSE(platform::json::parse("3"));
-  EXPECT_FALSE(platform::json::parse("{\"a\":1,}"));
-  EXPECT_FALSE(platform::json::parse("{'a':1}"));
-  EXPECT_FALSE(platform::json::parse(""));
-  EXPECT_FALSE(platform::json::parse("{} trailing"));
-  EXPECT_FALSE(platform::json::parse("[\"\xff\"]"));
-  EXPECT_TRUE(platform::json::parse(" [1] "));
+TEST(Json, ParsingIsStrictAndBoundsTheNesting) {
+  static_assert(platform::json::kMaxDepth == 256);
+  // clang-format off
+  const std::pair<std::string, bool> rows[] = {
+      {" [1] ", true}, {"\"fragment\"", false}, {"3", false},  // the top level is an object or an array
+      {"{\"a\":1,}", false}, {"{'a':1}", false}, {"", false}, {"{} trailing", false},
+      {"[\"\xff\"]", false},  // not UTF-8
+      {nested(256), true}, {nested(257), false},
+      {nested(100000), false},  // refused before the recursive conversion could exhaust the stack
+      {"[\"" + std::string(1000, '[') + "\"]", true},  // brackets inside strings are no nesting,
+      {"[\"\\\"" + std::string(1000, '[') + "\"]", true},  // nor after an escaped quote
+  };
+  // clang-format on
+  for (const auto& [text, ok] : rows) EXPECT_EQ(platform::json::parse(text).has_value(), ok) << text.substr(0, 40);
+  std::string error;
+  EXPECT_FALSE(platform::json::parse("\"fragment\"", &error));
+  EXPECT_FALSE(error.empty());
 }
 
-TEST(Json, RefusesHostileNestingWithoutCrashing) {
-  std::string deep(100000, '[');
-  deep += std::string(100000, ']');
-  EXPECT_FALSE(platform::json::parse(deep));
-  std::string ok(200, '[');
-  ok += std::string(200, ']');
-  EXPECT_TRUE(platform::json::parse(ok));
-  // Brackets inside strings do not count as nesting.
-  EXPECT_TRUE(platform::json::parse("[\"" + std::string(1000, '[') + "\"]"));
-}
-
-TEST(Error, UserInfoAbsentIsDistinctFromEmpty) {
-  platform::Error none("D", -7);
-  platform::Error empty("D", -7, Dictionary{});
-  EXPECT_FALSE(none.userInfo().has_value());
-  EXPECT_TRUE(empty.userInfo().has_value());
+TEST(Error, UserInfoAbsentIsDistinctFromEmptyAndCarriesTheMessage) {
+  platform::Error none("D", -7), empty("D", -7, Dictionary{});
   EXPECT_NE(none, empty);
-  EXPECT_EQ(none.localizedDescription(), "The operation couldn't be completed. (D error -7.)");
+  EXPECT_EQ(none.description(), R"x(Error Domain=D Code=-7 "The operation couldn't be completed. (D error -7.)")x");
   platform::Error withText("D", -2, Dictionary{{platform::LocalizedDescriptionKey, "msg"}});
-  EXPECT_EQ(withText.localizedDescription(), "msg");
   EXPECT_EQ(withText.description(), R"(Error Domain=D Code=-2 "msg" UserInfo={"LocalizedDescription": "msg"})");
+  EXPECT_EQ(platform::Error("D", 1, Dictionary{{platform::LocalizedDescriptionKey, 5}}).localizedDescription(),
+            "The operation couldn't be completed. (D error 1.)");  // a message that is not text is none
 }
+
+TEST(Base64, EncodesTheStandardAlphabetAndDecodesOnlyWhatItWouldWrite) {
+  struct Row {
+    std::string text;
+    std::optional<std::string> plain;  // nullopt: refused
+  };
+  // clang-format off
+  const Row rows[] = {
+      {"", ""}, {"Zg==", "f"}, {"Zm8=", "fo"}, {"Zm9v", "foo"}, {"Zm9vYg==", "foob"}, {"Zm9vYmE=", "fooba"},
+      {"Zm9vYmFy", "foobar"}, {"+/8=", "\xfb\xff"}, {"AAEC/f7/", std::string("\0\1\2\xfd\xfe\xff", 6)},
+      {"AQI", {}},       // length not a multiple of four
+      {"AQI=\n", {}},    {"Zm9v\r\n", {}}, {" AQI=", {}}, {"AQ I=", {}},  // no white space anywhere
+      {"AQI-", {}},      {"AQI_", {}},     // the URL-safe alphabet is another encoding
+      {"A===", {}},      {"=AAA", {}},     {"AQ=I", {}}, {"Zg=a", {}},  // padding only at the end
+  };
+  // clang-format on
+  for (const Row& r : rows) {
+    std::optional<Data> decoded = platform::base64DecodeStrict(r.text);
+    ASSERT_EQ(decoded.has_value(), r.plain.has_value()) << r.text;
+    if (!r.plain) continue;
+    EXPECT_EQ(decoded->view(), *r.plain) << r.text;
+    EXPECT_EQ(platform::base64Encode(Data::fromString(*r.plain).span()), r.text);
+  }
+}
+
+TEST(Locale, IdentifiersComeFromICUAndCompareExactly) {
+  EXPECT_GT(platform::availableLocaleIdentifiers().size(), 100u);
+  for (const char* id : {"en_US", "fr_FR", "zh_Hans_CN", "en"}) EXPECT_TRUE(platform::isAvailableLocaleIdentifier(id)) << id;
+  for (const char* id : {"en-US", "EN_US", "xx_YY", "", "en_US "}) EXPECT_FALSE(platform::isAvailableLocaleIdentifier(id)) << id;
+}
+
+}  // namespace

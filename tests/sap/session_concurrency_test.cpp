@@ -1,234 +1,195 @@
-// Many threads on one session: readers while it opens and works, racing opens, and a storm of
-// mixed operations. Every completion must come exactly once, and nothing may deadlock or use a
-// context that was torn down.
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <string>
+// What only the session owns when several things happen at once: late and duplicate delegate
+// answers, expiration during an open, racing opens, a storm of mixed calls; and round trips with
+// the real primitives and server.
 #include <thread>
 
-#include "sap_test_support.h"
-#include "session_server_delegate.h"
+#include "session_fakes.h"
+#include "tarvexsap/tarvex_sap_certs.h"
+#include "tarvexsap/tarvex_sap_server.h"
 
 namespace saptest {
 namespace {
 
-using platform::Value;
+const Error kTransport("SomeTransportDomain", -5);
 
-// Calls state(), TTL() and description() until told to stop (bounded), checking what they say.
-class Reader {
- public:
-  Reader(TarvexSAPSession& session, const std::atomic<bool>& stop) {
-    thread_ = std::thread([this, &session, &stop] {
-      int last = TarvexSAPSessionStateClosed;
-      for (int i = 0; i < 20000 && !stop.load(); ++i) {
-        const int state = session.state();
-        if (state < last) regressions_++;  // this session never closes while read
-        last = state;
-        const double ttl = session.TTL();
-        if (ttl < 0.0 || ttl > 3600.0) badTTLs_++;
-        if (!wellFormed(session.description())) badDescriptions_++;
-        ++reads_;
-      }
-    });
-  }
-  void join() { thread_.join(); }
-
-  // "TarvexSAPSession <state: [Open], TTL: 3599.998000s>" (no regex: its locale cache is not
-  // thread-safe under the race detector).
-  static bool wellFormed(const std::string& d) {
-    for (const char* name : {"[Closed]", "[Initializing]", "[Open]"}) {
-      const std::string head = std::string("TarvexSAPSession <state: ") + name + ", TTL: ";
-      if (d.rfind(head, 0) != 0 || d.size() < head.size() + 10 || d.compare(d.size() - 2, 2, "s>") != 0) continue;
-      const std::string number = d.substr(head.size(), d.size() - head.size() - 2);
-      const size_t dot = number.find('.');
-      return dot != std::string::npos && number.size() - dot == 7 &&
-             number.find_first_not_of("-0123456789.") == std::string::npos;
-    }
-    return false;
-  }
-  int reads() const { return reads_; }
-  int problems() const { return regressions_ + badTTLs_ + badDescriptions_; }
-
- private:
-  std::thread thread_;
-  int reads_ = 0, regressions_ = 0, badTTLs_ = 0, badDescriptions_ = 0;
-};
-
-TEST(SessionConcurrencyTest, ReadersWhileTheSessionOpensSignsAndVerifies) {
-  LogCapture quiet;
-  TestPKI pki = TestPKI::make("Concurrency");
-  pki.trust();
-  auto server = pki.server();
-  auto delegate = std::make_shared<ServerDelegate>(*server, pki.setupDER);
-  LifetimeProbe lifetime;
-  auto session = TarvexSAPSession::sessionWithDelegate(delegate, libraryPrimitives(lifetime.token()));
-  const std::string id = session->UUID().UUIDString();
-
-  std::atomic<bool> stop{false};
-  std::vector<std::unique_ptr<Reader>> readers;
-  for (int i = 0; i < 3; ++i) readers.push_back(std::make_unique<Reader>(*session, stop));
-
-  ASSERT_FALSE(openSession(*session).has_value());
-
-  // Round trips chained through the completions: sign, server check and answer, verify.
-  constexpr int kRoundTrips = 300;
-  std::atomic<int> signCalls{0}, verifyCalls{0}, valid{0}, failures{0};
-  platform::Semaphore finished;
-  const auto start = [&](int n) {
-    const Data body = dataOf("request " + std::to_string(n));
-    session->signatureForData(body, [&, body](std::optional<Data> signature, std::optional<Error> error) {
-      ++signCalls;
-      if (!signature || error) {
-        ++failures;
-        finished.signal();
-        return;
-      }
-      const auto accepted = server->verifyRequest(id, signature->span(), body.span());
-      const Data answer = dataOf("answer to " + std::string(body.view()));
-      const auto signed1 = server->signResponse(id, accepted.seq, answer.span());
-      if (accepted.status != TarvexSAPServerStatus::ok || signed1.status != TarvexSAPServerStatus::ok) {
-        ++failures;
-        finished.signal();
-        return;
-      }
-      session->verifySignature(Data(signed1.signature.data(), signed1.signature.size()), answer,
-                               [&](bool ok, std::optional<Error> verifyError) {
-                                 ++verifyCalls;
-                                 if (ok && !verifyError) ++valid;
-                                 finished.signal();
-                               });
-    });
-  };
-  std::thread submitterA([&] {
-    for (int n = 0; n < kRoundTrips; n += 2) start(n);
-  });
-  std::thread submitterB([&] {
-    for (int n = 1; n < kRoundTrips; n += 2) start(n);
-  });
-  submitterA.join();
-  submitterB.join();
-  int done = 0;
-  while (done < kRoundTrips && finished.waitFor(kGuard)) ++done;
-  stop = true;
-  for (auto& r : readers) r->join();
-  ASSERT_EQ(done, kRoundTrips) << "round trips stalled";
-
-  // Nothing runs twice late: flush every queue, then count.
-  flushQueues(*session);
-  EXPECT_EQ(signCalls.load(), kRoundTrips);
-  EXPECT_EQ(verifyCalls.load(), kRoundTrips);
-  EXPECT_EQ(valid.load(), kRoundTrips);
-  EXPECT_EQ(failures.load(), 0);
-  for (auto& r : readers) {
-    EXPECT_GT(r->reads(), 0);
-    EXPECT_EQ(r->problems(), 0);
-  }
-  EXPECT_EQ(session->state(), TarvexSAPSessionStateOpen);
-
-  releaseSession(session, lifetime);
+// A late answer to an open that was closed and replaced by a newer one completes with the
+// invalid-state error and touches nothing: no primitive call, no state change, no log line.
+TEST_F(SessionTest, AStaleAnswerTouchesNothing) {
+  delegate_->certificate = std::nullopt;
+  auto stale = startOpen();
+  ASSERT_TRUE(delegate_->waitHeld());
+  session_->close();
+  auto current = startOpen();
+  ASSERT_TRUE(delegate_->waitHeld());
+  flush();
+  const auto events = primitives_->events();
+  const size_t mark = log_.size();
+  delegate_->release({Data::fromString("STALE")});
+  auto result = stale->wait();
+  ASSERT_TRUE(result);
+  EXPECT_EQ(std::get<0>(*result), QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState));
+  flush();
+  EXPECT_EQ(primitives_->events(), events);
+  EXPECT_EQ(stateInt(), 2u);
+  EXPECT_EQ(log_.countStartingWith("[#TarvexSAPSession]", mark), 0) << log_.dump();
+  delegate_->release({Data::fromString("CERT")});
+  result = current->wait();
+  ASSERT_TRUE(result);
+  EXPECT_EQ(std::get<0>(*result), std::nullopt);
+  EXPECT_EQ(stale->count(), 1);
 }
 
-class SessionRaceTest : public SessionTest {};
+// A delegate that calls a completion twice is heard once: the open succeeds, and a failure closes
+// once (the three teardowns: the close, the reopen's expiration check, the failed open).
+TEST_F(SessionTest, ADelegateAnsweringTwiceIsHeardOnce) {
+  delegate_->calls = 2;
+  openOrFail();
+  EXPECT_EQ(primitives_->count("exchange"), 2);
+  session_->close();
+  delegate_->certificate = Answer{std::nullopt, kTransport};
+  EXPECT_EQ(open(), kTransport);
+  EXPECT_EQ(primitives_->count("teardown"), 3);
+}
 
-TEST_F(SessionRaceTest, RacingOpensLetExactlyOneThrough) {
-  constexpr int kThreads = 8;
-  delegate_->certificate.hold();  // keep the winner opening until every other open has answered
-  std::vector<std::shared_ptr<OpenRecorder>> opens;
-  for (int i = 0; i < kThreads; ++i) opens.push_back(std::make_shared<OpenRecorder>());
-  std::vector<std::thread> threads;
-  for (int i = 0; i < kThreads; ++i)
-    threads.emplace_back([&, i] { session_->openWithCompletionHandler(opens[i]->handler()); });
-  for (auto& t : threads) t.join();
-  ASSERT_TRUE(delegate_->certificate.waitHeld());
-  flush();
-  int refused = 0;
-  for (auto& o : opens) {
-    if (o->calls() == 0) continue;
-    expectSessionError(std::get<0>(o->result()), -7, "Session is already open or initializing.");
-    ++refused;
+// A reopened session keeps the past expiration of its last close until the handshake answer sets
+// a new one: nothing that runs meanwhile may tear down the context the open is using.
+TEST_F(SessionTest, AnOpeningSessionNeverExpires) {
+  openOrFail();
+  session_->close();
+  delegate_->ttl = std::nullopt;
+  delegate_->certificate = delegate_->handshake = std::nullopt;
+  auto reopened = startOpen();
+  for (const char* answer : {"CERT", "INFO"}) {
+    ASSERT_TRUE(delegate_->waitHeld());
+    EXPECT_EQ(session_->state(), TarvexSAPSessionStateInitializing);
+    EXPECT_EQ(sign(Value(Data::fromString("body"))).second->code(), TarvexSAPSessionErrorInvalidState);
+    delegate_->release({Data::fromString(answer)});
   }
-  EXPECT_EQ(refused, kThreads - 1);
-  delegate_->certificate.release({dataOf("CERT"), std::nullopt});
+  auto result = reopened->wait();
+  ASSERT_TRUE(result);
+  EXPECT_EQ(std::get<0>(*result), std::nullopt);
+  EXPECT_EQ(primitives_->events(), (std::vector<std::string>{"init:1", "exchange:1", "exchange:1", "teardown:1", "teardown:1", "init:2",
+                                                             "exchange:2", "exchange:2"}));
+  // Open now, with the old expiration: the next check closes it.
+  EXPECT_EQ(session_->state(), TarvexSAPSessionStateClosed);
+}
+
+// Opens racing from eight threads: exactly one goes through; the others, and an open of an open
+// session, are refused and change nothing.
+TEST_F(SessionTest, OnlyOneOpenGoesThrough) {
+  const Error refused = QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session is already open or initializing.");
+  delegate_->certificate = std::nullopt;  // the winner stays opening until every other open has answered
+  std::vector<std::shared_ptr<OpenRecorder>> opens(8);
+  std::vector<std::thread> threads;
+  for (auto& racer : opens) threads.emplace_back([&racer, this] { racer = startOpen(); });
+  for (auto& t : threads) t.join();
+  ASSERT_TRUE(delegate_->waitHeld());
+  delegate_->release({Data::fromString("CERT")});
   int opened = 0;
-  for (auto& o : opens) {
-    ASSERT_TRUE(o->wait());
-    if (!std::get<0>(o->result())) ++opened;
+  for (auto& racer : opens) {
+    auto result = racer->wait();
+    ASSERT_TRUE(result);
+    opened += !std::get<0>(*result);
+    EXPECT_EQ(std::get<0>(*result).value_or(refused), refused);
   }
   flush();
   EXPECT_EQ(opened, 1);
-  for (auto& o : opens) EXPECT_EQ(o->calls(), 1);
-  EXPECT_EQ(layer_->initCalls(), 1);
+  for (auto& racer : opens) EXPECT_EQ(racer->count(), 1);
+  EXPECT_EQ(open(), refused);
+  EXPECT_EQ(primitives_->events(), (std::vector<std::string>{"init:1", "exchange:1", "exchange:1"}));
 }
 
-TEST_F(SessionRaceTest, MixedOperationsFromManyThreads) {
-  constexpr int kThreads = 4;
-  constexpr int kRounds = 150;
-  std::atomic<int> issued{0};
-  std::vector<std::shared_ptr<OpenRecorder>> opens;
-  std::vector<std::shared_ptr<SignRecorder>> signs;
-  std::vector<std::shared_ptr<VerifyRecorder>> verifies;
-  std::mutex recordersMutex;
+// Opens, closes, expirations, signatures, verifications and reads from four threads: every
+// completion comes exactly once, and no primitive call uses a torn-down context (the fake fails
+// the test if one does).
+TEST_F(SessionTest, MixedCallsFromManyThreads) {
+  std::mutex mutex;
+  std::vector<std::pair<std::function<bool()>, std::function<int()>>> pending;  // wait, count
+  auto keep = [&](auto recorder) {
+    std::lock_guard lock(mutex);
+    pending.emplace_back([recorder] { return recorder->wait().has_value(); }, [recorder] { return recorder->count(); });
+    return recorder->handler(session_->completionQueue());
+  };
   std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
+  for (int t = 0; t < 4; ++t) {
     threads.emplace_back([&, t] {
-      for (int round = 0; round < kRounds; ++round) {
-        switch ((round + t) % 7) {
+      for (int round = 0; round < 150; ++round) {
+        switch ((round + t) % 6) {
           case 0:
-          case 4: {
-            auto r = std::make_shared<OpenRecorder>();
-            session_->openWithCompletionHandler(r->handler());
-            std::lock_guard lock(recordersMutex);
-            opens.push_back(r);
+            session_->openWithCompletionHandler(keep(std::make_shared<OpenRecorder>()));
             break;
-          }
           case 1:
-          case 5: {
-            auto r = std::make_shared<SignRecorder>();
-            session_->signatureForData(dataOf("b"), r->handler());
-            std::lock_guard lock(recordersMutex);
-            signs.push_back(r);
+            session_->signatureForData(Data::fromString("b"), keep(std::make_shared<SignRecorder>()));
             break;
-          }
-          case 2: {
-            auto r = std::make_shared<VerifyRecorder>();
-            session_->verifySignature(dataOf("RSP(b)"), dataOf("b"), r->handler());
-            std::lock_guard lock(recordersMutex);
-            verifies.push_back(r);
+          case 2:
+            session_->verifySignature(Data::fromString("RSP(b)"), Data::fromString("b"), keep(std::make_shared<VerifyRecorder>()));
             break;
-          }
           case 3:
-            if (round % 3 == 0) session_->close();
-            else session_->setTTL(round % 2 ? 3600.0 : -1.0);
+            round % 3 ? session_->setTTL(round % 2 ? 3600.0 : -1.0) : session_->close();
             break;
           default:
-            (void)session_->state();
-            (void)session_->description();
+            session_->description();
             break;
         }
-        ++issued;
       }
     });
   }
   for (auto& t : threads) t.join();
-  EXPECT_EQ(issued.load(), kThreads * kRounds);
+  for (auto& [wait, count] : pending) ASSERT_TRUE(wait());
+  flush();
+  for (auto& [wait, count] : pending) EXPECT_EQ(count(), 1);
+}
 
-  // Every open, signature and verification completes exactly once.
-  std::lock_guard lock(recordersMutex);
-  for (auto& r : opens) ASSERT_TRUE(r->wait());
-  for (auto& r : signs) ASSERT_TRUE(r->wait());
-  for (auto& r : verifies) ASSERT_TRUE(r->wait());
-  flush();
-  flush();
-  int signed1 = 0;
-  for (auto& r : opens) EXPECT_EQ(r->calls(), 1);
-  for (auto& r : signs) {
-    EXPECT_EQ(r->calls(), 1);
-    if (std::get<0>(r->result())) ++signed1;
+// The transport's part, played by an in-process TarvexSAPServer: the certificate as served, and
+// the handshake answer after the time-to-live is set.
+class ServerDelegate : public TarvexSAPSessionDelegate {
+ public:
+  explicit ServerDelegate(TarvexSAPServer& server) : server_(server) {}
+  void sessionRequestCertificateWithCompletionHandler(TarvexSAPSession&, TarvexSAPDataCompletion completion) override {
+    completion(Data(server_.setupCertificateDER()), std::nullopt);
   }
-  for (auto& r : verifies) EXPECT_EQ(r->calls(), 1);
-  EXPECT_EQ(static_cast<size_t>(signed1), layer_->signs().size());
-  EXPECT_TRUE(layer_->deadHandleUses().empty()) << ::testing::PrintToString(layer_->deadHandleUses());
+  void sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSession& session, const std::optional<Data>& request,
+                                                          TarvexSAPDataCompletion completion) override {
+    const auto answer = server_.handshake(session.UUID().UUIDString(), request->span(), std::chrono::seconds(3600));
+    session.setTTL(3600);
+    completion(Data(answer.sessionInfo.data(), answer.sessionInfo.size()), std::nullopt);
+  }
+
+ private:
+  TarvexSAPServer& server_;
+};
+
+TEST_F(SessionTest, RoundTripsWithTheRealPrimitivesAndServer) {
+  const TarvexSAPCredential root = TarvexSAPMakeRoot("Interop SAP Root");
+  const TarvexSAPCredential setup = TarvexSAPIssueSetupCertificate(root, "Interop Setup");
+  const std::string pem = TarvexSAPCertToPEM(root.certificate.get());
+  const TarvexSAPConfig config{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
+  ASSERT_EQ(TarvexSAPConfigure(&config), kTarvexSAPOK);
+  TarvexSAPServer server(TarvexSAPCertToDER(setup.certificate.get()), setup.key.get());
+  auto transport = std::make_shared<ServerDelegate>(server);
+  session_ = TarvexSAPSession::sessionWithDelegate(transport);
+  // Signed by the session, accepted by the server, answered, and the answer accepted: the seq the
+  // server accepted, or 0.
+  auto roundTrip = [&](const std::string& text) -> uint64_t {
+    const Data body = Data::fromString(text);
+    const std::optional<Data> signature = sign(Value(body)).first;
+    if (!signature) return 0;
+    const auto accepted = server.verifyRequest(session_->UUID().UUIDString(), signature->span(), body.span());
+    const auto answer = server.signResponse(session_->UUID().UUIDString(), accepted.seq, body.span());
+    const bool valid = verify(Value(Data(answer.signature.data(), answer.signature.size())), Value(body)).first;
+    return accepted.status == TarvexSAPServerStatus::ok && valid ? accepted.seq : 0;
+  };
+  openOrFail();
+  for (uint64_t seq = 1; seq <= 3; ++seq) EXPECT_EQ(roundTrip("request " + std::to_string(seq)), seq);
+  // Past its expiration the session closes; a reopen makes a fresh association, and so does a
+  // reopen after a close (whose handle the primitives then refuse to tear down twice).
+  session_->setTTL(-1);
+  EXPECT_EQ(session_->state(), TarvexSAPSessionStateClosed);
+  openOrFail();
+  EXPECT_EQ(roundTrip("fresh"), 1u);
+  session_->close();
+  openOrFail();
+  EXPECT_EQ(roundTrip("after a close"), 1u);
 }
 
 }  // namespace

@@ -1,51 +1,43 @@
-#include <gtest/gtest.h>
-
 #include "support/errors.h"
 
-using platform::LocalizedDescriptionKey;
+#include <gtest/gtest.h>
 
 namespace {
-std::optional<std::string> messageOf(const platform::Error& e) {
-  if (!e.userInfo()) return std::nullopt;
-  auto it = e.userInfo()->find(LocalizedDescriptionKey);
-  return it == e.userInfo()->end() ? std::nullopt : std::optional<std::string>(*it->second.string());
+
+constexpr char kUnknown[] = "An unknown error has occurred.";
+
+TEST(Errors, ManagerDomainsKnowTheirSixCodesAndOtherDomainsOnlyTheUnknownMessage) {
+  struct Row {
+    const char* domain;
+    int64_t code;
+    std::optional<std::string> description;
+  };
+  const char* token = ZLKATokenManagerErrorDomain;
+  const char* certificate = ZLKACertificateManagerErrorDomain;
+  // clang-format off
+  const Row rows[] = {
+      {token, -1, kUnknown}, {token, -2, "Framework client is missing entitlement."},
+      {token, -3, "An invalid parameter was provided by the caller."}, {token, -4, "An internal error has occurred."},
+      {token, -5, "There was a problem connecting to the network."}, {token, -6, "An internal server error has occurred."},
+      {certificate, -2, "Framework client is missing entitlement."}, {certificate, -6, "An internal server error has occurred."},
+      {token, 0, std::nullopt}, {token, -7, std::nullopt}, {certificate, 1, std::nullopt}, {token, INT64_MIN, std::nullopt},
+      {ZLKAErrorDomain, -5, kUnknown}, {ZLKAErrorDomain, 42, kUnknown}, {"SomethingElse", -2, kUnknown},
+      {"zlkatokenmanagererrordomain", -2, kUnknown},  // domains compare exactly
+  };
+  // clang-format on
+  for (const Row& r : rows) {
+    EXPECT_EQ(errorDescription(r.domain, r.code), r.description) << r.domain << " " << r.code;
+    // The constructor carries the message, or no user-info at all when there is none.
+    platform::Error e = ZLKA_errorWithDomain(r.domain, r.code);
+    EXPECT_EQ(e.domain(), r.domain);
+    EXPECT_EQ(e.code(), r.code);
+    std::optional<platform::Dictionary> expected;
+    if (r.description) expected = platform::Dictionary{{platform::LocalizedDescriptionKey, *r.description}};
+    EXPECT_EQ(e.userInfo(), expected) << r.domain << " " << r.code;
+  }
+  EXPECT_EQ(ZLKA_errorWithDomain("D", -3, std::nullopt).userInfo(), std::nullopt);
+  EXPECT_EQ(ZLKA_errorWithDomain("D", -3, std::string()).userInfo(),
+            (platform::Dictionary{{platform::LocalizedDescriptionKey, ""}}));
 }
+
 }  // namespace
-
-TEST(ErrorDescription, ManagerDomainsShareTheirMessagesAndKnowOnlyTheirCodes) {
-  for (const char* domain : {ZLKATokenManagerErrorDomain, ZLKACertificateManagerErrorDomain}) {
-    EXPECT_EQ(errorDescription(domain, -1), "An unknown error has occurred.");
-    EXPECT_EQ(errorDescription(domain, -2), "Framework client is missing entitlement.");
-    EXPECT_EQ(errorDescription(domain, -3), "An invalid parameter was provided by the caller.");
-    EXPECT_EQ(errorDescription(domain, -4), "An internal error has occurred.");
-    EXPECT_EQ(errorDescription(domain, -5), "There was a problem connecting to the network.");
-    EXPECT_EQ(errorDescription(domain, -6), "An internal server error has occurred.");
-    for (int64_t code : std::initializer_list<int64_t>{0, 1, -7, INT64_MIN, INT64_MAX}) EXPECT_EQ(errorDescription(domain, code), std::nullopt) << code;
-  }
-}
-
-TEST(ErrorDescription, OtherDomainsAlwaysGetTheUnknownMessage) {
-  for (int64_t code : {-5, 0, 42}) {
-    EXPECT_EQ(errorDescription(ZLKAErrorDomain, code), "An unknown error has occurred.");
-    EXPECT_EQ(errorDescription("SomethingElse", code), "An unknown error has occurred.");
-  }
-  // Domain names are compared exactly.
-  EXPECT_EQ(errorDescription("zlkatokenmanagererrordomain", -2), "An unknown error has occurred.");
-}
-
-TEST(ErrorConstructors, CarryTheMessageOrNoUserInfoAtAll) {
-  platform::Error entitlement = ZLKA_errorWithDomain(ZLKATokenManagerErrorDomain, -2);
-  EXPECT_EQ(entitlement.domain(), ZLKATokenManagerErrorDomain);
-  EXPECT_EQ(entitlement.code(), -2);
-  EXPECT_EQ(messageOf(entitlement), "Framework client is missing entitlement.");
-  EXPECT_EQ(entitlement.userInfo()->size(), 1u);
-
-  EXPECT_FALSE(ZLKA_errorWithDomain(ZLKATokenManagerErrorDomain, 0).userInfo().has_value());
-  EXPECT_FALSE(ZLKA_errorWithDomain(ZLKATokenManagerErrorDomain, -7).userInfo().has_value());
-  EXPECT_EQ(messageOf(ZLKA_errorWithDomain(ZLKAErrorDomain, -5)), "An unknown error has occurred.");
-  EXPECT_EQ(messageOf(ZLKA_errorWithDomain(ZLKACertificateManagerErrorDomain, -6)), "An internal server error has occurred.");
-
-  EXPECT_FALSE(ZLKA_errorWithDomain("D", -3, std::nullopt).userInfo().has_value());
-  EXPECT_EQ(messageOf(ZLKA_errorWithDomain("D", -3, std::string("custom"))), "custom");
-  EXPECT_EQ(messageOf(ZLKA_errorWithDomain("D", -3, std::string())), "");
-}

@@ -1,13 +1,14 @@
+// The helpers' leniencies: what each one accepts without a word, and what it quietly drops.
 #include <gtest/gtest.h>
-
 #include <unistd.h>
 
+#include <cmath>
 #include <filesystem>
 #include <fstream>
-#include <thread>
 
 #include "platform/device_facts.h"
 #include "support/base64_array.h"
+#include "support/hex.h"
 #include "support/json_file.h"
 #include "support/objects.h"
 #include "support/obfuscated_pointer.h"
@@ -19,125 +20,129 @@ using platform::Data;
 using platform::Dictionary;
 using platform::Value;
 
-TEST(Base64Array, EncodesInOrderAndDropsUndecodableElementsOnDecode) {
-  std::vector<Data> in = {Data::fromString("\x01\x02"), Data(), Data::fromString("\xff")};
-  EXPECT_EQ(base64EncodeArray(in), (std::vector<std::string>{"AQI=", "", "/w=="}));
+namespace {
+
+std::vector<uint8_t> bytes(std::string_view s) { return {s.begin(), s.end()}; }
+
+TEST(Hex, TextToBytesSkipsEveryNonDigitAndAnOddLastDigit) {
+  // clang-format off
+  const std::pair<std::optional<std::string>, std::optional<std::string>> rows[] = {
+      {"0A:bc ff", "\x0a\xbc\xff"}, {"09afAF", "\x09\xaf\xaf"}, {"abc", "\xab"}, {"", ""},
+      {"/:@G`g-x", ""},  // the neighbours of each digit range
+      {"é1é2", "\x12"}, {std::nullopt, std::nullopt},
+  };
+  // clang-format on
+  for (const auto& [text, expected] : rows) {
+    auto data = convertNSStringToNSData(text);
+    ASSERT_EQ(data.has_value(), expected.has_value());
+    EXPECT_EQ(data.value_or(Data()).toVector(), bytes(expected.value_or(""))) << text.value_or("(none)");
+  }
+  uint8_t out[3] = {0xEE, 0xEE, 0xEE};
+  ascii_to_hex(out, "1", 1);  // whole pairs only
+  EXPECT_EQ(out[0], 0xEE);
+  ascii_to_hex(out, "fFzg9", 5);  // anything else reads as 0
+  EXPECT_EQ(std::vector<uint8_t>(out, out + 3), (std::vector<uint8_t>{0xFF, 0x00, 0xEE}));
+}
+
+TEST(Hex, BytesToTextUsesTheCallersFormatAndPrintingSkipsNoBytes) {
+  const Value two(Data(std::vector<uint8_t>{0x01, 0xab}));
+  EXPECT_EQ(convertNSDataToNSString(two, "%02X"), "01AB");
+  EXPECT_EQ(convertNSDataToNSString(two, "%02x "), "01 ab ");
+  EXPECT_EQ(convertNSDataToNSString(Value(Data()), "%02x"), "");
+  EXPECT_EQ(convertNSDataToNSString(std::nullopt, "%02x"), std::nullopt);
+  EXPECT_EQ(convertNSDataToNSString(Value("0102"), "%02x"), std::nullopt);  // bytes only
+  EXPECT_EQ(convertNSDataToNSString(two, nullptr), std::nullopt);
+  testing::internal::CaptureStdout();
+  const uint8_t b[] = {0xde, 0xad};
+  printBytes(nullptr, 2, "%02x", true);
+  printBytes(b, 0, "%02x", true);
+  printBytes(b, 2, "%02x", false);
+  printBytes(b, 1, "<%u>", true);
+  EXPECT_EQ(testing::internal::GetCapturedStdout(), "dead<222>\n");
+  using Cut = std::pair<const char*, const char*>;
+  for (auto [text, expected] : {Cut{"a\n\n", "a\n"}, Cut{"crlf\r\n", "crlf\r"}, Cut{"cr\r", "cr\r"}, Cut{"", ""}}) {
+    std::string buffer = text;
+    EXPECT_STREQ(removeNewline(buffer.data()), expected);  // cuts one line feed and nothing else
+  }
+  EXPECT_EQ(removeNewline(nullptr), nullptr);
+}
+
+TEST(Base64Array, EncodesEachElementAndDropsWhatDoesNotDecode) {
+  EXPECT_EQ(base64EncodeArray(std::vector<Data>{Data::fromString("\x01\x02"), Data(), Data::fromString("\xff")}),
+            (std::vector<std::string>{"AQI=", "", "/w=="}));
   EXPECT_TRUE(base64EncodeArray(std::nullopt).empty());
-  EXPECT_TRUE(base64EncodeArray(std::vector<Data>{}).empty());
-
-  auto out = base64DecodeArray({"AQI=", "AQ I=", "AAA="});
-  ASSERT_EQ(out.size(), 2u);
-  EXPECT_EQ(out[0].toVector(), (std::vector<uint8_t>{1, 2}));
-  EXPECT_EQ(out[1].toVector(), (std::vector<uint8_t>{0, 0}));
-  EXPECT_TRUE(base64DecodeArray({"AQI=\n", "*"}).empty());
+  EXPECT_EQ(base64DecodeArray({"AQI=", "AQ I=", "AAA=", "*"}),
+            (std::vector<Data>{Data::fromString("\x01\x02"), Data::fromString(std::string(2, '\0'))}));
 }
 
-TEST(Unicode, TrimsOnlyTheFourControlsAndOnlyAtTheEnds) {
+TEST(Unicode, TrimsOnlyTheEmbeddingAndOverrideControlsAndOnlyAtTheEnds) {
   const std::string lre = "\u202A", rle = "\u202B", pdf = "\u202C", lro = "\u202D", rlo = "\u202E", lri = "\u2066";
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters(rle + "abc" + pdf), "abc");
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters(lre + lro + rle + "a" + pdf + "b" + lro + lre), "a" + pdf + "b");
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters(rlo + "abc"), rlo + "abc");
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters(lri + "abc" + pdf), lri + "abc");
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters(pdf + pdf), "");
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters(""), "");
-  // A truncated sequence is not one of the controls.
-  EXPECT_EQ(trimBidirectionalUnicodeCharacters("abc\xE2\x80"), "abc\xE2\x80");
+  // clang-format off
+  const std::pair<std::string, std::string> trims[] = {
+      {rle + "abc" + pdf, "abc"}, {lre + lro + rle + "a" + pdf + "b" + lro + lre, "a" + pdf + "b"},  // ends only
+      {rlo + "abc", rlo + "abc"}, {lri + "abc" + pdf, lri + "abc"},  // the override and the isolates stay
+      {pdf + pdf, ""}, {"", ""}, {"abc\xE2\x80", "abc\xE2\x80"},  // a truncated sequence is no control
+  };
+  // clang-format on
+  for (const auto& [text, trimmed] : trims) EXPECT_EQ(trimBidirectionalUnicodeCharacters(text), trimmed);
 }
 
-TEST(Objects, NullAndEquality) {
-  EXPECT_TRUE(isNSObjectNull(std::nullopt));
-  EXPECT_TRUE(isNSObjectNull(Value()));
-  EXPECT_FALSE(isNSObjectNull(Value(0)));
-  EXPECT_FALSE(isNSObjectNull(Value("")));
-  EXPECT_FALSE(NSObjectIfNotNull(Value()));
+TEST(Objects, AbsentAndNullAreNullAndConformanceUsesTheInstanceTestForClassMethodsToo) {
+  EXPECT_TRUE(isNSObjectNull(std::nullopt) && isNSObjectNull(Value()));
+  EXPECT_FALSE(isNSObjectNull(Value(0)) || isNSObjectNull(Value("")));
+  EXPECT_EQ(NSObjectIfNotNull(Value()), std::nullopt);
   EXPECT_EQ(NSObjectIfNotNull(Value(false)), Value(false));
-  EXPECT_TRUE(isNSObjectEqual(std::nullopt, std::nullopt));
-  EXPECT_FALSE(isNSObjectEqual(std::nullopt, Value(1)));
-  EXPECT_FALSE(isNSObjectEqual(Value(1), std::nullopt));
-  EXPECT_TRUE(isNSObjectEqual(Value(Array{1, "a"}), Value(Array{1, "a"})));
-  EXPECT_FALSE(isNSObjectEqual(Value(), std::nullopt));
-}
+  EXPECT_TRUE(isNSObjectEqual(std::nullopt, std::nullopt) && isNSObjectEqual(Value(Array{1}), Value(Array{1.0})));
+  EXPECT_FALSE(isNSObjectEqual(std::nullopt, Value()) || isNSObjectEqual(Value(), std::nullopt));
+  EXPECT_FALSE(isNSObjectEqual(Value(1), Value(2)));
 
-TEST(Objects, ProtocolConformanceUsesTheInstanceTestForClassMethodsToo) {
-  platform::Protocol proto{"P",
-                           {{"a", true, true}, {"b", true, true}, {"c", false, true}, {"make", true, false}}};
+  // A class method of C does not count: instances do not answer it.
+  platform::Protocol proto{"P", {{"a", true, true}, {"b", true, true}, {"c", false, true}, {"make", true, false}}};
   platform::ClassDescription cls{"C", {"a", "c"}, {"make"}};
   std::set<std::string> missing = {"stale"};
   EXPECT_FALSE(classImplementsMethodsInProtocol(cls, proto, true, true, &missing));
   EXPECT_EQ(missing, (std::set<std::string>{"b"}));
   EXPECT_TRUE(classImplementsMethodsInProtocol(cls, proto, false, true, &missing));
   EXPECT_TRUE(missing.empty());
-  // "make" is a class method of C, but instances do not answer it.
   EXPECT_FALSE(classImplementsMethodsInProtocol(cls, proto, true, false, &missing));
   EXPECT_EQ(missing, (std::set<std::string>{"make"}));
-  EXPECT_TRUE(classImplementsMethodsInProtocol(cls, proto, false, false, nullptr));
 }
 
-class JSONFileTest : public testing::Test {
- protected:
-  std::filesystem::path dir = std::filesystem::temp_directory_path() / ("zlka-json-" + std::to_string(getpid()));
-  void SetUp() override { std::filesystem::create_directories(dir); }
-  void TearDown() override { std::filesystem::remove_all(dir); }
-};
-
-TEST_F(JSONFileTest, WritesPrettyAtomicallyAndReadsBack) {
-  auto path = dir / "f.json";
-  Value v(Dictionary{{"a", Array{1, "x"}}, {"b", true}});
-  ASSERT_TRUE(writeJSONFile(v, path));
-  std::ifstream in(path);
-  std::string text((std::istreambuf_iterator<char>(in)), {});
-  EXPECT_NE(text.find("\n  \"a\""), std::string::npos);
-  EXPECT_EQ(readJSONFile(path), v);
-  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), {}), 1);  // no temporary left
-}
-
-TEST_F(JSONFileTest, NilObjectWritesAnEmptyObject) {
-  auto path = dir / "empty.json";
-  ASSERT_TRUE(writeJSONFile(std::nullopt, path));
+TEST(JSONFile, IsWrittenWholeOrNotAtAllAndUnreadableOnesReadAsNothing) {
+  const auto dir = std::filesystem::temp_directory_path() / ("zlka-json-" + std::to_string(getpid()));
+  std::filesystem::create_directories(dir);
+  const auto path = dir / "f.json";
+  ASSERT_TRUE(writeJSONFile(std::nullopt, path));  // no object writes {}
   EXPECT_EQ(readJSONFile(path), Value(Dictionary{}));
-}
-
-TEST_F(JSONFileTest, RefusesWhatJSONCannotHoldAndKeepsTheOldFile) {
-  auto path = dir / "keep.json";
-  ASSERT_TRUE(writeJSONFile(Value(Array{1}), path));
-  EXPECT_FALSE(writeJSONFile(Value("scalar"), path));
-  EXPECT_FALSE(writeJSONFile(Value(Array{Data::fromString("x")}), path));
-  EXPECT_FALSE(writeJSONFile(Value(Array{1}), std::nullopt));
-  EXPECT_FALSE(writeJSONFile(Value(Array{1}), dir / "no-such-dir" / "f.json"));
-  EXPECT_EQ(readJSONFile(path), Value(Array{1}));
-}
-
-TEST_F(JSONFileTest, ReadingFailsQuietly) {
-  EXPECT_FALSE(readJSONFile(std::nullopt));
-  EXPECT_FALSE(readJSONFile(dir / "absent.json"));
+  const Value v(Dictionary{{"a", Array{1, "x"}}, {"b", true}});
+  ASSERT_TRUE(writeJSONFile(v, path));
+  EXPECT_EQ(readJSONFile(path), v);
+  for (const auto& refused : {Value("scalar"), Value(Array{Data::fromString("x")})}) EXPECT_FALSE(writeJSONFile(refused, path));
+  EXPECT_FALSE(writeJSONFile(v, std::nullopt));
+  EXPECT_FALSE(writeJSONFile(v, dir / "no-such-dir" / "f.json"));
+  std::ifstream in(path);
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "{\n  \"a\": [\n    1,\n    \"x\"\n  ],\n  \"b\": true\n}");
   std::ofstream(dir / "scalar.json") << "42";
-  EXPECT_FALSE(readJSONFile(dir / "scalar.json"));
   std::ofstream(dir / "bad.json") << "{\"a\":";
-  EXPECT_FALSE(readJSONFile(dir / "bad.json"));
-  EXPECT_FALSE(readJSONFile(dir));  // a directory
+  for (const auto& unreadable : {dir / "absent.json", dir / "scalar.json", dir / "bad.json", dir})
+    EXPECT_FALSE(readJSONFile(unreadable)) << unreadable;
+  EXPECT_FALSE(readJSONFile(std::nullopt));
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), {}), 3);  // no temporary left
+  std::filesystem::remove_all(dir);
 }
 
-TEST(SystemInfo, ClockRoundingHalvesAwayFromZero) {
+TEST(SystemInfo, ClockRoundsHalvesAwayFromZeroAndMemoryUseWritesOnlyTheGivenPointers) {
   using systemInfo_detail::roundedUnixTime;
-  EXPECT_EQ(roundedUnixTime(10.5, 1), 11u);
-  EXPECT_EQ(roundedUnixTime(10.49, 1), 10u);
-  EXPECT_EQ(roundedUnixTime(1.0005, 1000), 1001u);
-  EXPECT_EQ(roundedUnixTime(0, 1), 0u);
-  EXPECT_EQ(roundedUnixTime(-3, 1000), 0u);
-  uint64_t s = systemInfo_getCurrentUnixTime();
-  uint64_t ms = systemInfo_getCurrentUnixTimeMS();
+  const std::tuple<double, double, uint64_t> rows[] = {
+      {10.5, 1, 11}, {10.49, 1, 10}, {1.0005, 1000, 1001}, {0.4, 1, 0}, {0, 1, 0}, {-3, 1000, 0}, {std::nan(""), 1, 0}};
+  for (const auto& [seconds, scale, expected] : rows) EXPECT_EQ(roundedUnixTime(seconds, scale), expected) << seconds;
+  const uint64_t s = systemInfo_getCurrentUnixTime(), ms = systemInfo_getCurrentUnixTimeMS();
   EXPECT_GT(s, 1'700'000'000u);
   EXPECT_LE(ms / 1000, s + 1);
   EXPECT_GE(ms / 1000 + 1, s);
-}
-
-TEST(SystemInfo, MemoryUseWritesOnlyTheGivenPointers) {
   uint64_t resident = 0, virt = 0, footprint = 0;
-  ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr));
-  EXPECT_GT(resident, 0u);
-  ASSERT_TRUE(getMemoryUse(nullptr, &virt, &footprint));
-  EXPECT_GE(virt, resident);
-  EXPECT_GT(footprint, 0u);
+  ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr) && getMemoryUse(nullptr, &virt, &footprint));
+  EXPECT_TRUE(resident > 0 && virt >= resident && footprint > 0);
   EXPECT_TRUE(getMemoryUse(nullptr, nullptr, nullptr));
 }
 
@@ -147,19 +152,18 @@ TEST(SystemInfo, InternalBuildIsAskedOnceAndDeviceClassEveryTime) {
         platform::setDeviceFacts({true, "Hub"});
         bool first = systemInfo_isInternalBuild();
         platform::setDeviceFacts({false, "Other"});
-        bool ok = first && systemInfo_isInternalBuild() && systemInfo_copyDeviceClass() == "Other";
-        std::exit(ok ? 0 : 1);
+        std::exit(first && systemInfo_isInternalBuild() && systemInfo_copyDeviceClass() == "Other" ? 0 : 1);
       },
       testing::ExitedWithCode(0), "");
 }
 
 TEST(ObfuscatedPointer, KeepsNullAndDistancesButHidesAddresses) {
-  EXPECT_EQ(obfuscatedPointer(nullptr), 0u);
-  char buffer[16];
-  uintptr_t a = obfuscatedPointer(buffer);
-  uintptr_t b = obfuscatedPointer(buffer + 10);
-  EXPECT_EQ(b - a, 10u);
+  char buffer[16] = {};
+  const uintptr_t a = obfuscatedPointer(buffer);
+  EXPECT_EQ(obfuscatedPointer(buffer + 10) - a, 10u);
   EXPECT_NE(a, reinterpret_cast<uintptr_t>(buffer));
   EXPECT_EQ(obfuscatedPointer(buffer), a);  // the offset is drawn once
   EXPECT_EQ(obfuscatedPointer(nullptr), 0u);
 }
+
+}  // namespace

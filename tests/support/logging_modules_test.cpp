@@ -1,96 +1,81 @@
+#include "support/logging_modules.h"
+
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <thread>
 #include <vector>
 
-#include "support/logging_modules.h"
-
 using platform::LogLevel;
 
-// Module set-up runs once per process, so each scenario runs in a child process and reports
-// through its exit status.
 namespace {
 
-std::vector<platform::LogEntry>* captureAll() {
-  static std::vector<platform::LogEntry> storage;
-  auto* entries = &storage;
+// Set-up runs once per process, so each scenario runs in a child process, which exits 0 when the
+// modules and the log lines are as expected.
+std::vector<std::pair<LogLevel, std::string>> gLines;
+
+void setUp(const std::vector<LoggingModuleEntry_t>& table, LoggingModuleLog* out) {
   platform::configureLog({LogLevel::Debug, false, platform::LogBackend::Stderr, "test"});
-  platform::setLogSink([entries](const platform::LogEntry& e) { entries->push_back(e); });
-  return entries;
+  platform::setLogSink([](const platform::LogEntry& e) { gLines.emplace_back(e.level, e.message); });
+  loggingModules_setup(table.data(), static_cast<uint8_t>(table.size()), out);
 }
 
-bool has(const std::vector<platform::LogEntry>& entries, LogLevel level, const std::string& message) {
-  for (const auto& e : entries)
-    if (e.level == level && e.message == message) return true;
-  return false;
+bool logged(LogLevel level, const std::string& message) {
+  return std::find(gLines.begin(), gLines.end(), std::pair(level, message)) != gLines.end();
 }
 
-int createsAndPublishes() {
-  auto* log = captureAll();
-  static LoggingModuleEntry_t table[] = {{"com.kestro.a", "one"}, {"com.kestro.b", "two"}};
-  static LoggingModuleLog out[2];
-  loggingModules_setup(table, 2, out);
-  bool ok = out[0] && out[0]->subsystem() == "com.kestro.a" && out[1]->category() == "two" &&
-            loggingModules_logs() == out && loggingModules_count() == 2 &&
-            has(*log, LogLevel::Debug, "Created log object com.kestro.a: one") &&
-            has(*log, LogLevel::Info, "Created 2 log object(s)!");
-  return ok ? 0 : 1;
+TEST(LoggingModules, CreatesOneObjectPerRowAndPublishesThem) {
+  EXPECT_EXIT(
+      {
+        static LoggingModuleLog out[2];
+        setUp({{"com.kestro.a", "one"}, {"com.kestro.b", "two"}}, out);
+        bool ok = out[0]->subsystem() == "com.kestro.a" && out[1]->category() == "two" && loggingModules_logs() == out &&
+                  loggingModules_count() == 2 && logged(LogLevel::Debug, "Created log object com.kestro.a: one") &&
+                  logged(LogLevel::Info, "Created 2 log object(s)!");
+        std::exit(ok ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), "");
 }
 
-int zeroRows() {
-  auto* log = captureAll();
-  static LoggingModuleLog out[1];
-  loggingModules_setup(nullptr, 0, out);
-  bool ok = loggingModules_count() == 0 && loggingModules_logs() == out && log->size() == 1 &&
-            has(*log, LogLevel::Info, "Created 0 log object(s)!");
-  return ok ? 0 : 1;
+TEST(LoggingModules, MissingNamesBecomeUndefinedAndFailedRowsAreNotCounted) {
+  EXPECT_EXIT(
+      {
+        static LoggingModuleLog out[3];
+        setUp({{"com.kestro.a", nullptr}, {nullptr, "cat"}, {"", "empty"}}, out);
+        bool ok = out[0]->category() == "<Undefined>" && out[1]->subsystem() == "<Undefined>" && !out[2] &&
+                  loggingModules_count() == 3 &&
+                  logged(LogLevel::Error, "Category missing for logging module 0!\n(Check LoggingModuleEntry_t table)") &&
+                  logged(LogLevel::Error, "Subsystem missing for logging module 1!\n(Check LoggingModuleEntry_t table)") &&
+                  logged(LogLevel::Error, "Failed to create log object : empty!") && logged(LogLevel::Info, "Created 2 log object(s)!");
+        std::exit(ok ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), "");
 }
 
-int missingNames() {
-  auto* log = captureAll();
-  static LoggingModuleEntry_t table[] = {{"com.kestro.a", nullptr}, {nullptr, "cat"}, {"", "empty"}};
-  static LoggingModuleLog out[3];
-  loggingModules_setup(table, 3, out);
-  bool ok = out[0] && out[0]->category() == "<Undefined>" && out[1] && out[1]->subsystem() == "<Undefined>" &&
-            !out[2] && loggingModules_count() == 3 &&
-            has(*log, LogLevel::Error, "Category missing for logging module 0!\n(Check LoggingModuleEntry_t table)") &&
-            has(*log, LogLevel::Error, "Subsystem missing for logging module 1!\n(Check LoggingModuleEntry_t table)") &&
-            has(*log, LogLevel::Error, "Failed to create log object : empty!") &&
-            has(*log, LogLevel::Info, "Created 2 log object(s)!");
-  return ok ? 0 : 1;
-}
-
-int secondSetUpIgnored() {
-  captureAll();
-  static LoggingModuleEntry_t first[] = {{"com.kestro.first", "c"}};
-  static LoggingModuleEntry_t second[] = {{"com.kestro.second", "c"}, {"x", "y"}};
-  static LoggingModuleLog outA[1], outB[2];
-  std::thread t1([] { loggingModules_setup(first, 1, outA); });
-  std::thread t2([] { loggingModules_setup(second, 2, outB); });
-  t1.join();
-  t2.join();
-  const LoggingModuleLog* published = loggingModules_logs();
-  bool ok = (published == outA && loggingModules_count() == 1 && !outB[0]) ||
-            (published == outB && loggingModules_count() == 2 && !outA[0]);
-  loggingModules_setup(second, 2, outB);
-  ok = ok && loggingModules_logs() == published;
-  return ok ? 0 : 1;
+TEST(LoggingModules, ZeroRowsStillPublishAndASecondSetUpChangesNothingEvenWhenRacing) {
+  EXPECT_EXIT(
+      {
+        static LoggingModuleLog none[1];
+        setUp({}, none);
+        bool ok = loggingModules_logs() == none && loggingModules_count() == 0 && gLines.size() == 1 &&
+                  logged(LogLevel::Info, "Created 0 log object(s)!");
+        std::exit(ok ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), "");
+  EXPECT_EXIT(
+      {
+        static LoggingModuleLog a[1];
+        static LoggingModuleLog b[2];
+        std::thread first([] { setUp({{"com.kestro.first", "c"}}, a); });
+        std::thread second([] { setUp({{"com.kestro.second", "c"}, {"x", "y"}}, b); });
+        first.join();
+        second.join();
+        const LoggingModuleLog* published = loggingModules_logs();
+        bool ok = (published == a && loggingModules_count() == 1 && !b[0]) || (published == b && loggingModules_count() == 2 && !a[0]);
+        setUp({{"com.kestro.third", "c"}}, b);
+        std::exit(ok && loggingModules_logs() == published ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), "");
 }
 
 }  // namespace
-
-TEST(LoggingModules, CreatesOneObjectPerRowAndPublishesThem) {
-  EXPECT_EXIT(std::exit(createsAndPublishes()), testing::ExitedWithCode(0), "");
-}
-
-TEST(LoggingModules, ZeroRowsCreateNothingButStillPublish) {
-  EXPECT_EXIT(std::exit(zeroRows()), testing::ExitedWithCode(0), "");
-}
-
-TEST(LoggingModules, MissingNamesBecomeUndefinedAndFailuresAreCountedOut) {
-  EXPECT_EXIT(std::exit(missingNames()), testing::ExitedWithCode(0), "");
-}
-
-TEST(LoggingModules, SecondSetUpChangesNothingEvenWhenRacing) {
-  EXPECT_EXIT(std::exit(secondSetUpIgnored()), testing::ExitedWithCode(0), "");
-}

@@ -1,0 +1,107 @@
+#include "common/child_process.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <fstream>
+#include <sstream>
+#include <string_view>
+
+extern char** environ;
+
+namespace zlkatest {
+
+namespace {
+
+std::string readFile(const std::filesystem::path& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+}  // namespace
+
+TempDir::TempDir() {
+  char pattern[] = "/tmp/zlka-test-XXXXXX";
+  if (::mkdtemp(pattern)) path_ = pattern;
+}
+
+TempDir::~TempDir() {
+  std::error_code ignored;
+  if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
+}
+
+ChildProcess::ChildProcess(const std::vector<std::string>& argv, const std::filesystem::path& outputDirectory,
+                           const std::vector<std::string>& extraEnvironment) {
+  static std::atomic<int> counter{0};
+  std::string tag = "child-" + std::to_string(getpid()) + "-" + std::to_string(++counter);
+  out_ = outputDirectory / (tag + ".out");
+  err_ = outputDirectory / (tag + ".err");
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
+  posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, out_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+  posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, err_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+  // A daemon must start with no signal blocked, whatever the test runner's threads block.
+  posix_spawnattr_t attributes;
+  posix_spawnattr_init(&attributes);
+  sigset_t none;
+  sigemptyset(&none);
+  posix_spawnattr_setsigmask(&attributes, &none);
+  posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGMASK);
+  std::vector<std::string> env;
+  for (char** e = environ; *e; ++e)
+    if (!std::string_view(*e).starts_with("NOTIFY_SOCKET=")) env.emplace_back(*e);
+  env.insert(env.end(), extraEnvironment.begin(), extraEnvironment.end());
+  std::vector<char*> args, envp;
+  for (const auto& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+  args.push_back(nullptr);
+  for (auto& e : env) envp.push_back(e.data());
+  envp.push_back(nullptr);
+  if (posix_spawn(&pid_, args[0], &actions, &attributes, args.data(), envp.data()) != 0) pid_ = -1;
+  posix_spawn_file_actions_destroy(&actions);
+  posix_spawnattr_destroy(&attributes);
+  if (pid_ > 0) pidfd_ = static_cast<int>(syscall(SYS_pidfd_open, pid_, 0));
+}
+
+ChildProcess::~ChildProcess() {
+  if (pid_ > 0 && !status_) {
+    ::kill(pid_, SIGKILL);
+    waitExit(std::chrono::seconds(10));
+  }
+  if (pidfd_ >= 0) ::close(pidfd_);
+}
+
+std::optional<int> ChildProcess::waitExit(std::chrono::milliseconds deadline) {
+  if (status_ || pid_ <= 0) return pid_ <= 0 ? std::optional<int>(-1) : status_;
+  pollfd p{pidfd_, POLLIN, 0};
+  int raw = 0;
+  if (::poll(&p, 1, static_cast<int>(deadline.count())) <= 0 || ::waitpid(pid_, &raw, 0) != pid_) return std::nullopt;
+  status_ = WIFEXITED(raw) ? WEXITSTATUS(raw) : 128 + WTERMSIG(raw);
+  return status_;
+}
+
+void ChildProcess::signal(int sig) const {
+  if (pid_ > 0 && !status_) ::kill(pid_, sig);
+}
+
+std::string ChildProcess::standardOutput() const { return readFile(out_); }
+std::string ChildProcess::standardError() const { return readFile(err_); }
+
+RunResult runToEnd(const std::vector<std::string>& argv, const std::filesystem::path& outputDirectory) {
+  ChildProcess child(argv, outputDirectory);
+  RunResult result;
+  result.status = child.waitExit(std::chrono::minutes(2)).value_or(-1);
+  result.out = child.standardOutput();
+  result.err = child.standardError();
+  return result;
+}
+
+}  // namespace zlkatest

@@ -1,0 +1,159 @@
+#include "common/server_world.h"
+
+#include <arpa/inet.h>
+#include <httplib.h>
+#include <netinet/in.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <sstream>
+#include <stdexcept>
+
+#include "devserver/dev_server.h"
+#include "network/zlka_network_constants.h"
+#include "platform/device_facts.h"
+#include "platform/settings_store.h"
+#include "tarvexsap/tarvex_sap.h"
+
+namespace zlkatest {
+
+namespace fs = std::filesystem;
+using nlohmann::json;
+
+namespace {
+
+ServerWorld* gWorld = nullptr;
+
+httplib::Result adminCall(uint16_t port, const fs::path& caFile, const std::string& method, const std::string& path,
+                          const std::string& body = {}) {
+  httplib::SSLClient client("127.0.0.1", port);
+  client.set_ca_cert_path(caFile.c_str());
+  client.enable_server_certificate_verification(true);
+  client.set_read_timeout(60, 0);
+  if (method == "GET") return client.Get(path);
+  if (method == "DELETE") return client.Delete(path);
+  return client.Post(path, body, "application/json");
+}
+
+}  // namespace
+
+void AdminClient::expectOK(const std::string& method, const std::string& path, const std::string& body) const {
+  auto result = adminCall(port_, caFile_, method, path, body);
+  ASSERT_TRUE(result && result->status == 200) << method << " " << path << " " << body << ": " << (result ? result->body : "no answer");
+}
+
+void AdminClient::setFault(const json& rule) const { expectOK("POST", "/_admin/faults", rule.dump()); }
+void AdminClient::clearFaults() const { expectOK("DELETE", "/_admin/faults"); }
+void AdminClient::reset() const { expectOK("POST", "/_admin/reset"); }
+
+json AdminClient::stats() const {
+  auto result = adminCall(port_, caFile_, "GET", "/_admin/stats");
+  if (result && result->status == 200) return json::parse(result->body);
+  ADD_FAILURE() << "GET /_admin/stats failed";
+  return json::object();
+}
+
+uint64_t AdminClient::requests(std::string_view endpoint) const {
+  const json all = stats()["requests"];
+  if (!endpoint.empty()) return all.value(std::string(endpoint), uint64_t{0});
+  uint64_t sum = 0;
+  for (const auto& [name, n] : all.items()) sum += n.get<uint64_t>();
+  return sum;
+}
+uint64_t AdminClient::handshakes() const { return stats().value("handshakes", uint64_t{0}); }
+uint64_t AdminClient::verified() const { return stats().value("verified", uint64_t{0}); }
+uint64_t AdminClient::rejected() const { return stats().value("rejected", uint64_t{0}); }
+
+void SettingsSuite::set(std::string_view key, const platform::Value& value) const {
+  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).setObject(key, value)) << "cannot write " << key;
+}
+
+void SettingsSuite::remove(std::string_view key) const {
+  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).removeObject(key)) << "cannot remove " << key;
+}
+
+void SettingsSuite::clear() const {
+  std::error_code ignored;
+  fs::remove(file(), ignored);
+}
+
+void SettingsSuite::writeRaw(std::string_view text) const {
+  std::ofstream out(file(), std::ios::binary | std::ios::trunc);
+  out << text;
+  ASSERT_TRUE(out.good()) << "cannot write " << file();
+}
+
+fs::path SettingsSuite::file() const { return directory_ / (std::string(ZLKAUserDefaultsDomain) + ".json"); }
+
+ServerWorld::ServerWorld(bool internalBuild) : internalBuild_(internalBuild) { gWorld = this; }
+
+ServerWorld::~ServerWorld() {
+  if (refusedSocket_ >= 0) ::close(refusedSocket_);
+  if (gWorld == this) gWorld = nullptr;
+}
+
+ServerWorld& ServerWorld::get() {
+  if (!gWorld) throw std::logic_error("this test binary registers no ServerWorld");
+  return *gWorld;
+}
+
+std::string ServerWorld::baseURL() const { return server_->baseURL(); }
+
+void ServerWorld::SetUp() {
+  // A connection that the server cuts must fail a write, not end the process.
+  signal(SIGPIPE, SIG_IGN);
+  std::string pattern = (fs::temp_directory_path() / "zlka-server-world-XXXXXX").string();
+  ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+  tempDir_ = pattern;
+  stateDir_ = tempDir_ / "state";
+
+  devserver::DevServerOptions options;
+  options.stateDir = stateDir_;
+  options.admin = true;
+  server_ = std::make_unique<devserver::DevServer>(options);
+  if (auto error = server_->start()) FAIL() << "zlka-devserver did not start: " << *error;
+
+  std::string error;
+  std::optional<platform::Configuration> loaded = platform::loadConfiguration(stateDir_ / "zlkad.toml", &error);
+  ASSERT_TRUE(loaded) << error;
+  configuration_ = std::move(*loaded);
+  configuration_.device.internalBuild = internalBuild_;
+  platform::setCurrentConfiguration(configuration_);
+  platform::setDeviceFacts(configuration_.device);
+
+  std::ostringstream anchor;
+  anchor << std::ifstream(configuration_.trustAnchor, std::ios::binary).rdbuf();
+  const std::string pem = anchor.str();
+  const TarvexSAPConfig sapConfig{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
+  ASSERT_EQ(TarvexSAPConfigure(&sapConfig), kTarvexSAPOK);
+
+  // Bound and never listening: the kernel refuses every connection to it.
+  refusedSocket_ = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t length = sizeof address;
+  ASSERT_EQ(::bind(refusedSocket_, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  ASSERT_EQ(::getsockname(refusedSocket_, reinterpret_cast<sockaddr*>(&address), &length), 0);
+  refusedPort_ = ntohs(address.sin_port);
+
+  admin_ = std::make_unique<AdminClient>(server_->port(), configuration_.caFile);
+  suite_ = std::make_unique<SettingsSuite>(configuration_.settingsDirectory);
+}
+
+void ServerWorld::TearDown() {
+  if (server_) server_->stop();
+  std::error_code ignored;
+  if (!tempDir_.empty()) fs::remove_all(tempDir_, ignored);
+}
+
+ScopedConfiguration::ScopedConfiguration(const std::function<void(platform::Configuration&)>& change)
+    : previous_(platform::currentConfiguration()) {
+  platform::Configuration changed = *previous_;
+  change(changed);
+  platform::setCurrentConfiguration(std::move(changed));
+}
+
+}  // namespace zlkatest

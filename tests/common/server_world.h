@@ -1,0 +1,106 @@
+// The reference-server world of a test binary: one zlka-devserver on loopback with its admin
+// interface; the zlkad.toml it writes, made this process's configuration with the binary's device
+// facts; its SAP root as the primitives' trust anchor; the developer settings suite; and a
+// loopback URL that refuses every connection. A binary registers one world before its tests run,
+//   ::testing::AddGlobalTestEnvironment(new zlkatest::ServerWorld(/*internalBuild=*/true));
+// and its tests reach it through ServerWorld::get(). Failures to reach the server fail the test.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <string>
+#include <string_view>
+
+#include "platform/configuration.h"
+#include "platform/value.h"
+
+namespace devserver {
+class DevServer;
+}
+
+namespace zlkatest {
+
+// The server's /_admin interface: faults (rules as in devserver/fault_table.h) and statistics.
+class AdminClient {
+ public:
+  AdminClient(uint16_t port, std::filesystem::path caFile) : port_(port), caFile_(std::move(caFile)) {}
+  void setFault(const nlohmann::json& rule) const;
+  void clearFaults() const;
+  // Clears the faults and the statistics.
+  void reset() const;
+  nlohmann::json stats() const;
+  // Requests that reached one endpoint ("setup.crt", "sapSession", "queryProductPlan", ...), or
+  // every endpoint when `endpoint` is empty.
+  uint64_t requests(std::string_view endpoint = {}) const;
+  uint64_t handshakes() const;  // associations made
+  uint64_t verified() const;    // token requests whose signature the server accepted
+  uint64_t rejected() const;
+
+ private:
+  void expectOK(const std::string& method, const std::string& path, const std::string& body = {}) const;
+  uint16_t port_;
+  std::filesystem::path caFile_;
+};
+
+// The developer settings suite of the configuration, written as the settings tool writes it.
+class SettingsSuite {
+ public:
+  explicit SettingsSuite(std::filesystem::path directory) : directory_(std::move(directory)) {}
+  void set(std::string_view key, const platform::Value& value) const;
+  void remove(std::string_view key) const;
+  void clear() const;
+  void writeRaw(std::string_view text) const;  // any text, parsable or not
+  std::filesystem::path file() const;
+
+ private:
+  std::filesystem::path directory_;
+};
+
+class ServerWorld : public ::testing::Environment {
+ public:
+  explicit ServerWorld(bool internalBuild);
+  ~ServerWorld() override;
+  // The world this binary registered; throws std::logic_error when it registered none.
+  static ServerWorld& get();
+
+  void SetUp() override;
+  void TearDown() override;
+
+  bool internalBuild() const { return internalBuild_; }
+  std::string baseURL() const;
+  const std::filesystem::path& stateDir() const { return stateDir_; }  // zlkad.toml, ca.pem, setup.crt
+  // A loopback base URL whose port is bound but never listens: every connection is refused.
+  std::string refusedURL() const { return "https://127.0.0.1:" + std::to_string(refusedPort_); }
+  const platform::Configuration& configuration() const { return configuration_; }
+  const AdminClient& admin() const { return *admin_; }
+  const SettingsSuite& suite() const { return *suite_; }
+
+ private:
+  bool internalBuild_;
+  std::filesystem::path tempDir_, stateDir_;
+  std::unique_ptr<devserver::DevServer> server_;
+  platform::Configuration configuration_;
+  std::unique_ptr<AdminClient> admin_;
+  std::unique_ptr<SettingsSuite> suite_;
+  int refusedSocket_ = -1;
+  uint16_t refusedPort_ = 0;
+};
+
+// The process's configuration, changed by `change` for the life of the scope.
+class ScopedConfiguration {
+ public:
+  explicit ScopedConfiguration(const std::function<void(platform::Configuration&)>& change);
+  ~ScopedConfiguration() { platform::setCurrentConfiguration(*previous_); }
+  ScopedConfiguration(const ScopedConfiguration&) = delete;
+  ScopedConfiguration& operator=(const ScopedConfiguration&) = delete;
+
+ private:
+  std::shared_ptr<const platform::Configuration> previous_;
+};
+
+}  // namespace zlkatest
