@@ -3,13 +3,12 @@
 #include "platform/entitlement_manifests.h"
 
 #include <gtest/gtest.h>
-#include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <fstream>
 
-#include "platform/log.h"
+#include "common/log_capture.h"
 
 using platform::ManifestEntry;
 using platform::PeerIdentity;
@@ -24,13 +23,8 @@ std::string entry(const std::string& fields) { return "{" + fields + (fields.emp
 }  // namespace
 
 TEST(ManifestEntry, EveryEntryPinsExactlyOneUserAndNothingUnknown) {
-  struct Row {
-    const char* name;
-    std::string text;
-    const char* refusal;  // null: accepted
-  };
   // clang-format off
-  const Row rows[] = {
+  const std::tuple<const char*, std::string, const char*> rows[] = {  // name, entry, the refusal (null: accepted)
       {"uid", entry(R"("uid": 0)"), nullptr},
       {"user name", entry(R"("user": "root")"), nullptr},
       {"every refinement", entry(R"("uid": 7, "label": "accessoryd", "executable": "/usr/bin/env")"), nullptr},
@@ -48,29 +42,20 @@ TEST(ManifestEntry, EveryEntryPinsExactlyOneUserAndNothingUnknown) {
       {"broken JSON", "{\"uid\": ", "does not parse"},
   };
   // clang-format on
-  for (const Row& row : rows) {
-    platform::Result<ManifestEntry> parsed = platform::parseManifestEntry(row.text);
-    if (!row.refusal) {
-      EXPECT_TRUE(parsed.ok()) << row.name << ": " << (parsed ? "" : parsed.error());
-      continue;
-    }
-    ASSERT_FALSE(parsed.ok()) << row.name;
-    EXPECT_NE(parsed.error().find(row.refusal), std::string::npos) << row.name << ": " << parsed.error();
+  for (const auto& [name, text, refusal] : rows) {
+    platform::Result<ManifestEntry> parsed = platform::parseManifestEntry(text);
+    ASSERT_EQ(parsed.ok(), !refusal) << name << ": " << (parsed ? "" : parsed.error());
+    EXPECT_TRUE(!refusal || parsed.error().find(refusal) != std::string::npos) << name << ": " << parsed.error();
   }
   EXPECT_EQ(platform::parseManifestEntry(entry(R"("user": "root")"))->uid, 0u);
 }
 
 TEST(ManifestEntry, RefinementsOnlyNarrowTheUser) {
-  struct Row {
-    const char* name;
-    std::optional<std::string> entryLabel, entryExecutable;
-    PeerIdentity peer;
-    bool matches;
-  };
   const PeerIdentity plain{100, 1, std::nullopt, "/usr/libexec/accessoryd"};
   const PeerIdentity labelled{100, 1, "accessoryd", "/usr/libexec/accessoryd"};
   // clang-format off
-  const Row rows[] = {
+  const std::tuple<const char*, std::optional<std::string>, std::optional<std::string>, PeerIdentity, bool> rows[] = {
+      // name, the entry's label and executable (uid 100), the peer, whether the entry admits it
       {"same user", {}, {}, plain, true},
       {"other user", {}, {}, PeerIdentity{101, 1, "accessoryd", "/usr/libexec/accessoryd"}, false},
       {"label equal", "accessoryd", {}, labelled, true},
@@ -83,34 +68,29 @@ TEST(ManifestEntry, RefinementsOnlyNarrowTheUser) {
       {"executable unknown", {}, "/usr/libexec/accessoryd", PeerIdentity{100, 1, std::nullopt, std::nullopt}, false},
   };
   // clang-format on
-  for (const Row& row : rows) {
-    ManifestEntry e{100, row.entryLabel, row.entryExecutable, {}};
-    EXPECT_EQ(e.matches(row.peer), row.matches) << row.name;
-  }
+  for (const auto& [name, label, executable, peer, matches] : rows)
+    EXPECT_EQ((ManifestEntry{100, label, executable, {}}.matches(peer)), matches) << name;
 }
 
 TEST(EntitlementManifests, LaterFilesWinAndIgnoredFilesAreNamedWithTheirReason) {
   char pattern[] = "/tmp/zlka-manifests-XXXXXX";
   ASSERT_NE(mkdtemp(pattern), nullptr);
-  std::filesystem::path dir = pattern;
-  auto write = [&](const std::string& name, const std::string& text, mode_t mode) {
+  const std::filesystem::path dir = pattern;
+  const std::string me = R"({"uid": )" + std::to_string(getuid()) + R"(, "entitlements": )";
+  // clang-format off
+  const std::tuple<const char*, std::string, mode_t> files[] = {
+      {"10-first.json", me + R"({"k": 1, "only-first": true}})", 0644}, {"20-second.json", me + R"({"k": 2}})", 0644},
+      {"30-loose.json", me + R"({"k": 3}})", 0664}, {"40-anyone.json", R"({"executable": "/usr/bin/env", "entitlements": {"k": 4}})", 0644},
+      {"50-other-user.json", R"({"uid": )" + std::to_string(getuid() + 1) + R"(, "entitlements": {"k": 5}})", 0644},
+      {"notes.txt", "not a manifest", 0644}};
+  // clang-format on
+  for (const auto& [name, text, mode] : files) {
     std::ofstream(dir / name) << text;
     chmod((dir / name).c_str(), mode);
-  };
-  const std::string me = std::to_string(getuid());
-  write("10-first.json", R"({"uid": )" + me + R"(, "entitlements": {"k": 1, "only-first": true}})", 0644);
-  write("20-second.json", R"({"uid": )" + me + R"(, "entitlements": {"k": 2}})", 0644);
-  write("30-loose.json", R"({"uid": )" + me + R"(, "entitlements": {"k": 3}})", 0664);
-  write("40-anyone.json", R"({"executable": "/usr/bin/env", "entitlements": {"k": 4}})", 0644);
-  write("50-other-user.json", R"({"uid": )" + std::to_string(getuid() + 1) + R"(, "entitlements": {"k": 5}})", 0644);
-  write("notes.txt", "not a manifest", 0644);
-
-  std::vector<std::string> lines;
-  platform::setLogSink([&](const platform::LogEntry& e) { lines.push_back(e.message); });
+  }
+  zlkatest::LogCapture log;
   platform::EntitlementManifests manifests(dir);
   EXPECT_EQ(manifests.reload(), 3u);
-  platform::setLogSink(nullptr);
-
   PeerIdentity peer{getuid(), getpid(), std::nullopt, std::nullopt};
   EXPECT_EQ(manifests.valueFor(peer, "k"), Value(2));
   EXPECT_EQ(manifests.valueFor(peer, "only-first"), Value(true));
@@ -119,19 +99,17 @@ TEST(EntitlementManifests, LaterFilesWinAndIgnoredFilesAreNamedWithTheirReason) 
       "Ignoring entitlement manifest " + (dir / "30-loose.json").string() + ": it is writable by group or others",
       "Ignoring entitlement manifest " + (dir / "40-anyone.json").string() + ": it pins no user",
   };
-  ASSERT_EQ(lines.size(), 2u);
-  for (size_t i = 0; i < 2; ++i) EXPECT_TRUE(lines[i].starts_with(expected[i])) << lines[i];
+  const auto lines = log.entries();
+  ASSERT_EQ(lines.size(), 2u) << log.dump();
+  for (size_t i = 0; i < 2; ++i) EXPECT_TRUE(lines[i].message.starts_with(expected[i])) << lines[i].message;
   std::filesystem::remove_all(dir);
 }
 
 TEST(PeerIdentity, TheExecutableIsReadOnlyForTheRecordedUser) {
-  platform::PeerCredentials self;
-  self.uid = getuid();
-  self.pid = getpid();
+  platform::PeerCredentials self{.uid = getuid(), .pid = getpid(), .label = {}, .pidfd = {}};
   EXPECT_EQ(platform::peerIdentity(self).executable, std::filesystem::read_symlink("/proc/self/exe").string());
   // A pid the bus recorded for another user (a recycled pid, or a setuid exec) shows no executable.
   self.uid = getuid() + 1;
   PeerIdentity other = platform::peerIdentity(self);
-  EXPECT_EQ(other.uid, getuid() + 1);
-  EXPECT_EQ(other.executable, std::nullopt);
+  EXPECT_EQ(std::tuple(other.uid, other.executable), std::tuple(getuid() + 1, std::nullopt));
 }

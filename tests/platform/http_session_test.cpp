@@ -8,37 +8,23 @@
 
 #include "common/server_world.h"
 
-using platform::Data;
-using platform::Error;
-using platform::HTTPRequest;
-using platform::HTTPResponse;
-using platform::HTTPSession;
-
 namespace {
 
-[[maybe_unused]] ::testing::Environment* const kWorld = ::testing::AddGlobalTestEnvironment(new zlkatest::ServerWorld(true));
+using platform::HTTPSession;
 
+[[maybe_unused]] ::testing::Environment* const kWorld = ::testing::AddGlobalTestEnvironment(new zlkatest::ServerWorld(true));
 const zlkatest::ServerWorld& world() { return zlkatest::ServerWorld::get(); }
 
 struct Outcome {
-  std::optional<Data> body;
-  std::optional<HTTPResponse> response;
-  std::optional<Error> error;
+  std::optional<platform::Data> body;
+  std::optional<platform::HTTPResponse> response;
+  std::optional<platform::Error> error;
   bool onCallbackQueue = false;
 };
 
-std::shared_ptr<HTTPSession> session(std::optional<std::string> caFile = std::nullopt, size_t maximum = 16u << 20) {
-  auto c = platform::HTTPSessionConfiguration::ephemeralSessionConfiguration();  // the configuration's CA file
-  c.caFile = caFile.value_or(c.caFile);
-  c.maximumResponseSize = maximum;
-  return HTTPSession::sessionWithConfiguration(c);
-}
-
-std::string certificateURL() { return world().baseURL() + "/deviceservices/setup.crt"; }
-
-std::shared_ptr<platform::HTTPTask> start(const std::shared_ptr<HTTPSession>& s, std::promise<Outcome>& done,
-                                          const std::string& url) {
-  return s->dataTaskWithRequest(HTTPRequest(url, 0, 60.0), [&done, s](auto body, auto response, auto error) {
+// A GET of `url` on `s`, suspended; its one completion fulfils `done`.
+std::shared_ptr<platform::HTTPTask> task(const std::shared_ptr<HTTPSession>& s, std::promise<Outcome>& done, const std::string& url) {
+  return s->dataTaskWithRequest(platform::HTTPRequest(url, 0, 60.0), [&done, s](auto body, auto response, auto error) {
     done.set_value({std::move(body), std::move(response), std::move(error), s->callbackQueue()->isCurrent()});
   });
 }
@@ -51,6 +37,7 @@ Outcome wait(std::promise<Outcome>& done) {
 
 class HTTPSessionTest : public testing::Test {
  protected:
+  const std::string crt = world().baseURL() + "/deviceservices/setup.crt";
   void TearDown() override {
     HTTPSession::setMaximumTimeout(std::nullopt);
     world().admin().clearFaults();
@@ -67,7 +54,7 @@ TEST_F(HTTPSessionTest, EachTransportFailureHasItsCodeAndNoResponse) {
     size_t maximum = 16u << 20;
     int capMs = 0;
   };
-  const std::string crt = certificateURL(), anotherCA = world().configuration().trustAnchor.string();
+  const std::string anotherCA = world().configuration().trustAnchor.string();
   // clang-format off
   const Row rows[] = {
       {"verified", crt, {}, nullptr, 0},
@@ -84,11 +71,13 @@ TEST_F(HTTPSessionTest, EachTransportFailureHasItsCodeAndNoResponse) {
   for (const Row& r : rows) {
     SCOPED_TRACE(r.name);
     if (!r.fault.is_null()) world().admin().setFault(r.fault);
-    if (r.capMs) HTTPSession::setMaximumTimeout(std::chrono::milliseconds(r.capMs));
+    HTTPSession::setMaximumTimeout(r.capMs ? std::optional(std::chrono::milliseconds(r.capMs)) : std::nullopt);
+    auto c = platform::HTTPSessionConfiguration::ephemeralSessionConfiguration();
+    c.caFile = r.caFile.value_or(c.caFile);
+    c.maximumResponseSize = r.maximum;
     std::promise<Outcome> done;
-    start(session(r.caFile, r.maximum), done, r.url)->resume();
+    task(HTTPSession::sessionWithConfiguration(c), done, r.url)->resume();
     Outcome o = wait(done);
-    HTTPSession::setMaximumTimeout(std::nullopt);
     EXPECT_TRUE(o.onCallbackQueue);
     if (r.code == 0) {
       ASSERT_FALSE(o.error) << o.error->description();
@@ -98,8 +87,7 @@ TEST_F(HTTPSessionTest, EachTransportFailureHasItsCodeAndNoResponse) {
       continue;
     }
     ASSERT_TRUE(o.error);
-    EXPECT_EQ(o.error->domain(), platform::HTTPErrorDomain);
-    EXPECT_EQ(o.error->code(), r.code) << o.error->description();
+    EXPECT_EQ(std::tuple(o.error->domain(), o.error->code()), std::tuple(platform::HTTPErrorDomain, r.code)) << o.error->description();
     EXPECT_EQ(*o.error->userInfo()->at("FailingURL").string(), r.url);
     EXPECT_FALSE(o.response || o.body);
   }
@@ -107,18 +95,18 @@ TEST_F(HTTPSessionTest, EachTransportFailureHasItsCodeAndNoResponse) {
 
 TEST_F(HTTPSessionTest, CancellingCompletesEachTaskOnceWithCancelled) {
   world().admin().setFault({{"endpoint", "setup.crt"}, {"delay_ms", 2000}});
-  auto s = session();
+  auto s = HTTPSession::sessionWithConfiguration(platform::HTTPSessionConfiguration::ephemeralSessionConfiguration());
   std::promise<Outcome> done[4];
-  auto notStarted = start(s, done[0], certificateURL());
+  auto notStarted = task(s, done[0], crt);
   notStarted->cancel();
   notStarted->resume();  // stays cancelled
-  auto started = start(s, done[1], certificateURL());
+  auto started = task(s, done[1], crt);
   started->resume();
   started->cancel();
   started->cancel();  // a second completion would set the promise twice and end the process
-  start(s, done[2], certificateURL())->resume();
+  task(s, done[2], crt)->resume();
   s->invalidateAndCancel();
-  start(s, done[3], certificateURL())->resume();  // refused once invalidated
+  task(s, done[3], crt)->resume();  // refused once invalidated
   for (auto& d : done) EXPECT_EQ(wait(d).error->code(), platform::HTTPErrorCancelled);
   s->callbackQueue()->sync([] {});  // any second completion would have run by now
 }

@@ -4,27 +4,13 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <vector>
-
+#include "common/log_capture.h"
 #include "platform/data.h"
-#include "platform/error.h"
 
 using platform::LogArg;
 using platform::LogLevel;
 
 namespace {
-
-struct Capture {
-  std::vector<platform::LogEntry> entries;
-  explicit Capture(LogLevel minimum, bool privateData) {
-    platform::configureLog({minimum, privateData, platform::LogBackend::Stderr, "test"});
-    platform::setLogSink([this](const platform::LogEntry& e) { entries.push_back(e); });
-  }
-  ~Capture() {
-    platform::setLogSink({});
-    platform::configureLog({});
-  }
-};
 
 struct Counting {  // counts how often it is formatted
   int* calls;
@@ -33,7 +19,7 @@ struct Counting {  // counts how often it is formatted
 
 TEST(LogFormat, DirectivesFormatTheirArgumentsAndPrivateOnesAreRedacted) {
   const char* nullText = nullptr;
-  const std::optional<platform::Error> none;
+  const std::optional<platform::Data> none;
   const std::optional<std::string> some = "x";
   struct Row {
     const char* format;
@@ -51,7 +37,6 @@ TEST(LogFormat, DirectivesFormatTheirArgumentsAndPrivateOnesAreRedacted) {
       {"%@ %@ %s %@ %@ %s", {std::string("str"), platform::Data::fromString("\x01"), "cstr", none, some, nullText},
        "str {length = 1, bytes = 0x01} cstr (null) x (null)"},
       {"%@ %@ %@", {42, -1.5, true}, "42 -1.5 1"},
-      {"%@", {platform::Error("D", 3)}, R"x(Error Domain=D Code=3 "The operation couldn't be completed. (D error 3.)")x"},
       {"%p %p", {uintptr_t{0x1234}, static_cast<const void*>(nullptr)}, "0x1234 0x0"},
       {"%d %d", {1}, "1 <missing>"},
       {"%q %d", {1}, "%q 1"},  // an unknown directive stays visible and takes no argument
@@ -70,18 +55,18 @@ TEST(LogFormat, DirectivesFormatTheirArgumentsAndPrivateOnesAreRedacted) {
 
 TEST(Log, EntriesBelowTheMinimumAreNeitherFormattedNorWrittenAndPrivateDataRevealsPrivateArguments) {
   for (bool privateData : {false, true}) {
-    Capture capture(LogLevel::Default, privateData);
+    zlkatest::LogCapture capture;
+    platform::configureLog({LogLevel::Default, privateData, platform::LogBackend::Stderr, "test"});
     int calls = 0;
     platform::log(LogLevel::Debug, "%@", Counting{&calls});
     platform::log(LogLevel::Info, "%@", Counting{&calls});
     EXPECT_EQ(calls, 0);
     platform::log(LogLevel::Default, "%@ %{private}@", Counting{&calls}, std::string("abc"));
     platform::log(*platform::Log::create("com.example.sub", "cat"), LogLevel::Fault, "f");
-    ASSERT_EQ(capture.entries.size(), 2u);
-    EXPECT_EQ(capture.entries[0].message, privateData ? "1 abc" : "1 <private>");
-    EXPECT_EQ(capture.entries[0].subsystem + capture.entries[0].category, "");  // the default log object
-    EXPECT_EQ(capture.entries[1].level, LogLevel::Fault);
-    EXPECT_EQ(capture.entries[1].subsystem + "/" + capture.entries[1].category, "com.example.sub/cat");
+    const auto e = capture.entries();
+    ASSERT_EQ(e.size(), 2u);
+    EXPECT_EQ(std::tuple(e[0].message, e[0].subsystem + e[0].category), std::tuple(privateData ? "1 abc" : "1 <private>", ""));
+    EXPECT_EQ(std::tuple(e[1].level, e[1].subsystem + "/" + e[1].category), std::tuple(LogLevel::Fault, "com.example.sub/cat"));
   }
 }
 
@@ -101,9 +86,8 @@ TEST(Log, StderrLinesCarryTimeIdentifierLevelAndModuleAndStayOneLine) {
 }
 
 TEST(Log, LevelNamesAndJournalPriorities) {
-  const std::tuple<LogLevel, const char*, int> rows[] = {{LogLevel::Debug, "debug", 7}, {LogLevel::Info, "info", 6},
-      {LogLevel::Default, "default", 5}, {LogLevel::Error, "error", 3}, {LogLevel::Fault, "fault", 2}};
-  for (const auto& [level, name, priority] : rows) {
+  for (const auto& [level, name, priority] : {std::tuple{LogLevel::Debug, "debug", 7}, {LogLevel::Info, "info", 6},
+           {LogLevel::Default, "default", 5}, {LogLevel::Error, "error", 3}, {LogLevel::Fault, "fault", 2}}) {
     EXPECT_EQ(platform::logLevelName(level), name);
     EXPECT_EQ(platform::logLevelFromName(name), level);
     EXPECT_EQ(platform::journalPriority(level), priority);

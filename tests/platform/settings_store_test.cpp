@@ -3,12 +3,10 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <filesystem>
 #include <fstream>
 #include <thread>
-#include <vector>
 
-#include "platform/log.h"
+#include "common/log_capture.h"
 
 using platform::SettingsStore;
 using platform::Value;
@@ -19,11 +17,10 @@ namespace fs = std::filesystem;
 
 class SettingsStoreTest : public testing::Test {
  protected:
-  fs::path dir = fs::temp_directory_path() / ("zlka-settings-" + std::to_string(getpid()));
+  const fs::path dir = fs::temp_directory_path() / ("zlka-settings-" + std::to_string(getpid()));
   SettingsStore store{"suite", dir};
   void SetUp() override { fs::create_directories(dir); }
   void TearDown() override { fs::remove_all(dir); }
-  void write(const std::string& text) { std::ofstream(dir / "suite.json") << text; }
 };
 
 TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {
@@ -36,7 +33,7 @@ TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {
   // clang-format on
   std::string suite = "{";
   for (size_t i = 0; i < std::size(rows); ++i) suite += "\"k" + std::to_string(i) + "\": " + rows[i].first + ", ";
-  write(suite + R"("s": "ut"})");
+  std::ofstream(dir / "suite.json") << suite + R"("s": "ut"})";
   for (size_t i = 0; i < std::size(rows); ++i) EXPECT_EQ(store.boolForKey("k" + std::to_string(i)), rows[i].second) << rows[i].first;
   EXPECT_FALSE(store.boolForKey("missing"));
   EXPECT_EQ(store.stringForKey("s"), "ut");
@@ -44,8 +41,7 @@ TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {
 }
 
 TEST_F(SettingsStoreTest, EveryLookupSeesTheFileAsItIsNowAndABrokenOneIsLoggedOncePerChange) {
-  std::vector<std::string> lines;
-  platform::setLogSink([&](const platform::LogEntry& e) { lines.push_back(e.message); });
+  zlkatest::LogCapture log;
   const std::pair<std::string, std::optional<std::string>> steps[] = {  // the file, then what "Server" reads
       {"", std::nullopt},  // no file
       {R"({"Server": "ut"})", "ut"},
@@ -56,27 +52,27 @@ TEST_F(SettingsStoreTest, EveryLookupSeesTheFileAsItIsNowAndABrokenOneIsLoggedOn
       {"", std::nullopt},  // removed
   };
   for (const auto& [text, server] : steps) {
-    text.empty() ? void(fs::remove(dir / "suite.json")) : write(text);
+    text.empty() ? void(fs::remove(dir / "suite.json")) : void(std::ofstream(dir / "suite.json") << text);
     EXPECT_EQ(store.stringForKey("Server"), server) << text;
     EXPECT_EQ(store.stringForKey("Server"), server) << text;  // the unchanged file is not logged again
   }
-  platform::setLogSink({});
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].rfind("Settings suite suite is unreadable (" + (dir / "suite.json").string() + "): ", 0), 0u);
-  EXPECT_NE(lines[1].find("not a JSON object"), std::string::npos);
+  const auto lines = log.entries();
+  ASSERT_EQ(lines.size(), 2u) << log.dump();
+  EXPECT_TRUE(lines[0].message.starts_with("Settings suite suite is unreadable (" + (dir / "suite.json").string() + "): "));
+  EXPECT_NE(lines[1].message.find("not a JSON object"), std::string::npos);
 }
 
 TEST_F(SettingsStoreTest, WritesAreAtomicAndConcurrentWritersLoseNothing) {
   SettingsStore fresh("suite", dir / "new-dir");
   ASSERT_TRUE(fresh.setObject("x", Value(true)));
   EXPECT_FALSE(fresh.setObject("bad", Value(platform::Data::fromString("bytes"))));  // no JSON form
-  std::vector<std::thread> threads;
+  std::vector<std::jthread> threads;
   for (int t = 0; t < 4; ++t)
     threads.emplace_back([&, t] {
       SettingsStore own("suite", dir / "new-dir");
       for (int i = 0; i < 10; ++i) own.setObject("k" + std::to_string(t) + "_" + std::to_string(i), Value(i));
     });
-  for (auto& th : threads) th.join();
+  threads.clear();
   EXPECT_EQ(fresh.dictionaryRepresentation().size(), 41u);
   ASSERT_TRUE(fresh.removeObject("x") && fresh.removeObject("never-there"));
   EXPECT_FALSE(fresh.objectForKey("x"));

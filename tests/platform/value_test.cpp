@@ -1,3 +1,4 @@
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cmath>
@@ -9,6 +10,7 @@
 #include "platform/error.h"
 #include "platform/json.h"
 #include "platform/locale.h"
+#include "platform/uuid.h"
 
 using platform::Array;
 using platform::Data;
@@ -18,17 +20,13 @@ using platform::Value;
 namespace {
 
 constexpr uint64_t kU64Max = std::numeric_limits<uint64_t>::max();
-std::string nested(int depth, const std::string& inner = "") {
-  return std::string(size_t(depth), '[') + inner + std::string(size_t(depth), ']');
-}
+std::string nested(int depth) { return std::string(size_t(depth), '[') + std::string(size_t(depth), ']'); }
 
 TEST(Data, ComparesByContentSharesCopiesFreesAnAdoptedBufferOnceAndDescribesLongOnesByTheirEnds) {
   const uint8_t raw[] = {1, 2, 3};
   Data a(raw, 3), copy = a;
   EXPECT_EQ(copy.bytes(), a.bytes());
-  EXPECT_EQ(a, Data(std::vector<uint8_t>{1, 2, 3}));
-  EXPECT_NE(a, Data(raw, 2));
-  EXPECT_NE(a, Data(std::vector<uint8_t>{1, 2, 4}));
+  EXPECT_TRUE(a == Data(std::vector<uint8_t>{1, 2, 3}) && a != Data(raw, 2) && a != Data(std::vector<uint8_t>{1, 2, 4}));
   EXPECT_EQ(Data(), Data(raw, 0));
   auto* p = static_cast<uint8_t*>(std::malloc(4));
   std::memcpy(p, "abcd", 4);
@@ -71,11 +69,8 @@ TEST(Value, MembersAndDescription) {
                      {"d", 0.25}, {"e", kU64Max}});
   EXPECT_EQ(v.description(), R"({"a": [1, true, "q\"\\\n\u0001"], "b": {length = 1, bytes = 0x0f}, "c": <fd>, )"
                              R"("d": 0.25, "e": 18446744073709551615})");
-  EXPECT_EQ(v.find("a")->count(), 3u);
-  EXPECT_EQ(v.count(), 5u);
-  EXPECT_EQ(v.find("missing"), nullptr);
-  EXPECT_EQ(Value("s").find("a"), nullptr);
-  EXPECT_EQ(Value("s").count(), 0u);
+  EXPECT_EQ(std::tuple(v.count(), v.find("a")->count(), Value("s").count()), std::tuple(5u, 3u, 0u));
+  EXPECT_TRUE(!v.find("missing") && !Value("s").find("a"));
 }
 
 TEST(Json, OnlyArraysAndObjectsOfJSONKindsAreWrittenAndTheRoundTripKeepsTheKinds) {
@@ -89,9 +84,7 @@ TEST(Json, OnlyArraysAndObjectsOfJSONKindsAreWrittenAndTheRoundTripKeepsTheKinds
   // clang-format on
   for (const auto& [v, valid] : rows) EXPECT_EQ(platform::json::isValidJSONObject(v), valid) << v.description();
   std::string error;
-  EXPECT_FALSE(platform::json::serialize(Value(1), false, &error));
-  EXPECT_EQ(error, "Invalid type in JSON write");
-
+  EXPECT_EQ(platform::json::serialize(Value(1), false, &error).value_or(error), "Invalid type in JSON write");
   Value v(Dictionary{{"b", true}, {"i", -3}, {"u", kU64Max}, {"d", 0.25}, {"n", Value()}, {"s", "é"}, {"a", Array{false}}});
   auto text = platform::json::serialize(v);
   ASSERT_TRUE(text);
@@ -118,8 +111,7 @@ TEST(Json, ParsingIsStrictAndBoundsTheNesting) {
   // clang-format on
   for (const auto& [text, ok] : rows) EXPECT_EQ(platform::json::parse(text).has_value(), ok) << text.substr(0, 40);
   std::string error;
-  EXPECT_FALSE(platform::json::parse("\"fragment\"", &error));
-  EXPECT_FALSE(error.empty());
+  EXPECT_TRUE(!platform::json::parse("\"fragment\"", &error) && !error.empty());
 }
 
 TEST(Error, UserInfoAbsentIsDistinctFromEmptyAndCarriesTheMessage) {
@@ -133,12 +125,8 @@ TEST(Error, UserInfoAbsentIsDistinctFromEmptyAndCarriesTheMessage) {
 }
 
 TEST(Base64, EncodesTheStandardAlphabetAndDecodesOnlyWhatItWouldWrite) {
-  struct Row {
-    std::string text;
-    std::optional<std::string> plain;  // nullopt: refused
-  };
   // clang-format off
-  const Row rows[] = {
+  const std::pair<std::string, std::optional<std::string>> rows[] = {  // text, the bytes (nullopt: refused)
       {"", ""}, {"Zg==", "f"}, {"Zm8=", "fo"}, {"Zm9v", "foo"}, {"Zm9vYg==", "foob"}, {"Zm9vYmE=", "fooba"},
       {"Zm9vYmFy", "foobar"}, {"+/8=", "\xfb\xff"}, {"AAEC/f7/", std::string("\0\1\2\xfd\xfe\xff", 6)},
       {"AQI", {}},       // length not a multiple of four
@@ -147,13 +135,21 @@ TEST(Base64, EncodesTheStandardAlphabetAndDecodesOnlyWhatItWouldWrite) {
       {"A===", {}},      {"=AAA", {}},     {"AQ=I", {}}, {"Zg=a", {}},  // padding only at the end
   };
   // clang-format on
-  for (const Row& r : rows) {
-    std::optional<Data> decoded = platform::base64DecodeStrict(r.text);
-    ASSERT_EQ(decoded.has_value(), r.plain.has_value()) << r.text;
-    if (!r.plain) continue;
-    EXPECT_EQ(decoded->view(), *r.plain) << r.text;
-    EXPECT_EQ(platform::base64Encode(Data::fromString(*r.plain).span()), r.text);
+  for (const auto& [text, plain] : rows) {
+    std::optional<Data> decoded = platform::base64DecodeStrict(text);
+    EXPECT_EQ(decoded ? std::optional<std::string>(decoded->view()) : std::nullopt, plain) << text;
+    EXPECT_TRUE(!plain || platform::base64Encode(Data::fromString(*plain).span()) == text) << text;
   }
+}
+
+TEST(UUID, IsRandomVersionFourAndReadsAsItsBytesInUpperCase) {
+  platform::UUID uuid;
+  const std::string text = uuid.UUIDString();
+  EXPECT_THAT(text, testing::MatchesRegex("[0-9A-F]{8}-[0-9A-F]{4}-4[0-9A-F]{3}-[89AB][0-9A-F]{3}-[0-9A-F]{12}"));
+  std::string hex = text;
+  std::erase(hex, '-');
+  for (size_t i = 0; i < 16 && 2 * i < hex.size(); ++i) EXPECT_EQ(std::stoi(hex.substr(2 * i, 2), nullptr, 16), uuid.bytes()[i]) << text;
+  EXPECT_NE(uuid, platform::UUID());
 }
 
 TEST(Locale, IdentifiersComeFromICUAndCompareExactly) {
