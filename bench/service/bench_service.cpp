@@ -45,7 +45,8 @@ struct Stack {
     harness.writeManifest("bench", std::filesystem::read_symlink("/proc/self/exe").string(),
                           platform::Value(platform::Array{"token-auth"}));
     if (!harness.startDaemon({"--log-level", "error"})) {
-      std::fprintf(stderr, "zlkad did not start:\n%s\n", harness.daemon() ? harness.daemon()->standardError().c_str() : "");
+      std::fprintf(stderr, "zlkad did not start:\n%s\n",
+                   harness.daemon() ? harness.daemon()->standardError().c_str() : "");
       return;
     }
     std::ifstream in(harness.stateDirectory() / "sap-root.pem", std::ios::binary);
@@ -53,7 +54,9 @@ struct Stack {
     TarvexSAPConfig sap{reinterpret_cast<const uint8_t*>(trustAnchor.data()), trustAnchor.size(), nullptr};
     auto client = zlka_client::ZLKAClient::connect({.bus = harness.busAddress()});
     ready = TarvexSAPConfigure(&sap) == 0 && client.ok() &&
-            client.value()->confirmActivation({.token = service_test::sampleToken(), .uuid = kUUID}).ok();  // opens the session
+            client.value()
+                ->confirmActivation({.token = service_test::sampleToken(), .uuid = kUUID})
+                .ok();  // opens the session
   }
 };
 
@@ -74,7 +77,8 @@ double daemonUniqueKiB() {
   std::ifstream in("/proc/" + std::to_string(daemonPid()) + "/smaps_rollup");
   double kib = 0;
   for (std::string line; std::getline(in, line);)
-    if (line.starts_with("Private_Clean:") || line.starts_with("Private_Dirty:")) kib += std::stod(line.substr(line.find(':') + 1));
+    if (line.starts_with("Private_Clean:") || line.starts_with("Private_Dirty:"))
+      kib += std::stod(line.substr(line.find(':') + 1));
   return kib;
 }
 
@@ -84,7 +88,9 @@ struct Percentiles {
 Percentiles percentiles(std::vector<double> samples) {
   if (samples.empty()) return {};
   std::sort(samples.begin(), samples.end());
-  auto at = [&](double q) { return samples[std::min(samples.size() - 1, static_cast<size_t>(q * double(samples.size())))]; };
+  auto at = [&](double q) {
+    return samples[std::min(samples.size() - 1, static_cast<size_t>(q * double(samples.size())))];
+  };
   return {at(0.50), at(0.99)};
 }
 
@@ -92,7 +98,9 @@ std::map<std::string, Percentiles> gFloor;  // "dbus", and each endpoint
 std::map<int, double> gFloorRate;           // clients -> operations per second
 
 const char* endpointOf(Operation op) {
-  return op == Operation::metadata ? "queryProductPlan" : op == Operation::activation ? "activateAccessory" : "ackAccessory";
+  return op == Operation::metadata     ? "queryProductPlan"
+         : op == Operation::activation ? "activateAccessory"
+                                       : "ackAccessory";
 }
 
 // The body zlkad sends for the operation, byte for byte.
@@ -106,7 +114,8 @@ platform::BusPtr connectRaw() {
   sd_bus* bus = nullptr;
   if (sd_bus_new(&bus) < 0) return nullptr;
   platform::BusPtr owned(bus);
-  if (sd_bus_set_address(bus, stack().harness.busAddress().c_str()) < 0 || sd_bus_set_bus_client(bus, 1) < 0 || sd_bus_start(bus) < 0)
+  if (sd_bus_set_address(bus, stack().harness.busAddress().c_str()) < 0 || sd_bus_set_bus_client(bus, 1) < 0 ||
+      sd_bus_start(bus) < 0)
     return nullptr;
   return owned;
 }
@@ -124,7 +133,8 @@ bool succeeded(const R& result) {
 bool call(zlka_client::ZLKAClient& client, Operation op) {
   switch (op) {
     case Operation::metadata:
-      return succeeded(client.requestMetadata({.token = service_test::sampleToken(), .uuid = kUUID, .requestedLocale = "en_US"}));
+      return succeeded(
+          client.requestMetadata({.token = service_test::sampleToken(), .uuid = kUUID, .requestedLocale = "en_US"}));
     case Operation::activation:
       return succeeded(client.requestActivation({.token = service_test::sampleToken(), .uuid = kUUID}));
     case Operation::confirmation:
@@ -184,8 +194,10 @@ double rate(int clients, std::chrono::milliseconds duration, Worker makeWorker) 
     for (Step& step : steps)
       threads.emplace_back([&] {
         while (Clock::now() < stop && !failed)
-          if (step()) ++done;
-          else failed = true;
+          if (step())
+            ++done;
+          else
+            failed = true;
       });
   }
   return failed ? -1 : double(done) / std::chrono::duration<double>(duration).count();
@@ -198,7 +210,8 @@ void BM_ThroughputFloor(benchmark::State& state) {
   for (auto _ : state)
     perSecond = rate(clients, std::chrono::milliseconds(1500), [] {
       auto bus = std::make_shared<platform::BusPtr>(connectRaw());
-      auto device = std::make_shared<netbench::CurlDevice>(stack().harness.server().baseURL(), stack().harness.stateDirectory() / "ca.pem");
+      auto device = std::make_shared<netbench::CurlDevice>(stack().harness.server().baseURL(),
+                                                           stack().harness.stateDirectory() / "ca.pem");
       device->associate();
       auto body = bodyOf(Operation::confirmation);
       return [bus, device, body] {
@@ -255,8 +268,8 @@ void BM_Resources(benchmark::State& state) {
       platform::BusPtr peer = connectRaw();
       if (!peer) return state.SkipWithError("cannot connect 1,000 peers");
       sd_bus_message* answer = nullptr;
-      if (sd_bus_call_method(peer.get(), kName, kPath, kInterface, "ConfirmActivationForToken", nullptr, &answer, "a{sv}", 2,
-                             "token", "ay", 2, 0x30, 0x00, "uuid", "s", kUUID) < 0)
+      if (sd_bus_call_method(peer.get(), kName, kPath, kInterface, "ConfirmActivationForToken", nullptr, &answer,
+                             "a{sv}", 2, "token", "ay", 2, 0x30, 0x00, "uuid", "s", kUUID) < 0)
         return state.SkipWithError("a peer's call was not answered");
       sd_bus_message_unref(answer);
       peers.push_back(std::move(peer));

@@ -45,11 +45,13 @@ Error failure(int64_t code) {
   return error;
 }
 
-std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token, const RequestPlan& plan, ResponseHandler handler) {
+std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token, const RequestPlan& plan,
+                                         ResponseHandler handler) {
   std::optional<std::vector<Data>> tokenArray = parseTokenArray(token);
   platform::log(LogLevel::Info, "[#TokenAuth] tokenArray.count: %lu", tokenArray ? tokenArray->size() : 0);
   if (platform::Log::enabled(LogLevel::Debug) && tokenArray)
-    platform::log(LogLevel::Debug, "[#TokenAuth] tokenArray: %{private}@", Value(platform::Array(tokenArray->begin(), tokenArray->end())));
+    platform::log(LogLevel::Debug, "[#TokenAuth] tokenArray: %{private}@",
+                  Value(platform::Array(tokenArray->begin(), tokenArray->end())));
   if (!tokenArray) return ZLKAErrorInvalidParameter;
   platform::Array encoded;
   for (std::string& s : base64EncodeArray(tokenArray)) encoded.emplace_back(std::move(s));
@@ -115,7 +117,8 @@ std::optional<int64_t> checkTransportAndStatus(const std::optional<Error>& taskE
     platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", std::string(body->view()));
   long status = response->statusCode;
   if (status == 200 || (acceptNoContent && status == 204)) return std::nullopt;
-  platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!\nresponseData (string): %@", status,
+  platform::log(LogLevel::Error,
+                "[#TokenAuth] Server responded with invalid HTTP status code: %ld!\nresponseData (string): %@", status,
                 body ? std::string(body->view()) : std::string());
   if (status == 400) return ZLKAErrorInvalidParameter;
   if (status == 401) return ZLKAErrorInternal;

@@ -40,8 +40,10 @@ int readArray(sd_bus_message* m, const char* contents, Value& out, int depth) {
       if (stringKeys) dictionary.insert_or_assign(*key.string(), std::move(value));
     }
     if (r < 0) return r;
-    if (stringKeys) out = Value(std::move(dictionary));
-    else out = Value(Opaque{"dictionary with " + std::string(1, contents[1]) + " keys"});
+    if (stringKeys)
+      out = Value(std::move(dictionary));
+    else
+      out = Value(Opaque{"dictionary with " + std::string(1, contents[1]) + " keys"});
   } else {
     Array array;
     while ((r = sd_bus_message_at_end(m, 0)) == 0) {
@@ -62,13 +64,20 @@ int readValue(sd_bus_message* m, Value& out, int depth) {
   int r = sd_bus_message_peek_type(m, &type, &contents);
   if (r <= 0) return r < 0 ? r : -EBADMSG;
   switch (type) {
-    case 'y': return readInteger<uint8_t>(m, type, out);
-    case 'n': return readInteger<int16_t>(m, type, out);
-    case 'q': return readInteger<uint16_t>(m, type, out);
-    case 'i': return readInteger<int32_t>(m, type, out);
-    case 'u': return readInteger<uint32_t>(m, type, out);
-    case 'x': return readInteger<int64_t>(m, type, out);
-    case 't': return readInteger<uint64_t>(m, type, out);
+    case 'y':
+      return readInteger<uint8_t>(m, type, out);
+    case 'n':
+      return readInteger<int16_t>(m, type, out);
+    case 'q':
+      return readInteger<uint16_t>(m, type, out);
+    case 'i':
+      return readInteger<int32_t>(m, type, out);
+    case 'u':
+      return readInteger<uint32_t>(m, type, out);
+    case 'x':
+      return readInteger<int64_t>(m, type, out);
+    case 't':
+      return readInteger<uint64_t>(m, type, out);
     case 'b': {
       int v = 0;
       if ((r = sd_bus_message_read_basic(m, 'b', &v)) > 0) out = Value(v != 0);
@@ -108,8 +117,10 @@ int readValue(sd_bus_message* m, Value& out, int depth) {
       out = Value(std::move(fields));
       return sd_bus_message_exit_container(m) < 0 ? -EBADMSG : 1;
     }
-    case 'a': return readArray(m, contents, out, depth);
-    default: return -EBADMSG;
+    case 'a':
+      return readArray(m, contents, out, depth);
+    default:
+      return -EBADMSG;
   }
 }
 
@@ -119,7 +130,9 @@ int readBusValue(sd_bus_message* message, Value& out) { return readValue(message
 
 std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<std::string, std::string>& signatures,
                                             const BusDictionaryReader& take) {
-  auto malformed = [] { return BusError{kBusErrorInvalidArgs, "The argument must be a dictionary of string keys to variants (a{sv})."}; };
+  auto malformed = [] {
+    return BusError{kBusErrorInvalidArgs, "The argument must be a dictionary of string keys to variants (a{sv})."};
+  };
   if (sd_bus_message_enter_container(m, 'a', "{sv}") <= 0) return malformed();
   std::set<std::string> seen;
   int r;
@@ -134,7 +147,8 @@ std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<st
     const char* contents = nullptr;
     if (sd_bus_message_peek_type(m, &type, &contents) <= 0 || type != 'v' || !contents || expected->second != contents)
       return BusError{kBusErrorInvalidArgs, "Key '" + key + "' must hold a value of type " + expected->second + "."};
-    if (sd_bus_message_enter_container(m, 'v', contents) <= 0 || take(key, m) < 0 || sd_bus_message_exit_container(m) < 0)
+    if (sd_bus_message_enter_container(m, 'v', contents) <= 0 || take(key, m) < 0 ||
+        sd_bus_message_exit_container(m) < 0)
       return BusError{kBusErrorInvalidArgs, "The value of key '" + key + "' could not be read."};
     if (sd_bus_message_exit_container(m) < 0) return malformed();
   }

@@ -29,18 +29,33 @@ Error transportError(CURLcode code, const std::string& detail, const std::string
   int64_t errorCode = HTTPErrorUnknown;
   std::string text;
   switch (code) {
-    case CURLE_OPERATION_TIMEDOUT: errorCode = HTTPErrorTimedOut; text = "The request timed out."; break;
+    case CURLE_OPERATION_TIMEDOUT:
+      errorCode = HTTPErrorTimedOut;
+      text = "The request timed out.";
+      break;
     case CURLE_COULDNT_CONNECT:
     case CURLE_COULDNT_RESOLVE_HOST:
-    case CURLE_COULDNT_RESOLVE_PROXY: errorCode = HTTPErrorCannotConnectToHost; text = "Could not connect to the server."; break;
+    case CURLE_COULDNT_RESOLVE_PROXY:
+      errorCode = HTTPErrorCannotConnectToHost;
+      text = "Could not connect to the server.";
+      break;
     case CURLE_URL_MALFORMAT:
-    case CURLE_UNSUPPORTED_PROTOCOL: errorCode = HTTPErrorBadURL; text = "unsupported URL"; break;
+    case CURLE_UNSUPPORTED_PROTOCOL:
+      errorCode = HTTPErrorBadURL;
+      text = "unsupported URL";
+      break;
     case CURLE_GOT_NOTHING:
     case CURLE_RECV_ERROR:
     case CURLE_SEND_ERROR:
     case CURLE_SEND_FAIL_REWIND:
-    case CURLE_PARTIAL_FILE: errorCode = HTTPErrorNetworkConnectionLost; text = "The network connection was lost."; break;
-    case CURLE_WRITE_ERROR: errorCode = HTTPErrorResourceTooLarge; text = "The answer exceeds the maximum size."; break;
+    case CURLE_PARTIAL_FILE:
+      errorCode = HTTPErrorNetworkConnectionLost;
+      text = "The network connection was lost.";
+      break;
+    case CURLE_WRITE_ERROR:
+      errorCode = HTTPErrorResourceTooLarge;
+      text = "The answer exceeds the maximum size.";
+      break;
     case CURLE_PEER_FAILED_VERIFICATION:
     case CURLE_SSL_CONNECT_ERROR:
     case CURLE_SSL_CERTPROBLEM:
@@ -49,15 +64,19 @@ Error transportError(CURLcode code, const std::string& detail, const std::string
       errorCode = HTTPErrorSecureConnectionFailed;
       text = "A TLS error occurred and a secure connection to the server cannot be made.";
       break;
-    default: text = curl_easy_strerror(code); break;
+    default:
+      text = curl_easy_strerror(code);
+      break;
   }
   if (!detail.empty()) text += " (" + detail + ")";
-  return Error(HTTPErrorDomain, errorCode,
-               Dictionary{{LocalizedDescriptionKey, text}, {"FailingURL", url}, {"TransportCode", static_cast<int64_t>(code)}});
+  return Error(
+      HTTPErrorDomain, errorCode,
+      Dictionary{{LocalizedDescriptionKey, text}, {"FailingURL", url}, {"TransportCode", static_cast<int64_t>(code)}});
 }
 
 Error cancelledError(const std::string& url) {
-  return Error(HTTPErrorDomain, HTTPErrorCancelled, Dictionary{{LocalizedDescriptionKey, "cancelled"}, {"FailingURL", url}});
+  return Error(HTTPErrorDomain, HTTPErrorCancelled,
+               Dictionary{{LocalizedDescriptionKey, "cancelled"}, {"FailingURL", url}});
 }
 
 }  // namespace
@@ -83,7 +102,8 @@ struct HTTPTaskState {
 class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Engine> {
  public:
   explicit Engine(HTTPSessionConfiguration configuration)
-      : configuration_(std::move(configuration)), callbackQueue_(Queue::serial(configuration_.label + ".callbackQueue")) {
+      : configuration_(std::move(configuration)),
+        callbackQueue_(Queue::serial(configuration_.label + ".callbackQueue")) {
     globalInit();
     multi_ = curl_multi_init();
   }
@@ -92,7 +112,6 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     stop();
     curl_multi_cleanup(multi_);
   }
-
 
   const std::shared_ptr<Queue>& callbackQueue() const { return callbackQueue_; }
 
@@ -109,7 +128,8 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     }
     complete(task, std::nullopt, std::nullopt,
              stopping ? cancelledError(task->request.URL)
-                      : transportError(CURLE_OUT_OF_MEMORY, "no thread could be started for the transfer", task->request.URL));
+                      : transportError(CURLE_OUT_OF_MEMORY, "no thread could be started for the transfer",
+                                       task->request.URL));
   }
 
   void cancel(const std::shared_ptr<HTTPTaskState>& task) {
@@ -144,13 +164,15 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
       curl_multi_wakeup(multi_);
     }
     if (worker_.joinable()) {
-      if (worker_.get_id() == std::this_thread::get_id()) worker_.detach();
-      else worker_.join();
+      if (worker_.get_id() == std::this_thread::get_id())
+        worker_.detach();
+      else
+        worker_.join();
     }
   }
 
-  void complete(const std::shared_ptr<HTTPTaskState>& task, std::optional<Data> body, std::optional<HTTPResponse> response,
-                std::optional<Error> error) {
+  void complete(const std::shared_ptr<HTTPTaskState>& task, std::optional<Data> body,
+                std::optional<HTTPResponse> response, std::optional<Error> error) {
     if (task->finished.exchange(true)) return;
     HTTPCompletion completion = std::move(task->completion);
     if (!completion) return;
@@ -352,8 +374,10 @@ void HTTPTask::resume() {
 void HTTPTask::cancel() {
   auto engine = state_->engine.lock();
   if (!engine || state_->finished) return;
-  if (state_->started) engine->cancel(state_);
-  else engine->complete(state_, std::nullopt, std::nullopt, cancelledError(state_->request.URL));
+  if (state_->started)
+    engine->cancel(state_);
+  else
+    engine->complete(state_, std::nullopt, std::nullopt, cancelledError(state_->request.URL));
 }
 
 const HTTPRequest& HTTPTask::originalRequest() const { return state_->request; }
@@ -370,11 +394,13 @@ std::shared_ptr<HTTPSession> HTTPSession::sessionWithConfiguration(HTTPSessionCo
 }
 
 std::shared_ptr<HTTPSession> HTTPSession::sharedSession() {
-  static std::shared_ptr<HTTPSession> shared = sessionWithConfiguration(HTTPSessionConfiguration::defaultSessionConfiguration());
+  static std::shared_ptr<HTTPSession> shared =
+      sessionWithConfiguration(HTTPSessionConfiguration::defaultSessionConfiguration());
   return shared;
 }
 
-std::shared_ptr<HTTPTask> HTTPSession::uploadTaskWithRequest(HTTPRequest request, Data body, HTTPCompletion completion) {
+std::shared_ptr<HTTPTask> HTTPSession::uploadTaskWithRequest(HTTPRequest request, Data body,
+                                                             HTTPCompletion completion) {
   auto state = std::make_shared<HTTPTaskState>();
   state->request = std::move(request);
   state->body = std::move(body);

@@ -248,7 +248,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     Peer made;
     auto connection = std::make_shared<Connection>(sender);
     std::shared_ptr<ListenerDelegate> delegate = owner_.delegate();
-    if (delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection)) made.connection = std::move(connection);
+    if (delegate && delegate->listenerShouldAcceptNewConnection(owner_, *connection))
+      made.connection = std::move(connection);
     if (made.connection) made.request = std::make_unique<CredentialsRequest>(CredentialsRequest{this, sender});
     Peer& peer = peers_.emplace(sender, std::move(made)).first->second;
     connectionCount_.store(peers_.size());
@@ -281,9 +282,10 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       log(LogLevel::Error, "No credentials for peer %s%s%s: it holds no entitlements", peer.connection->peerName(),
           error.empty() ? "" : ": ", error);
     else if (options_.entitlementsForPeer)
-      peer.connection->queue()->async([connection = peer.connection, credentials, identify = options_.entitlementsForPeer] {
-        connection->setEntitlementLookup(identify(**credentials));
-      });
+      peer.connection->queue()->async(
+          [connection = peer.connection, credentials, identify = options_.entitlementsForPeer] {
+            connection->setEntitlementLookup(identify(**credentials));
+          });
     peer.identified = true;
     for (auto& [invocation, reply] : peer.backlog) schedule(peer.connection, std::move(invocation), std::move(reply));
     peer.backlog.clear();
@@ -376,7 +378,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       for (const auto& candidate : interface->methods)
         if (candidate.name == member) method = &candidate;
     if (!method) {
-      sendErrorNow(m, BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
+      sendErrorNow(m,
+                   BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
       return 1;
     }
     DecodedCall decoded;
@@ -400,8 +403,10 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     lastActivity_ = now();
     Reply reply(state);
     try {
-      if (peer.identified) schedule(connection, std::move(decoded.invocation), reply);
-      else peer.backlog.emplace_back(std::move(decoded.invocation), reply);
+      if (peer.identified)
+        schedule(connection, std::move(decoded.invocation), reply);
+      else
+        peer.backlog.emplace_back(std::move(decoded.invocation), reply);
     } catch (const std::exception& e) {
       log(LogLevel::Error, "Cannot queue a call to %s: %s", member, e.what());
     }
@@ -462,7 +467,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       sd_event_exit(event_.get(), 0);
       return;
     }
-    addSource(sd_event_add_time_relative, CLOCK_MONOTONIC, toUsec(options_.drainLimit), uint64_t{0}, &Guarded<&Core::onDrainLimit>::call);
+    addSource(sd_event_add_time_relative, CLOCK_MONOTONIC, toUsec(options_.drainLimit), uint64_t{0},
+              &Guarded<&Core::onDrainLimit>::call);
   }
 
   static int onDrainLimit(sd_event_source*, uint64_t, void* userdata) {
@@ -470,7 +476,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     log(LogLevel::Error, "Calls still in flight after the drain limit: failing %zu of them", self->pending_.size());
     for (auto& [id, weak] : self->pending_)
       if (auto state = weak.lock(); state && !state->done.exchange(true)) {
-        self->sendErrorNow(state->call, BusError{kBusErrorNoServer, "The service shut down before the operation finished."});
+        self->sendErrorNow(state->call,
+                           BusError{kBusErrorNoServer, "The service shut down before the operation finished."});
         sd_bus_message_unref(state->call);
         state->call = nullptr;
       }
@@ -481,7 +488,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
 
   void armIdleTimer(uint64_t at) {
     if (!idleTimer_) {
-      if (addSource(sd_event_add_time, CLOCK_MONOTONIC, at, uint64_t{0}, &Guarded<&Core::onIdleTimer>::call) >= 0) idleTimer_ = sources_.back().get();
+      if (addSource(sd_event_add_time, CLOCK_MONOTONIC, at, uint64_t{0}, &Guarded<&Core::onIdleTimer>::call) >= 0)
+        idleTimer_ = sources_.back().get();
       return;
     }
     sd_event_source_set_time(idleTimer_, at);
@@ -536,13 +544,16 @@ Reply::State::~State() {
 void Reply::send(Writer writer) const {
   if (state_->done.exchange(true)) return;
   if (auto core = state_->core.lock())
-    core->post([core, call = state_->call, writer = std::move(writer), id = state_->id] { core->sendReturn(call, writer, id); });
+    core->post([core, call = state_->call, writer = std::move(writer), id = state_->id] {
+      core->sendReturn(call, writer, id);
+    });
 }
 
 void Reply::fail(BusError error) const {
   if (state_->done.exchange(true)) return;
   if (auto core = state_->core.lock())
-    core->post([core, call = state_->call, error = std::move(error), id = state_->id] { core->sendError(call, error, id); });
+    core->post(
+        [core, call = state_->call, error = std::move(error), id = state_->id] { core->sendError(call, error, id); });
 }
 
 void Listener::configure(ListenerOptions options) { configuredOptions() = std::move(options); }

@@ -60,23 +60,32 @@ void appendNumber(std::string& out, const char* directive, const LogArg::Storage
   int n = 0;
   if (conv == 'f' || conv == 'F' || conv == 'e' || conv == 'E' || conv == 'g' || conv == 'G') {
     double d = 0;
-    if (auto p = std::get_if<double>(&arg)) d = *p;
-    else if (auto i = std::get_if<int64_t>(&arg)) d = static_cast<double>(*i);
-    else if (auto u = std::get_if<uint64_t>(&arg)) d = static_cast<double>(*u);
+    if (auto p = std::get_if<double>(&arg))
+      d = *p;
+    else if (auto i = std::get_if<int64_t>(&arg))
+      d = static_cast<double>(*i);
+    else if (auto u = std::get_if<uint64_t>(&arg))
+      d = static_cast<double>(*u);
     n = std::snprintf(buf, sizeof buf, (base + conv).c_str(), d);
   } else if (conv == 'c') {
     int c = '?';
-    if (auto i = std::get_if<int64_t>(&arg)) c = static_cast<int>(*i);
-    else if (auto u = std::get_if<uint64_t>(&arg)) c = static_cast<int>(*u);
+    if (auto i = std::get_if<int64_t>(&arg))
+      c = static_cast<int>(*i);
+    else if (auto u = std::get_if<uint64_t>(&arg))
+      c = static_cast<int>(*u);
     n = std::snprintf(buf, sizeof buf, (base + 'c').c_str(), c);
   } else {
     bool isSigned = conv == 'd' || conv == 'i';
     if (auto i = std::get_if<int64_t>(&arg)) {
-      if (isSigned) n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*i));
-      else n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*i));
+      if (isSigned)
+        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*i));
+      else
+        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*i));
     } else if (auto u = std::get_if<uint64_t>(&arg)) {
-      if (isSigned) n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*u));
-      else n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*u));
+      if (isSigned)
+        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*u));
+      else
+        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*u));
     } else if (auto d = std::get_if<double>(&arg)) {
       n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*d));
     } else if (auto p = std::get_if<LogArg::Pointer>(&arg)) {
@@ -90,9 +99,12 @@ void appendNumber(std::string& out, const char* directive, const LogArg::Storage
 }
 
 void appendObject(std::string& out, const LogArg::Storage& arg) {
-  if (auto s = std::get_if<std::string>(&arg)) out += *s;
-  else if (auto i = std::get_if<int64_t>(&arg)) out += std::to_string(*i);
-  else if (auto u = std::get_if<uint64_t>(&arg)) out += std::to_string(*u);
+  if (auto s = std::get_if<std::string>(&arg))
+    out += *s;
+  else if (auto i = std::get_if<int64_t>(&arg))
+    out += std::to_string(*i);
+  else if (auto u = std::get_if<uint64_t>(&arg))
+    out += std::to_string(*u);
   else if (auto d = std::get_if<double>(&arg)) {
     char buf[32];
     std::snprintf(buf, sizeof buf, "%.17g", *d);
@@ -108,9 +120,12 @@ void appendObject(std::string& out, const LogArg::Storage& arg) {
 
 void appendPointer(std::string& out, const LogArg::Storage& arg) {
   uintptr_t v = 0;
-  if (auto p = std::get_if<LogArg::Pointer>(&arg)) v = p->value;
-  else if (auto u = std::get_if<uint64_t>(&arg)) v = static_cast<uintptr_t>(*u);
-  else if (auto i = std::get_if<int64_t>(&arg)) v = static_cast<uintptr_t>(*i);
+  if (auto p = std::get_if<LogArg::Pointer>(&arg))
+    v = p->value;
+  else if (auto u = std::get_if<uint64_t>(&arg))
+    v = static_cast<uintptr_t>(*u);
+  else if (auto i = std::get_if<int64_t>(&arg))
+    v = static_cast<uintptr_t>(*i);
   if (v == 0) {
     out += "0x0";
     return;
@@ -134,13 +149,15 @@ std::string timestamp() {
 }
 
 void writeStderr(const std::string& identifier, const Log& log, LogLevel level, const std::string& message) {
-  std::string line = timestamp() + " " + identifier + "[" + std::to_string(getpid()) + "] <" +
-                     std::string(logLevelName(level)) + ">";
+  std::string line =
+      timestamp() + " " + identifier + "[" + std::to_string(getpid()) + "] <" + std::string(logLevelName(level)) + ">";
   if (!log.subsystem().empty()) line += " [" + log.subsystem() + ":" + log.category() + "]";
   line += ' ';
   for (char c : message) {
-    if (c == '\n') line += "\\n";
-    else line += c;
+    if (c == '\n')
+      line += "\\n";
+    else
+      line += c;
   }
   line += '\n';
   // One write per entry keeps lines from concurrent threads whole.
@@ -158,11 +175,16 @@ void writeStderr(const std::string& identifier, const Log& log, LogLevel level, 
 
 std::string_view logLevelName(LogLevel level) {
   switch (level) {
-    case LogLevel::Debug: return "debug";
-    case LogLevel::Info: return "info";
-    case LogLevel::Default: return "default";
-    case LogLevel::Error: return "error";
-    case LogLevel::Fault: return "fault";
+    case LogLevel::Debug:
+      return "debug";
+    case LogLevel::Info:
+      return "info";
+    case LogLevel::Default:
+      return "default";
+    case LogLevel::Error:
+      return "error";
+    case LogLevel::Fault:
+      return "fault";
   }
   return "default";
 }
@@ -175,11 +197,16 @@ std::optional<LogLevel> logLevelFromName(std::string_view name) {
 
 int journalPriority(LogLevel level) {
   switch (level) {
-    case LogLevel::Fault: return 2;
-    case LogLevel::Error: return 3;
-    case LogLevel::Default: return 5;
-    case LogLevel::Info: return 6;
-    case LogLevel::Debug: return 7;
+    case LogLevel::Fault:
+      return 2;
+    case LogLevel::Error:
+      return 3;
+    case LogLevel::Default:
+      return 5;
+    case LogLevel::Info:
+      return 6;
+    case LogLevel::Debug:
+      return 7;
   }
   return 5;
 }
@@ -188,8 +215,7 @@ void configureLog(const LogSettings& settings) {
   LogState& s = state();
   std::lock_guard lock(s.mutex);
   s.settings = settings;
-  s.useJournal = settings.backend == LogBackend::Journal ||
-                 (settings.backend == LogBackend::Auto && stderrIsJournal());
+  s.useJournal = settings.backend == LogBackend::Journal || (settings.backend == LogBackend::Auto && stderrIsJournal());
   gMinimum.store(static_cast<int>(settings.minimum), std::memory_order_relaxed);
   gPrivateData.store(settings.privateData, std::memory_order_relaxed);
 }
@@ -217,9 +243,7 @@ std::shared_ptr<const Log> Log::create(std::string subsystem, std::string catego
   return std::shared_ptr<const Log>(new Log(std::move(subsystem), std::move(category)));
 }
 
-bool Log::enabled(LogLevel level) {
-  return static_cast<int>(level) >= gMinimum.load(std::memory_order_relaxed);
-}
+bool Log::enabled(LogLevel level) { return static_cast<int>(level) >= gMinimum.load(std::memory_order_relaxed); }
 
 std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate) {
   std::string out;
@@ -253,8 +277,10 @@ std::string formatLogMessage(std::string_view format, std::span<const LogArg> ar
     }
     // flags, width, precision, length modifiers
     std::string directive = "%";
-    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos) directive += format[i++];
-    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos) directive += format[i++];
+    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos)
+      directive += format[i++];
+    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos)
+      directive += format[i++];
     if (i >= format.size()) {
       out.append(format.substr(start));
       break;
@@ -276,9 +302,15 @@ std::string formatLogMessage(std::string_view format, std::span<const LogArg> ar
     directive += conv;
     switch (conv) {
       case '@':
-      case 's': appendObject(out, arg); break;
-      case 'p': appendPointer(out, arg); break;
-      default: appendNumber(out, directive.c_str(), arg); break;
+      case 's':
+        appendObject(out, arg);
+        break;
+      case 'p':
+        appendPointer(out, arg);
+        break;
+      default:
+        appendNumber(out, directive.c_str(), arg);
+        break;
     }
   }
   return out;
@@ -304,12 +336,12 @@ void writeLog(const Log& log, LogLevel level, std::string_view format, std::span
   if (journal) {
     int rc;
     if (log.subsystem().empty()) {
-      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level),
-                           "SYSLOG_IDENTIFIER=%s", identifier.c_str(), nullptr);
+      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level), "SYSLOG_IDENTIFIER=%s",
+                           identifier.c_str(), nullptr);
     } else {
-      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level),
-                           "SYSLOG_IDENTIFIER=%s", identifier.c_str(), "ZLKA_SUBSYSTEM=%s",
-                           log.subsystem().c_str(), "ZLKA_CATEGORY=%s", log.category().c_str(), nullptr);
+      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level), "SYSLOG_IDENTIFIER=%s",
+                           identifier.c_str(), "ZLKA_SUBSYSTEM=%s", log.subsystem().c_str(), "ZLKA_CATEGORY=%s",
+                           log.category().c_str(), nullptr);
     }
     if (rc >= 0) return;
   }

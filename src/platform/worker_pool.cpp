@@ -1,7 +1,7 @@
 #include "platform/worker_pool.h"
 
-#include <cstdio>
 #include <algorithm>
+#include <cstdio>
 #include <cstdlib>
 #include <system_error>
 #include <thread>
@@ -32,8 +32,10 @@ WorkerPool::~WorkerPool() {
 void WorkerPool::post(std::function<void()> job) {
   std::lock_guard lock(mutex_);
   jobs_.push_back(std::move(job));
-  if (idle_ > 0) available_.notify_one();
-  else growIfNeeded();
+  if (idle_ > 0)
+    available_.notify_one();
+  else
+    growIfNeeded();
 }
 
 void WorkerPool::setMaximum(unsigned maximum) {

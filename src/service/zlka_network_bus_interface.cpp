@@ -38,8 +38,10 @@ std::optional<BusError> readArguments(sd_bus_message* m, bool withLocale, TokenA
     Value value;
     int r = platform::readBusValue(message, value);
     if (r < 0) return r;
-    if (key == "token") args.token = *value.data();
-    else args.requestInfo = *value.dictionary();
+    if (key == "token")
+      args.token = *value.data();
+    else
+      args.requestInfo = *value.dictionary();
     return r;
   });
 }
@@ -51,49 +53,52 @@ std::shared_ptr<ZLKANetworkProtocol> exported(const std::shared_ptr<void>& objec
 DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
   if (auto error = readArguments(m, true, args)) return {nullptr, error};
-  return {[object, args](Reply reply) {
-            std::optional<platform::Locale> locale;
-            if (args.requestedLocale) locale = platform::Locale(*args.requestedLocale);
-            exported(object)->requestMetadataForToken(
-                args.token, args.uuid, locale, args.requestInfo,
-                [reply](std::optional<std::string> ppid, std::optional<platform::Locale> answered,
-                        std::optional<platform::Dictionary> metadata, std::optional<platform::Error> error) {
-                  if (error || !ppid || !answered || !metadata)
-                    return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
-                  std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
-                  reply.send([ppid = *ppid, locale = answered->localeIdentifier(), json](sd_bus_message* r) {
-                    return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
-                  });
-                });
-          },
-          std::nullopt};
+  return {
+      [object, args](Reply reply) {
+        std::optional<platform::Locale> locale;
+        if (args.requestedLocale) locale = platform::Locale(*args.requestedLocale);
+        exported(object)->requestMetadataForToken(
+            args.token, args.uuid, locale, args.requestInfo,
+            [reply](std::optional<std::string> ppid, std::optional<platform::Locale> answered,
+                    std::optional<platform::Dictionary> metadata, std::optional<platform::Error> error) {
+              if (error || !ppid || !answered || !metadata)
+                return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+              std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
+              reply.send([ppid = *ppid, locale = answered->localeIdentifier(), json](sd_bus_message* r) {
+                return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
+              });
+            });
+      },
+      std::nullopt};
 }
 
 DecodedCall decodeActivation(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
   if (auto error = readArguments(m, false, args)) return {nullptr, error};
-  return {[object, args](Reply reply) {
-            exported(object)->requestActivationForToken(
-                args.token, args.uuid, [reply](std::optional<Data> newToken, std::optional<platform::Error> error) {
-                  if (error || !newToken)
-                    return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
-                  reply.send([token = *newToken](sd_bus_message* r) {
-                    return sd_bus_message_append_array(r, 'y', token.bytes() ? token.bytes() : reinterpret_cast<const uint8_t*>(""),
-                                                       token.length());
-                  });
-                });
-          },
-          std::nullopt};
+  return {
+      [object, args](Reply reply) {
+        exported(object)->requestActivationForToken(
+            args.token, args.uuid, [reply](std::optional<Data> newToken, std::optional<platform::Error> error) {
+              if (error || !newToken)
+                return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+              reply.send([token = *newToken](sd_bus_message* r) {
+                return sd_bus_message_append_array(
+                    r, 'y', token.bytes() ? token.bytes() : reinterpret_cast<const uint8_t*>(""), token.length());
+              });
+            });
+      },
+      std::nullopt};
 }
 
 DecodedCall decodeConfirmation(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
   if (auto error = readArguments(m, false, args)) return {nullptr, error};
   return {[object, args](Reply reply) {
-            exported(object)->confirmActivationForToken(args.token, args.uuid, [reply](std::optional<platform::Error> error) {
-              if (error) return reply.fail(busErrorForError(*error));
-              reply.send(nullptr);
-            });
+            exported(object)->confirmActivationForToken(args.token, args.uuid,
+                                                        [reply](std::optional<platform::Error> error) {
+                                                          if (error) return reply.fail(busErrorForError(*error));
+                                                          reply.send(nullptr);
+                                                        });
           },
           std::nullopt};
 }
@@ -101,7 +106,8 @@ DecodedCall decodeConfirmation(sd_bus_message* m, const std::shared_ptr<void>& o
 }  // namespace
 
 std::shared_ptr<const platform::Interface> ZLKANetworkProtocolInterface() {
-  static const std::shared_ptr<const platform::Interface> interface = std::make_shared<const platform::Interface>(platform::Interface{
+  static const std::shared_ptr<const platform::Interface> interface = std::make_shared<
+      const platform::Interface>(platform::Interface{
       kZLKAInterfaceName,
       {
           {"RequestMetadataForToken", "a{sv}", "sss", {"arguments"}, {"ppid", "locale", "metadata"}, decodeMetadata},
@@ -112,7 +118,8 @@ std::shared_ptr<const platform::Interface> ZLKANetworkProtocolInterface() {
 }
 
 BusError busErrorForError(const platform::Error& error) {
-  static const char* const names[] = {"Unknown", "MissingEntitlement", "InvalidParameter", "Internal", "Network", "Server"};
+  static const char* const names[] = {"Unknown", "MissingEntitlement", "InvalidParameter", "Internal", "Network",
+                                      "Server"};
   int64_t code = error.code();
   std::string name = (code <= -1 && code >= -6) ? names[-code - 1] : "Unknown";
   return BusError{kZLKAErrorPrefix + name, error.localizedDescription()};

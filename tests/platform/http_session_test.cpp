@@ -12,7 +12,8 @@ namespace {
 
 using platform::HTTPSession;
 
-[[maybe_unused]] ::testing::Environment* const kWorld = ::testing::AddGlobalTestEnvironment(new zlkatest::ServerWorld(true));
+[[maybe_unused]] ::testing::Environment* const kWorld =
+    ::testing::AddGlobalTestEnvironment(new zlkatest::ServerWorld(true));
 const zlkatest::ServerWorld& world() { return zlkatest::ServerWorld::get(); }
 
 struct Outcome {
@@ -23,7 +24,8 @@ struct Outcome {
 };
 
 // A GET of `url` on `s`, suspended; its one completion fulfils `done`.
-std::shared_ptr<platform::HTTPTask> task(const std::shared_ptr<HTTPSession>& s, std::promise<Outcome>& done, const std::string& url) {
+std::shared_ptr<platform::HTTPTask> task(const std::shared_ptr<HTTPSession>& s, std::promise<Outcome>& done,
+                                         const std::string& url) {
   return s->dataTaskWithRequest(platform::HTTPRequest(url, 0, 60.0), [&done, s](auto body, auto response, auto error) {
     done.set_value({std::move(body), std::move(response), std::move(error), s->callbackQueue()->isCurrent()});
   });
@@ -87,7 +89,8 @@ TEST_F(HTTPSessionTest, EachTransportFailureHasItsCodeAndNoResponse) {
       continue;
     }
     ASSERT_TRUE(o.error);
-    EXPECT_EQ(std::tuple(o.error->domain(), o.error->code()), std::tuple(platform::HTTPErrorDomain, r.code)) << o.error->description();
+    EXPECT_EQ(std::tuple(o.error->domain(), o.error->code()), std::tuple(platform::HTTPErrorDomain, r.code))
+        << o.error->description();
     EXPECT_EQ(*o.error->userInfo()->at("FailingURL").string(), r.url);
     EXPECT_FALSE(o.response || o.body);
   }

@@ -19,9 +19,10 @@ constexpr char kPath[] = "/com/example/ListenerTest";
 
 // Ping() answers at once; who asked and when is all these tests look at.
 std::shared_ptr<const platform::Interface> pingInterface() {
-  platform::InterfaceMethod ping{"Ping", "", "", {}, {}, [](sd_bus_message*, const std::shared_ptr<void>&) {
-                                   return platform::DecodedCall{[](platform::Reply reply) { reply.send(nullptr); }, std::nullopt};
-                                 }};
+  platform::InterfaceMethod ping{
+      "Ping", "", "", {}, {}, [](sd_bus_message*, const std::shared_ptr<void>&) {
+        return platform::DecodedCall{[](platform::Reply reply) { reply.send(nullptr); }, std::nullopt};
+      }};
   return std::make_shared<platform::Interface>(platform::Interface{kName, {ping}});
 }
 
@@ -43,7 +44,9 @@ platform::BusPtr connect(const std::string& address) {
   return sd_bus_start(bus) >= 0 ? std::move(owned) : nullptr;
 }
 
-bool ping(const platform::BusPtr& bus) { return sd_bus_call_method(bus.get(), kName, kPath, kName, "Ping", nullptr, nullptr, "") >= 0; }
+bool ping(const platform::BusPtr& bus) {
+  return sd_bus_call_method(bus.get(), kName, kPath, kName, "Ping", nullptr, nullptr, "") >= 0;
+}
 
 // The service listener running on a thread of its own until the scope ends.
 struct RunningListener {
@@ -55,7 +58,8 @@ struct RunningListener {
     ended = true;
   }};
   ~RunningListener() {
-    for (int i = 0; i < 3000 && !ended; ++i, std::this_thread::sleep_for(10ms)) listener.stop();  // reaches it once started
+    for (int i = 0; i < 3000 && !ended; ++i, std::this_thread::sleep_for(10ms))
+      listener.stop();  // reaches it once started
   }
 };
 
@@ -68,21 +72,29 @@ TEST(Listener, APeerWhoseIdentityIsSlowHoldsUpNoOtherPeerAndEachPeerIsIdentified
   platform::Semaphore release;  // bounded, so that a failing test still ends
   std::atomic<int> lookups{0};
   std::atomic<pid_t> firstPid{0};
-  platform::Listener::configure({.bus = bus.address(), .serviceName = kName, .objectPath = kPath, .interface = pingInterface(),
-      .entitlementsForPeer = [&](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
-        if (lookups.fetch_add(1) == 0) {  // the first peer's lookup is held back until the test lets it go
-          firstPid = credentials.pid;
-          release.waitFor(30s);
-        }
-        return nullptr;
-      },
-      .onReload = {}, .exitOnIdle = {}, .notifyReady = false});
+  platform::Listener::configure(
+      {.bus = bus.address(),
+       .serviceName = kName,
+       .objectPath = kPath,
+       .interface = pingInterface(),
+       .entitlementsForPeer = [&](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
+         if (lookups.fetch_add(1) == 0) {  // the first peer's lookup is held back until the test lets it go
+           firstPid = credentials.pid;
+           release.waitFor(30s);
+         }
+         return nullptr;
+       },
+       .onReload = {},
+       .exitOnIdle = {},
+       .notifyReady = false});
   platform::Listener::serviceListener().setDelegate(std::make_shared<Accepting>());
   std::optional<RunningListener> running(std::in_place);
   platform::BusPtr slow = connect(bus.address()), quick = connect(bus.address());
   ASSERT_TRUE(slow && quick);
-  for (int i = 0; i < 500 && sd_bus_call_method(quick.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
-                                                "GetNameOwner", nullptr, nullptr, "s", kName) < 0; ++i)
+  for (int i = 0;
+       i < 500 && sd_bus_call_method(quick.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                                     "org.freedesktop.DBus", "GetNameOwner", nullptr, nullptr, "s", kName) < 0;
+       ++i)
     std::this_thread::sleep_for(10ms);
   std::atomic<bool> slowAnswered{false}, slowOk{false};
   std::jthread slowCaller([&] { slowOk = ping(slow), slowAnswered = true; });
@@ -98,7 +110,8 @@ TEST(Listener, APeerWhoseIdentityIsSlowHoldsUpNoOtherPeerAndEachPeerIsIdentified
   EXPECT_TRUE(slowOk.load());  // the backlog waited for the identity
   EXPECT_EQ(lookups.load(), 2);
   quick.reset();  // a peer that leaves the bus is forgotten
-  for (int i = 0; i < 500 && platform::Listener::serviceListener().connectionCount() != 1; ++i) std::this_thread::sleep_for(10ms);
+  for (int i = 0; i < 500 && platform::Listener::serviceListener().connectionCount() != 1; ++i)
+    std::this_thread::sleep_for(10ms);
   EXPECT_EQ(platform::Listener::serviceListener().connectionCount(), 1u);
   running.reset();
   platform::Listener::serviceListener().setDelegate(nullptr);
