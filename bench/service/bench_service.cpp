@@ -181,8 +181,9 @@ void BM_Operation(benchmark::State& state, Operation op) {
 
 // Operations per second with `clients` callers each on a connection of its own, calling in a loop
 // for a fixed time; the floor does the same with a Ping and a bare signed POST per operation.
+// Failed calls are counted in `failures` (none given: the first one ends the run with -1).
 template <class Worker>
-double rate(int clients, std::chrono::milliseconds duration, Worker makeWorker) {
+double rate(int clients, std::chrono::milliseconds duration, Worker makeWorker, std::atomic<long>* failures = nullptr) {
   using Step = decltype(makeWorker());
   std::vector<Step> steps;
   for (int i = 0; i < clients; ++i) steps.push_back(makeWorker());
@@ -196,6 +197,8 @@ double rate(int clients, std::chrono::milliseconds duration, Worker makeWorker) 
         while (Clock::now() < stop && !failed)
           if (step())
             ++done;
+          else if (failures)
+            ++*failures;
           else
             failed = true;
       });
@@ -236,15 +239,23 @@ void BM_Throughput(benchmark::State& state) {
       std::this_thread::sleep_for(std::chrono::milliseconds(20));
     }
   });
+  std::atomic<long> failures{0};
+  auto connections = [] { return stack().harness.server().statistics()["connections"].get<double>(); };
+  const double connectionsBefore = connections();
   for (auto _ : state)
-    perSecond = rate(clients, std::chrono::milliseconds(1500), [&] {
-      auto client = std::shared_ptr<zlka_client::ZLKAClient>(
-          zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()}).value().release());
-      return [client] { return call(*client, Operation::confirmation); };
-    });
+    perSecond = rate(
+        clients, std::chrono::milliseconds(1500),
+        [&] {
+          auto client = std::shared_ptr<zlka_client::ZLKAClient>(
+              zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()}).value().release());
+          return [client] { return call(*client, Operation::confirmation); };
+        },
+        &failures);
   measuring = false;
-  if (perSecond < 0) return state.SkipWithError("an operation failed");
   state.counters["ops_per_second"] = perSecond;
+  state.counters["failed_calls"] = double(failures.load());
+  // The TLS connections the server accepted during the run: once warm, the daemon reuses them.
+  state.counters["new_connections"] = connections() - connectionsBefore;
   if (gFloorRate.count(clients)) state.counters["over_floor"] = perSecond / gFloorRate[clients];
   state.counters["daemon_threads_peak"] = double(peakThreads.load());
   if (clients == 64) state.counters["unique_KiB_after_64"] = daemonUniqueKiB();
@@ -281,6 +292,66 @@ void BM_Resources(benchmark::State& state) {
   }
 }
 
+// A greedy peer sends thousands of calls and reads none of the answers while another caller calls
+// one at a time: that caller's latency beside its own unloaded p50, the daemon's unique memory at
+// the peak and once the greedy calls are done, and an oversize token refused without growth.
+void BM_GreedyPeer(benchmark::State& state) {
+  if (!stack().ready) return state.SkipWithError("the daemon did not start");
+  const int greedyCalls = static_cast<int>(state.range(0));
+  auto other = zlka_client::ZLKAClient::connect({.bus = stack().harness.busAddress()});
+  platform::BusPtr greedy = connectRaw();
+  if (!other.ok() || !greedy) return state.SkipWithError("no bus");
+  std::vector<double> alone, loaded;
+  auto timedCall = [&](std::vector<double>& into) {
+    auto start = Clock::now();
+    bool ok = call(*other.value(), Operation::confirmation);
+    into.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+    return ok;
+  };
+  for (int i = 0; i < 50; ++i) timedCall(alone);
+  const double before = daemonUniqueKiB();
+  double peak = before;
+  for (auto _ : state) {
+    for (int i = 0; i < greedyCalls; ++i)
+      sd_bus_call_method_async(greedy.get(), nullptr, kName, kPath, kInterface, "ConfirmActivationForToken", nullptr,
+                               nullptr, "a{sv}", 2, "token", "ay", 2, 0x30, 0x00, "uuid", "s", kUUID);
+    sd_bus_flush(greedy.get());
+    for (int i = 0; i < 50; ++i) {
+      if (!timedCall(loaded)) return state.SkipWithError("the other caller's call failed");
+      peak = std::max(peak, daemonUniqueKiB());
+    }
+  }
+  greedy.reset();  // the greedy peer leaves; its waiting calls end with it
+  std::this_thread::sleep_for(std::chrono::seconds(6));
+  state.counters["other_p50_alone_us"] = percentiles(alone).p50;
+  state.counters["other_p50_loaded_us"] = percentiles(loaded).p50;
+  state.counters["other_p99_loaded_us"] = percentiles(loaded).p99;
+  state.counters["other_p99_over_alone_p50"] = percentiles(loaded).p99 / percentiles(alone).p50;
+  state.counters["unique_KiB_before"] = before;
+  state.counters["unique_KiB_peak"] = peak;
+  state.counters["unique_KiB_after"] = daemonUniqueKiB();
+  // 16 MiB of token: refused with InvalidArgs before any work on it.
+  platform::BusPtr big = connectRaw();
+  std::vector<uint8_t> token(16u << 20, 0);
+  sd_bus_message* m = nullptr;
+  sd_bus_message_new_method_call(big.get(), &m, kName, kPath, kInterface, "ConfirmActivationForToken");
+  platform::BusMessagePtr message(m);
+  sd_bus_message_open_container(m, 'a', "{sv}");
+  sd_bus_message_open_container(m, 'e', "sv");
+  sd_bus_message_append(m, "s", "token");
+  sd_bus_message_open_container(m, 'v', "ay");
+  sd_bus_message_append_array(m, 'y', token.data(), token.size());
+  sd_bus_message_close_container(m);
+  sd_bus_message_close_container(m);
+  sd_bus_message_close_container(m);
+  sd_bus_error error{};
+  const double beforeBig = daemonUniqueKiB();
+  sd_bus_call(big.get(), m, 30'000'000, &error, nullptr);
+  state.counters["oversize_refused"] = sd_bus_error_has_name(&error, "org.freedesktop.DBus.Error.InvalidArgs");
+  state.counters["oversize_growth_KiB"] = daemonUniqueKiB() - beforeBig;
+  sd_bus_error_free(&error);
+}
+
 BENCHMARK(BM_Idle)->Arg(1000)->UseRealTime()->Iterations(1);
 BENCHMARK(BM_FloorDBusPing)->UseRealTime();
 BENCHMARK_CAPTURE(BM_FloorHTTPS, metadata, Operation::metadata)->UseRealTime();
@@ -293,6 +364,7 @@ BENCHMARK(BM_ThroughputFloor)->Arg(1)->Arg(8)->Arg(64)->Arg(256)->UseRealTime()-
 BENCHMARK(BM_Throughput)->Arg(1)->Arg(8)->Arg(64)->Arg(256)->UseRealTime()->Iterations(1);
 BENCHMARK(BM_Idle)->Arg(6000)->UseRealTime()->Iterations(1);
 BENCHMARK(BM_Resources)->UseRealTime()->Iterations(1);
+BENCHMARK(BM_GreedyPeer)->Arg(5000)->UseRealTime()->Iterations(1);
 
 }  // namespace
 

@@ -82,43 +82,6 @@ int appendBasicVariant(sd_bus_message* m, char type, const T& v) {
 
 }  // namespace
 
-bool isBusString(std::string_view text) {
-  size_t i = 0;
-  while (i < text.size()) {
-    auto byte = [&](size_t k) { return static_cast<unsigned char>(text[k]); };
-    unsigned char c = byte(i);
-    if (c == 0) return false;
-    if (c < 0x80) {
-      ++i;
-      continue;
-    }
-    size_t length = 0;
-    uint32_t cp = 0;
-    if (c >= 0xC2 && c <= 0xDF) {
-      length = 2;
-      cp = c & 0x1F;
-    } else if (c >= 0xE0 && c <= 0xEF) {
-      length = 3;
-      cp = c & 0x0F;
-    } else if (c >= 0xF0 && c <= 0xF4) {
-      length = 4;
-      cp = c & 0x07;
-    } else {
-      return false;
-    }
-    if (i + length > text.size()) return false;
-    for (size_t k = 1; k < length; ++k) {
-      if ((byte(i + k) & 0xC0) != 0x80) return false;
-      cp = (cp << 6) | (byte(i + k) & 0x3F);
-    }
-    // Overlong forms, UTF-16 surrogates and code points beyond U+10FFFF.
-    if ((length == 3 && cp < 0x800) || (length == 4 && (cp < 0x10000 || cp > 0x10FFFF)) || (cp >= 0xD800 && cp <= 0xDFFF))
-      return false;
-    i += length;
-  }
-  return true;
-}
-
 std::optional<std::string> unsendableReason(const platform::Value& value, const std::string& path) {
   return checkValue(value, path, 1);
 }

@@ -15,6 +15,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/bus_values.h"
 #include "platform/data.h"
 #include "platform/value.h"
 
@@ -43,8 +44,7 @@ std::optional<std::string> unsendableReason(const platform::Value& value, const 
 std::optional<std::string> unsendableReason(const TokenArguments& arguments);
 std::optional<std::string> unsendableReason(const MetadataArguments& arguments);
 
-// True when `text` is well-formed UTF-8 with no NUL, as a D-Bus string must be.
-bool isBusString(std::string_view text);
+using platform::isBusString;
 
 // Write the a{sv} argument of a call. Negative errno on failure (check unsendableReason first).
 int appendArguments(sd_bus_message* message, const TokenArguments& arguments);

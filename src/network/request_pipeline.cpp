@@ -47,11 +47,14 @@ Error failure(int64_t code) {
 
 std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token, const RequestPlan& plan,
                                          ResponseHandler handler) {
+  // The connection is claimed first: a wait for one after signing could push the signed request
+  // out of the server's replay window, and a call waiting here holds none of its request's memory.
+  std::shared_ptr<platform::ConnectionClaim> claim = network.urlSession()->claimConnection();
   std::optional<std::vector<Data>> tokenArray = parseTokenArray(token);
   platform::log(LogLevel::Info, "[#TokenAuth] tokenArray.count: %lu", tokenArray ? tokenArray->size() : 0);
-  if (platform::Log::enabled(LogLevel::Debug) && tokenArray)
+  if (platform::Log::enabled(LogLevel::Debug))
     platform::log(LogLevel::Debug, "[#TokenAuth] tokenArray: %{private}@",
-                  Value(platform::Array(tokenArray->begin(), tokenArray->end())));
+                  tokenArray ? Value(platform::Array(tokenArray->begin(), tokenArray->end())) : Value());
   if (!tokenArray) return ZLKAErrorInvalidParameter;
   platform::Array encoded;
   for (std::string& s : base64EncodeArray(tokenArray)) encoded.emplace_back(std::move(s));
@@ -100,7 +103,9 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
   platform::log(LogLevel::Debug, "[#TokenAuth] requestData.length: %lu", body.length());
   platform::log(LogLevel::Debug, "[#TokenAuth] requestData (string): %{private}@", *text);
 
-  network.urlSession()->uploadTaskWithRequest(std::move(request), std::move(body), std::move(handler))->resume();
+  network.urlSession()
+      ->uploadTaskWithRequest(std::move(request), std::move(body), std::move(handler), std::move(claim))
+      ->resume();
   return std::nullopt;
 }
 

@@ -45,18 +45,19 @@ ZLKANetwork::~ZLKANetwork() {
   if (urlSession_) urlSession_->invalidateAndCancel();
 }
 
-// The switches read the suite at every call; the stored fields are deliberately ignored.
+// The switches read the suite at every call (a production device never does); the stored fields
+// are deliberately ignored.
 bool ZLKANetwork::forceNetworkFailure() {
-  return userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceNetworkFailure) && isInternalBuild();
+  return isInternalBuild() && userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceNetworkFailure);
 }
 bool ZLKANetwork::forceTokenActivationFailure() {
-  return userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceTokenActivationFailure) && isInternalBuild();
+  return isInternalBuild() && userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceTokenActivationFailure);
 }
 bool ZLKANetwork::forceTokenConfirmationFailure() {
-  return userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceTokenConfirmationFailure) && isInternalBuild();
+  return isInternalBuild() && userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceTokenConfirmationFailure);
 }
 bool ZLKANetwork::forceTarvexSAPFailure() {
-  return userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceTarvexSAPFailure) && isInternalBuild();
+  return isInternalBuild() && userDefaults()->boolForKey(ZLKAUserDefaultsKey_ForceTarvexSAPFailure);
 }
 
 void ZLKANetwork::setForceNetworkFailure(bool value) {

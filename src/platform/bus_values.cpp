@@ -1,6 +1,7 @@
 #include "platform/bus_values.h"
 
 #include <cerrno>
+#include <cstring>
 #include <set>
 
 namespace platform {
@@ -124,11 +125,26 @@ int readValue(sd_bus_message* m, Value& out, int depth) {
   }
 }
 
+// Whether the value at the start of the current variant is longer than `maximum` bytes; the
+// variant is read from its start again afterwards. An unreadable value is left to the reader.
+bool isLongerThan(sd_bus_message* m, const std::string& signature, size_t maximum) {
+  size_t length = 0;
+  if (signature == "ay") {
+    const void* bytes = nullptr;
+    if (sd_bus_message_read_array(m, 'y', &bytes, &length) < 0) length = 0;
+  } else if (signature == "s") {
+    const char* text = nullptr;
+    if (sd_bus_message_read_basic(m, 's', &text) > 0 && text) length = std::strlen(text);
+  }
+  sd_bus_message_rewind(m, 0);
+  return length > maximum;
+}
+
 }  // namespace
 
 int readBusValue(sd_bus_message* message, Value& out) { return readValue(message, out, 0); }
 
-std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<std::string, std::string>& signatures,
+std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<std::string, BusKey>& keys,
                                             const BusDictionaryReader& take) {
   auto malformed = [] {
     return BusError{kBusErrorInvalidArgs, "The argument must be a dictionary of string keys to variants (a{sv})."};
@@ -140,20 +156,63 @@ std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<st
     const char* rawKey = nullptr;
     if (sd_bus_message_read_basic(m, 's', &rawKey) <= 0) return malformed();
     std::string key = rawKey ? rawKey : "";
-    auto expected = signatures.find(key);
-    if (expected == signatures.end()) return BusError{kBusErrorInvalidArgs, "Unknown key '" + key + "'."};
+    auto expected = keys.find(key);
+    if (expected == keys.end()) return BusError{kBusErrorInvalidArgs, "Unknown key '" + key + "'."};
     if (!seen.insert(key).second) return BusError{kBusErrorInvalidArgs, "Key '" + key + "' is given twice."};
+    const BusKey& spec = expected->second;
     char type = 0;
     const char* contents = nullptr;
-    if (sd_bus_message_peek_type(m, &type, &contents) <= 0 || type != 'v' || !contents || expected->second != contents)
-      return BusError{kBusErrorInvalidArgs, "Key '" + key + "' must hold a value of type " + expected->second + "."};
-    if (sd_bus_message_enter_container(m, 'v', contents) <= 0 || take(key, m) < 0 ||
-        sd_bus_message_exit_container(m) < 0)
+    if (sd_bus_message_peek_type(m, &type, &contents) <= 0 || type != 'v' || !contents || spec.signature != contents)
+      return BusError{kBusErrorInvalidArgs, "Key '" + key + "' must hold a value of type " + spec.signature + "."};
+    if (sd_bus_message_enter_container(m, 'v', contents) <= 0)
+      return BusError{kBusErrorInvalidArgs, "The value of key '" + key + "' could not be read."};
+    if (spec.maximumLength && isLongerThan(m, spec.signature, spec.maximumLength))
+      return BusError{kBusErrorInvalidArgs,
+                      "Key '" + key + "' must hold at most " + std::to_string(spec.maximumLength) + " bytes."};
+    if (take(key, m) < 0 || sd_bus_message_exit_container(m) < 0)
       return BusError{kBusErrorInvalidArgs, "The value of key '" + key + "' could not be read."};
     if (sd_bus_message_exit_container(m) < 0) return malformed();
   }
   if (r < 0 || sd_bus_message_exit_container(m) < 0) return malformed();
   return std::nullopt;
+}
+
+bool isBusString(std::string_view text) {
+  size_t i = 0;
+  while (i < text.size()) {
+    auto byte = [&](size_t k) { return static_cast<unsigned char>(text[k]); };
+    unsigned char c = byte(i);
+    if (c == 0) return false;
+    if (c < 0x80) {
+      ++i;
+      continue;
+    }
+    size_t length = 0;
+    uint32_t cp = 0;
+    if (c >= 0xC2 && c <= 0xDF) {
+      length = 2;
+      cp = c & 0x1F;
+    } else if (c >= 0xE0 && c <= 0xEF) {
+      length = 3;
+      cp = c & 0x0F;
+    } else if (c >= 0xF0 && c <= 0xF4) {
+      length = 4;
+      cp = c & 0x07;
+    } else {
+      return false;
+    }
+    if (i + length > text.size()) return false;
+    for (size_t k = 1; k < length; ++k) {
+      if ((byte(i + k) & 0xC0) != 0x80) return false;
+      cp = (cp << 6) | (byte(i + k) & 0x3F);
+    }
+    // Overlong forms, UTF-16 surrogates and code points beyond U+10FFFF.
+    if ((length == 3 && cp < 0x800) || (length == 4 && (cp < 0x10000 || cp > 0x10FFFF)) ||
+        (cp >= 0xD800 && cp <= 0xDFFF))
+      return false;
+    i += length;
+  }
+  return true;
 }
 
 }  // namespace platform

@@ -13,12 +13,14 @@
 #include <vector>
 
 #include "platform/configuration.h"
+#include "platform/semaphore.h"
 
 namespace platform {
 
 namespace {
 
 std::atomic<int64_t> gMaximumTimeoutMs{0};  // 0: no cap
+constexpr long kMaximumIdleSeconds = 4;
 
 void globalInit() {
   static std::once_flag once;
@@ -81,10 +83,22 @@ Error cancelledError(const std::string& url) {
 
 }  // namespace
 
+class ConnectionClaim {
+ public:
+  explicit ConnectionClaim(std::shared_ptr<Semaphore> claims) : claims_(std::move(claims)) {}
+  ConnectionClaim(const ConnectionClaim&) = delete;
+  ConnectionClaim& operator=(const ConnectionClaim&) = delete;
+  ~ConnectionClaim() { claims_->signal(); }
+
+ private:
+  std::shared_ptr<Semaphore> claims_;
+};
+
 struct HTTPTaskState {
   HTTPRequest request;
   std::optional<Data> body;
   HTTPCompletion completion;
+  std::shared_ptr<ConnectionClaim> claim;  // given back when the task completes
   std::weak_ptr<HTTPSession::Engine> engine;
   std::atomic<bool> started{false};
   std::atomic<bool> finished{false};
@@ -93,6 +107,7 @@ struct HTTPTaskState {
   CURL* easy = nullptr;
   curl_slist* headers = nullptr;
   size_t uploaded = 0;  // body bytes handed to libcurl so far
+  bool resent = false;  // the request went out a second time, on a fresh connection
   std::vector<uint8_t> received;
   HTTPHeaderFields responseHeaders;
   char errorBuffer[CURL_ERROR_SIZE] = {};
@@ -103,9 +118,20 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
  public:
   explicit Engine(HTTPSessionConfiguration configuration)
       : configuration_(std::move(configuration)),
-        callbackQueue_(Queue::serial(configuration_.label + ".callbackQueue")) {
+        callbackQueue_(Queue::serial(configuration_.label + ".callbackQueue")),
+        claims_(std::make_shared<Semaphore>(configuration_.maximumConnectionsPerHost)) {
     globalInit();
     multi_ = curl_multi_init();
+    // The idle cache keeps every connection the bound allows, for each of the two servers (API and
+    // static content) a session talks to: a smaller cache closes connections that the next
+    // request would have reused.
+    curl_multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, configuration_.maximumConnectionsPerHost);
+    curl_multi_setopt(multi_, CURLMOPT_MAXCONNECTS, 2 * configuration_.maximumConnectionsPerHost);
+  }
+
+  std::shared_ptr<ConnectionClaim> claimConnection() {
+    claims_->wait();
+    return std::make_shared<ConnectionClaim>(claims_);
   }
 
   ~Engine() {
@@ -174,6 +200,7 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
   void complete(const std::shared_ptr<HTTPTaskState>& task, std::optional<Data> body,
                 std::optional<HTTPResponse> response, std::optional<Error> error) {
     if (task->finished.exchange(true)) return;
+    task->claim.reset();
     HTTPCompletion completion = std::move(task->completion);
     if (!completion) return;
     callbackQueue_->async([completion = std::move(completion), body = std::move(body), response = std::move(response),
@@ -197,6 +224,38 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     return n;
   }
 
+  // libcurl rewinds a body only to send the request again on a fresh connection, when the reused one
+  // it went out on turned out dead before any byte of an answer arrived; once at most, counting
+  // the sends that `shouldResend` makes.
+  static int onSeek(void* user, curl_off_t offset, int origin) {
+    auto* task = static_cast<HTTPTaskState*>(user);
+    if (offset != 0 || origin != SEEK_SET || task->resent) return CURL_SEEKFUNC_CANTSEEK;
+    task->resent = true;
+    task->uploaded = 0;
+    return CURL_SEEKFUNC_OK;
+  }
+
+  // A reused connection that the server had closed fails the send itself, or ends before any
+  // answer: the server never saw the request, which may go out once more on a fresh connection.
+  static bool shouldResend(HTTPTaskState& t, CURLcode result) {
+    if (t.resent || (result != CURLE_SEND_ERROR && result != CURLE_RECV_ERROR && result != CURLE_GOT_NOTHING))
+      return false;
+    long connects = -1, headerBytes = -1;
+    curl_easy_getinfo(t.easy, CURLINFO_NUM_CONNECTS, &connects);
+    curl_easy_getinfo(t.easy, CURLINFO_HEADER_SIZE, &headerBytes);
+    return connects == 0 && headerBytes == 0 && t.received.empty();
+  }
+
+  // Configures the task's transfer and hands it to libcurl; false (the task released) if it cannot.
+  bool start(const std::shared_ptr<HTTPTaskState>& task, std::map<CURL*, std::shared_ptr<HTTPTaskState>>& active) {
+    if (!configure(*task) || curl_multi_add_handle(multi_, task->easy) != CURLM_OK) {
+      release(*task);
+      return false;
+    }
+    active.emplace(task->easy, task);
+    return true;
+  }
+
   static size_t onHeader(char* data, size_t size, size_t count, void* user) {
     auto* task = static_cast<HTTPTaskState*>(user);
     size_t n = size * count;
@@ -205,8 +264,10 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     if (line.starts_with("HTTP/")) {
       task->responseHeaders.clear();  // a new response block (after an interim 1xx answer)
     } else if (auto colon = line.find(':'); colon != std::string_view::npos) {
+      // Optional white space around a field value is not part of it.
       std::string_view value = line.substr(colon + 1);
       while (!value.empty() && (value.front() == ' ' || value.front() == '\t')) value.remove_prefix(1);
+      while (!value.empty() && (value.back() == ' ' || value.back() == '\t')) value.remove_suffix(1);
       task->responseHeaders.emplace_back(std::string(line.substr(0, colon)), std::string(value));
     }
     return n;
@@ -241,14 +302,16 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
     } else {
       curl_easy_setopt(e, CURLOPT_CUSTOMREQUEST, t.request.HTTPMethod.c_str());
     }
+    // Servers close idle connections after their keep-alive time (5 s is common); one older than
+    // that is not reused, which spares most requests a send into a closed connection.
+    curl_easy_setopt(e, CURLOPT_MAXAGE_CONN, kMaximumIdleSeconds);
+    if (t.resent) curl_easy_setopt(e, CURLOPT_FRESH_CONNECT, 1L);
     if (t.body) {
-      // libcurl silently sends a request again when the reused connection it went out on dies
-      // before the answer. A body it reads through a callback cannot be rewound, so a request
-      // whose body was sent fails as a lost connection instead of reaching the server twice
-      // (where a signed request would be refused as a replay).
       curl_easy_setopt(e, CURLOPT_POST, 1L);
       curl_easy_setopt(e, CURLOPT_READFUNCTION, &Engine::onUpload);
       curl_easy_setopt(e, CURLOPT_READDATA, &t);
+      curl_easy_setopt(e, CURLOPT_SEEKFUNCTION, &Engine::onSeek);
+      curl_easy_setopt(e, CURLOPT_SEEKDATA, &t);
       curl_easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(t.body->length()));
     } else if (t.request.HTTPMethod == "POST") {
       curl_easy_setopt(e, CURLOPT_POSTFIELDS, "");
@@ -310,15 +373,9 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
         for (auto& task : adds) complete(task, std::nullopt, std::nullopt, cancelledError(task->request.URL));
         return;
       }
-      for (auto& task : adds) {
-        if (task->finished) continue;
-        if (!configure(*task) || curl_multi_add_handle(multi_, task->easy) != CURLM_OK) {
-          release(*task);
+      for (auto& task : adds)
+        if (!task->finished && !start(task, active))
           complete(task, std::nullopt, std::nullopt, transportError(CURLE_FAILED_INIT, "", task->request.URL));
-          continue;
-        }
-        active.emplace(task->easy, task);
-      }
       for (auto& task : cancels) {
         auto it = task->easy ? active.find(task->easy) : active.end();
         if (it != active.end()) {
@@ -337,6 +394,13 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
         auto task = it->second;
         CURLcode result = msg->data.result;
         active.erase(it);
+        if (shouldResend(*task, result)) {
+          release(*task);
+          task->resent = true;
+          task->uploaded = 0;
+          task->responseHeaders.clear();
+          if (start(task, active)) continue;
+        }
         finish(task, result);
       }
       curl_multi_poll(multi_, nullptr, 0, 1000, nullptr);
@@ -345,6 +409,7 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
 
   HTTPSessionConfiguration configuration_;
   std::shared_ptr<Queue> callbackQueue_;
+  std::shared_ptr<Semaphore> claims_;
   CURLM* multi_ = nullptr;
   std::mutex mutex_;
   std::deque<std::shared_ptr<HTTPTaskState>> toAdd_, toCancel_;
@@ -399,12 +464,13 @@ std::shared_ptr<HTTPSession> HTTPSession::sharedSession() {
   return shared;
 }
 
-std::shared_ptr<HTTPTask> HTTPSession::uploadTaskWithRequest(HTTPRequest request, Data body,
-                                                             HTTPCompletion completion) {
+std::shared_ptr<HTTPTask> HTTPSession::uploadTaskWithRequest(HTTPRequest request, Data body, HTTPCompletion completion,
+                                                             std::shared_ptr<ConnectionClaim> claim) {
   auto state = std::make_shared<HTTPTaskState>();
   state->request = std::move(request);
   state->body = std::move(body);
   state->completion = std::move(completion);
+  state->claim = std::move(claim);
   state->engine = engine_;
   return std::shared_ptr<HTTPTask>(new HTTPTask(std::move(state)));
 }
@@ -416,6 +482,8 @@ std::shared_ptr<HTTPTask> HTTPSession::dataTaskWithRequest(HTTPRequest request, 
   state->engine = engine_;
   return std::shared_ptr<HTTPTask>(new HTTPTask(std::move(state)));
 }
+
+std::shared_ptr<ConnectionClaim> HTTPSession::claimConnection() { return engine_->claimConnection(); }
 
 void HTTPSession::invalidateAndCancel() { engine_->stop(); }
 

@@ -4,8 +4,10 @@
 // session's serial callback queue, with (body, response, nullopt) when an answer arrived (whatever
 // its status) or (nullopt, nullopt, error) when none did. TLS verification is always on, with the
 // configured CA file ([tls] ca_file) or the system store; only https is spoken; redirects are not
-// followed. Connections are reused within a session; a request whose body has gone out is never
-// sent again, even when the reused connection dies before the answer (the task fails instead).
+// followed. Connections are reused within a session, up to `maximumConnectionsPerHost` to one
+// server, and dropped after a few idle seconds. A request that went out on a reused connection
+// which the server had already closed is sent once more on a fresh one, but only when no byte of an
+// answer arrived: the server never saw it.
 // The ephemeral session keeps no cookies, cache or credentials; the shared session is the
 // process-wide one.
 #pragma once
@@ -43,6 +45,7 @@ struct HTTPSessionConfiguration {
   std::string caFile;                         // extra CA bundle; empty: the system store
   size_t maximumResponseSize = 16u << 20;     // larger answers fail with HTTPErrorResourceTooLarge
   std::string label = "HTTPSession";          // names the callback queue
+  long maximumConnectionsPerHost = 32;        // further requests to that server wait for one
 
   // Both take the CA file of the current configuration.
   static HTTPSessionConfiguration defaultSessionConfiguration();
@@ -51,6 +54,9 @@ struct HTTPSessionConfiguration {
 
 class HTTPSession;
 struct HTTPTaskState;
+
+// A claim on one of a session's connections: see HTTPSession::claimConnection.
+class ConnectionClaim;
 
 class HTTPTask {
  public:
@@ -70,8 +76,16 @@ class HTTPSession {
   static std::shared_ptr<HTTPSession> sharedSession();
   ~HTTPSession();
 
-  std::shared_ptr<HTTPTask> uploadTaskWithRequest(HTTPRequest request, Data body, HTTPCompletion completion);
+  // A task that sends `body`; with a claim, the task holds it until it completes.
+  std::shared_ptr<HTTPTask> uploadTaskWithRequest(HTTPRequest request, Data body, HTTPCompletion completion,
+                                                  std::shared_ptr<ConnectionClaim> claim = nullptr);
   std::shared_ptr<HTTPTask> dataTaskWithRequest(HTTPRequest request, HTTPCompletion completion);
+
+  // Waits, as blocking work, until fewer than `maximumConnectionsPerHost` claims of this session
+  // are held, and returns one; it is given back when the last reference goes. A request that is
+  // signed after its claim is taken never waits for a connection afterwards, so the wait cannot
+  // push it out of a server's replay window. Never fails; the claim may outlive the session.
+  std::shared_ptr<ConnectionClaim> claimConnection();
 
   // Cancels every task (each completes with HTTPErrorCancelled) and refuses new ones.
   void invalidateAndCancel();

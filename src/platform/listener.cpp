@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <cstring>
+#include <deque>
 #include <map>
 #include <set>
 #include <vector>
@@ -221,13 +222,20 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   }
 
   void finishCall(uint64_t id) {
-    pending_.erase(id);
+    if (auto call = pending_.find(id); call != pending_.end()) {
+      if (auto peer = peers_.find(call->second.peer); peer != peers_.end()) {
+        --peer->second.working;
+        pump(peer->second);
+      }
+      pending_.erase(call);
+    }
     inFlight_.fetch_sub(1);
     lastActivity_ = now();
     if (draining_ && inFlight_.load() == 0) sd_event_exit(event_.get(), 0);
   }
 
-  // A peer's calls wait in order in its backlog until the bus has said who it is.
+  // A peer's calls wait in order in its backlog until the bus has said who it is, and then while
+  // it has as many calls being worked on as it may.
   struct CredentialsRequest {
     Core* core;
     std::string peer;
@@ -236,9 +244,19 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     std::shared_ptr<Connection> connection;  // null: refused by the delegate
     std::unique_ptr<CredentialsRequest> request;
     BusSlotPtr credentialsCall;  // declared after `request`, so released before it
-    std::vector<std::pair<MethodInvocation, Reply>> backlog;
+    std::deque<std::pair<MethodInvocation, Reply>> backlog;
+    size_t working = 0;
     bool identified = false;
   };
+
+  void pump(Peer& peer) {
+    while (peer.identified && peer.working < options_.maxCallsPerPeer && !peer.backlog.empty()) {
+      auto& [invocation, reply] = peer.backlog.front();
+      schedule(peer.connection, std::move(invocation), std::move(reply));
+      peer.backlog.pop_front();
+      ++peer.working;
+    }
+  }
 
   // The peer's entry, made at its first message. Nothing is recorded when making it fails (the
   // delegate may run out of threads or memory), so that the peer's next message tries again.
@@ -287,8 +305,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
             connection->setEntitlementLookup(identify(**credentials));
           });
     peer.identified = true;
-    for (auto& [invocation, reply] : peer.backlog) schedule(peer.connection, std::move(invocation), std::move(reply));
-    peer.backlog.clear();
+    pump(peer);
   }
 
   static std::optional<PeerCredentials> parseCredentials(sd_bus_message* reply) {
@@ -395,7 +412,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     auto state = std::make_shared<Reply::State>();
     state->core = weak_from_this();
     state->id = ++nextId_;
-    pending_.emplace(state->id, state);
+    pending_.emplace(state->id, PendingCall{state, senderRaw});
     // From here on the call is answered exactly once through its state: dropped unanswered (as
     // when it cannot be queued for want of memory), the state answers with an error itself.
     state->call = sd_bus_message_ref(m);
@@ -403,10 +420,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     lastActivity_ = now();
     Reply reply(state);
     try {
-      if (peer.identified)
-        schedule(connection, std::move(decoded.invocation), reply);
-      else
-        peer.backlog.emplace_back(std::move(decoded.invocation), reply);
+      peer.backlog.emplace_back(std::move(decoded.invocation), reply);
+      pump(peer);
     } catch (const std::exception& e) {
       log(LogLevel::Error, "Cannot queue a call to %s: %s", member, e.what());
     }
@@ -474,8 +489,8 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   static int onDrainLimit(sd_event_source*, uint64_t, void* userdata) {
     auto* self = static_cast<Core*>(userdata);
     log(LogLevel::Error, "Calls still in flight after the drain limit: failing %zu of them", self->pending_.size());
-    for (auto& [id, weak] : self->pending_)
-      if (auto state = weak.lock(); state && !state->done.exchange(true)) {
+    for (auto& [id, call] : self->pending_)
+      if (auto state = call.state.lock(); state && !state->done.exchange(true)) {
         self->sendErrorNow(state->call,
                            BusError{kBusErrorNoServer, "The service shut down before the operation finished."});
         sd_bus_message_unref(state->call);
@@ -524,7 +539,11 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   std::vector<std::function<void()>> posted_;
   std::map<std::string, Peer> peers_;
   std::atomic<size_t> connectionCount_{0};
-  std::map<uint64_t, std::weak_ptr<Reply::State>> pending_;
+  struct PendingCall {
+    std::weak_ptr<Reply::State> state;
+    std::string peer;  // unique bus name
+  };
+  std::map<uint64_t, PendingCall> pending_;
   std::atomic<size_t> inFlight_{0};
   uint64_t nextId_ = 0;
   uint64_t lastActivity_ = 0;

@@ -31,6 +31,9 @@ struct ListenerOptions {
   std::function<void()> onReload;              // SIGHUP
   std::optional<std::chrono::seconds> exitOnIdle;
   std::chrono::seconds drainLimit{120};        // longest wait for calls in flight at shutdown
+  // Calls of one peer worked on at once; its further calls wait in order, so a greedy peer cannot
+  // take the workers, connections or memory that the others need.
+  size_t maxCallsPerPeer = 8;
   bool notifyReady = true;                     // READY=1 through sd_notify once the name is owned
 };
 

@@ -1,6 +1,7 @@
 #include "platform/log.h"
 
 #include <sys/stat.h>
+#include <sys/uio.h>
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
@@ -148,17 +149,54 @@ std::string timestamp() {
   return buf;
 }
 
+// A control byte in logged text (a server's body, a caller's string) could end the line early, forge
+// another or recolour a terminal: on stderr each one is shown as an escape instead.
+void appendEscaped(std::string& line, std::string_view text) {
+  for (char c : text) {
+    auto byte = static_cast<unsigned char>(c);
+    if (byte >= 0x20 && byte != 0x7F) {
+      line += c;
+      continue;
+    }
+    switch (c) {
+      case '\n':
+        line += "\\n";
+        break;
+      case '\r':
+        line += "\\r";
+        break;
+      case '\t':
+        line += "\\t";
+        break;
+      default: {
+        char buf[8];
+        std::snprintf(buf, sizeof buf, "\\x%02x", byte);
+        line += buf;
+      }
+    }
+  }
+}
+
+// One argument of an entry holds at most this much of its text: a server's body can be megabytes.
+constexpr size_t kMaximumArgumentBytes = 4096;
+
+// Cuts what `appendObject` just added after `start` down to the cap (at a UTF-8 character
+// boundary) and says how much was left out.
+void capArgument(std::string& out, size_t start) {
+  if (out.size() - start <= kMaximumArgumentBytes) return;
+  size_t cut = start + kMaximumArgumentBytes;
+  while (cut > start && (static_cast<unsigned char>(out[cut]) & 0xC0) == 0x80) --cut;
+  size_t leftOut = out.size() - cut;
+  out.resize(cut);
+  out += "... (" + std::to_string(leftOut) + " more bytes)";
+}
+
 void writeStderr(const std::string& identifier, const Log& log, LogLevel level, const std::string& message) {
   std::string line =
       timestamp() + " " + identifier + "[" + std::to_string(getpid()) + "] <" + std::string(logLevelName(level)) + ">";
   if (!log.subsystem().empty()) line += " [" + log.subsystem() + ":" + log.category() + "]";
   line += ' ';
-  for (char c : message) {
-    if (c == '\n')
-      line += "\\n";
-    else
-      line += c;
-  }
+  appendEscaped(line, message);
   line += '\n';
   // One write per entry keeps lines from concurrent threads whole.
   const char* p = line.data();
@@ -169,6 +207,17 @@ void writeStderr(const std::string& identifier, const Log& log, LogLevel level, 
     p += w;
     left -= static_cast<size_t>(w);
   }
+}
+
+// Fields go out with their lengths, so a message holding a NUL reaches the journal whole.
+int sendToJournal(const Log& log, LogLevel level, const std::string& identifier, const std::string& message) {
+  std::string fields[] = {"MESSAGE=" + message, "PRIORITY=" + std::to_string(journalPriority(level)),
+                          "SYSLOG_IDENTIFIER=" + identifier, "ZLKA_SUBSYSTEM=" + log.subsystem(),
+                          "ZLKA_CATEGORY=" + log.category()};
+  iovec vector[std::size(fields)];
+  size_t count = log.subsystem().empty() ? 3 : std::size(fields);
+  for (size_t i = 0; i < count; ++i) vector[i] = {fields[i].data(), fields[i].size()};
+  return sd_journal_sendv(vector, static_cast<int>(count));
 }
 
 }  // namespace
@@ -302,9 +351,12 @@ std::string formatLogMessage(std::string_view format, std::span<const LogArg> ar
     directive += conv;
     switch (conv) {
       case '@':
-      case 's':
+      case 's': {
+        size_t start = out.size();
         appendObject(out, arg);
+        capArgument(out, start);
         break;
+      }
       case 'p':
         appendPointer(out, arg);
         break;
@@ -333,18 +385,7 @@ void writeLog(const Log& log, LogLevel level, std::string_view format, std::span
     (*sink)(LogEntry{level, log.subsystem(), log.category(), std::move(message)});
     return;
   }
-  if (journal) {
-    int rc;
-    if (log.subsystem().empty()) {
-      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level), "SYSLOG_IDENTIFIER=%s",
-                           identifier.c_str(), nullptr);
-    } else {
-      rc = sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", journalPriority(level), "SYSLOG_IDENTIFIER=%s",
-                           identifier.c_str(), "ZLKA_SUBSYSTEM=%s", log.subsystem().c_str(), "ZLKA_CATEGORY=%s",
-                           log.category().c_str(), nullptr);
-    }
-    if (rc >= 0) return;
-  }
+  if (journal && sendToJournal(log, level, identifier, message) >= 0) return;
   writeStderr(identifier, log, level, message);
 }
 

@@ -1,5 +1,7 @@
 #include "platform/worker_pool.h"
 
+#include <malloc.h>
+
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
@@ -102,7 +104,12 @@ void WorkerPool::work() {
     lock.lock();
   }
   --threads_;
+  // The last worker that a burst added gives back what the burst left free in the allocator's
+  // arenas; without this a daemon keeps the memory of its busiest moment for good.
+  bool trim = threads_ == limits_.minimum && !stopping_;
   ended_.notify_all();
+  lock.unlock();
+  if (trim) malloc_trim(0);
 }
 
 void WorkerPool::setBlocked(bool blocked) {

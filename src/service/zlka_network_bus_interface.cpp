@@ -1,8 +1,14 @@
 #include "service/zlka_network_bus_interface.h"
 
+#include <initializer_list>
+#include <utility>
+
+#include "network/request_pipeline.h"
 #include "network/zlka_network_protocol.h"
 #include "platform/bus_values.h"
 #include "platform/json.h"
+#include "platform/log.h"
+#include "support/errors.h"
 
 using platform::BusError;
 using platform::Data;
@@ -11,6 +17,8 @@ using platform::Reply;
 using platform::Value;
 
 namespace {
+
+constexpr size_t kMaximumTokenLength = 64 * 1024;
 
 struct TokenArguments {
   std::optional<Data> token;
@@ -27,12 +35,14 @@ int readString(sd_bus_message* m, std::optional<std::string>& out) {
 }
 
 std::optional<BusError> readArguments(sd_bus_message* m, bool withLocale, TokenArguments& args) {
-  std::map<std::string, std::string> signatures = {{"token", "ay"}, {"uuid", "s"}};
+  // Accessory tokens are tens of bytes; each 2-byte item of a token grows about 120-fold on its way
+  // to the server, so a larger one is refused before any of that work.
+  std::map<std::string, platform::BusKey> keys = {{"token", {"ay", kMaximumTokenLength}}, {"uuid", {"s"}}};
   if (withLocale) {
-    signatures.emplace("requestedLocale", "s");
-    signatures.emplace("requestInfo", "a{sv}");
+    keys.emplace("requestedLocale", platform::BusKey{"s"});
+    keys.emplace("requestInfo", platform::BusKey{"a{sv}"});
   }
-  return platform::readKnownDictionary(m, signatures, [&](const std::string& key, sd_bus_message* message) {
+  return platform::readKnownDictionary(m, keys, [&](const std::string& key, sd_bus_message* message) {
     if (key == "uuid") return readString(message, args.uuid);
     if (key == "requestedLocale") return readString(message, args.requestedLocale);
     Value value;
@@ -44,6 +54,19 @@ std::optional<BusError> readArguments(sd_bus_message* m, bool withLocale, TokenA
       args.requestInfo = *value.dictionary();
     return r;
   });
+}
+
+// A D-Bus string is UTF-8 without NUL: an answered string that is not one would reach the client
+// altered (cut short at the NUL), so the call fails as a bad answer from the server instead.
+std::optional<BusError> unsendable(std::initializer_list<std::pair<const char*, const std::string*>> members) {
+  for (const auto& [name, value] : members) {
+    if (platform::isBusString(*value)) continue;
+    platform::log(
+        platform::LogLevel::Error,
+        "[#TokenAuth] The answer's %{public}s cannot be sent over D-Bus: it is not UTF-8 without NUL characters", name);
+    return busErrorForError(request_pipeline::failure(ZLKAErrorServer));
+  }
+  return std::nullopt;
 }
 
 std::shared_ptr<ZLKANetworkProtocol> exported(const std::shared_ptr<void>& object) {
@@ -64,7 +87,10 @@ DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& objec
               if (error || !ppid || !answered || !metadata)
                 return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
               std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
-              reply.send([ppid = *ppid, locale = answered->localeIdentifier(), json](sd_bus_message* r) {
+              std::string locale = answered->localeIdentifier();
+              if (auto refused = unsendable({{"ppid", &*ppid}, {"locale", &locale}, {"metadata", &json}}))
+                return reply.fail(*refused);
+              reply.send([ppid = *ppid, locale = std::move(locale), json = std::move(json)](sd_bus_message* r) {
                 return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
               });
             });

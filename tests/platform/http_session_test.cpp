@@ -5,8 +5,11 @@
 #include <gtest/gtest.h>
 
 #include <future>
+#include <thread>
 
+#include "common/child_process.h"
 #include "common/server_world.h"
+#include "devserver/dev_server.h"
 
 namespace {
 
@@ -112,6 +115,36 @@ TEST_F(HTTPSessionTest, CancellingCompletesEachTaskOnceWithCancelled) {
   task(s, done[3], crt)->resume();  // refused once invalidated
   for (auto& d : done) EXPECT_EQ(wait(d).error->code(), platform::HTTPErrorCancelled);
   s->callbackQueue()->sync([] {});  // any second completion would have run by now
+}
+
+// A server that closes idle connections after a second: the requests that follow a longer idle,
+// after one call and after a burst alike, go out on connections the server closed, which the
+// session must notice and send again on fresh ones, never failing a request the server never saw.
+TEST_F(HTTPSessionTest, RequestsAfterTheServersKeepAliveRanOutStillArrive) {
+  zlkatest::TempDir dir;
+  devserver::DevServerOptions options;
+  options.stateDir = dir.path();
+  options.keepAlive = std::chrono::seconds(1);
+  devserver::DevServer server(options);
+  ASSERT_EQ(server.start(), std::nullopt);
+  auto c = platform::HTTPSessionConfiguration::ephemeralSessionConfiguration();
+  c.caFile = (dir.path() / "ca.pem").string();
+  auto s = HTTPSession::sessionWithConfiguration(c);
+  for (int burst : {1, 8, 8}) {
+    std::vector<std::promise<Outcome>> done(burst);
+    for (auto& d : done) {
+      platform::HTTPRequest request(server.baseURL() + "/deviceservices/queryProductPlan", 0, 30.0);
+      request.HTTPMethod = "POST";
+      s->uploadTaskWithRequest(request, platform::Data::fromString("{}"), [&d](auto body, auto response, auto error) {
+         d.set_value({std::move(body), std::move(response), std::move(error)});
+       })->resume();
+    }
+    for (auto& d : done) {
+      Outcome o = wait(d);
+      EXPECT_FALSE(o.error) << "after a burst of " << burst << ": " << o.error->description();
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+  }
 }
 
 }  // namespace

@@ -116,3 +116,76 @@ TEST(Listener, APeerWhoseIdentityIsSlowHoldsUpNoOtherPeerAndEachPeerIsIdentified
   running.reset();
   platform::Listener::serviceListener().setDelegate(nullptr);
 }
+
+// A greedy peer's calls beyond the per-peer bound wait, in order, until earlier ones are answered;
+// another peer is served meanwhile, and every call is answered once.
+TEST(Listener, APeerHasAtMostItsBoundOfCallsWorkedOnAndTheRestWaitInOrder) {
+  client_test::PrivateBus bus;
+  ASSERT_TRUE(bus.running());
+  std::mutex mutex;
+  std::vector<platform::Reply> held;  // the calls being worked on, answered when the test says
+  std::vector<int> order;
+  platform::InterfaceMethod hold{"Hold", "i", "", {"n"}, {}, [&](sd_bus_message* m, const std::shared_ptr<void>&) {
+                                   int n = -1;
+                                   sd_bus_message_read(m, "i", &n);
+                                   return platform::DecodedCall{[&, n](platform::Reply reply) {
+                                                                  std::lock_guard lock(mutex);
+                                                                  held.push_back(reply), order.push_back(n);
+                                                                },
+                                                                std::nullopt};
+                                 }};
+  auto interface = std::make_shared<platform::Interface>(*pingInterface());
+  interface->methods.push_back(hold);
+  platform::ListenerOptions options;
+  options.bus = bus.address(), options.serviceName = kName, options.objectPath = kPath, options.interface = interface;
+  options.notifyReady = false, options.maxCallsPerPeer = 3;
+  platform::Listener::configure(options);
+  struct Delegate : platform::ListenerDelegate {
+    std::shared_ptr<const platform::Interface> interface;
+    bool listenerShouldAcceptNewConnection(platform::Listener&, platform::Connection& connection) override {
+      connection.setExportedInterface(interface);
+      connection.resume();
+      return true;
+    }
+  };
+  auto delegate = std::make_shared<Delegate>();
+  delegate->interface = interface;
+  platform::Listener::serviceListener().setDelegate(delegate);
+  std::optional<RunningListener> running(std::in_place);
+  platform::BusPtr greedy = connect(bus.address()), other = connect(bus.address());
+  ASSERT_TRUE(greedy && other);
+  for (int i = 0; i < 500 && !ping(other); ++i) std::this_thread::sleep_for(10ms);
+  constexpr int kCalls = 10;
+  std::atomic<int> answered{0};
+  auto onAnswer = [](sd_bus_message* m, void* count, sd_bus_error*) {
+    if (!sd_bus_message_is_method_error(m, nullptr)) ++*static_cast<std::atomic<int>*>(count);
+    return 0;
+  };
+  for (int n = 0; n < kCalls; ++n)
+    ASSERT_GE(sd_bus_call_method_async(greedy.get(), nullptr, kName, kPath, kName, "Hold", onAnswer, &answered, "i", n),
+              0);
+  sd_bus_flush(greedy.get());
+  auto heldCount = [&] {
+    std::lock_guard lock(mutex);
+    return held.size();
+  };
+  for (int i = 0; i < 500 && heldCount() < 3; ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_TRUE(ping(other));  // served while the greedy peer is at its bound
+  std::this_thread::sleep_for(100ms);
+  EXPECT_EQ(heldCount(), 3u);
+  for (int i = 0; i < 3000 && answered < kCalls; ++i) {
+    std::vector<platform::Reply> answering;
+    {
+      std::lock_guard lock(mutex);
+      answering.swap(held);
+    }
+    for (auto& reply : answering) reply.send(nullptr);
+    while (sd_bus_process(greedy.get(), nullptr) > 0) {
+    }
+    sd_bus_wait(greedy.get(), 10'000);
+  }
+  EXPECT_EQ(answered.load(), kCalls);
+  EXPECT_EQ(order, (std::vector<int>{0, 1, 2, 3, 4, 5, 6, 7, 8, 9}));
+  running.reset();
+  platform::Listener::serviceListener().setDelegate(nullptr);
+}

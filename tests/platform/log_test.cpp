@@ -43,6 +43,8 @@ TEST(LogFormat, DirectivesFormatTheirArgumentsAndPrivateOnesAreRedacted) {
       {"tail %", {}, "tail %"},
       {"%{private", {1}, "%{private"},
       {"%5", {1}, "%5"}, {"%5l", {1}, "%5l"},  // cut short in the flags, in the length
+      // A long argument is cut at a character boundary (here inside the two bytes of "é").
+      {"%@", {std::string(4095, 'a') + "\u00e9" + std::string(10, 'b')}, std::string(4095, 'a') + "... (12 more bytes)"},
       {"%{private}@ %{public}@ %{private}d %{ private, mask }s", {std::string("secret"), std::string("open"), 42, "m"},
        "<private> open <private> <private>", "secret open 42 m"},
   };
@@ -74,11 +76,13 @@ TEST(Log, StderrLinesCarryTimeIdentifierLevelAndModuleAndStayOneLine) {
   platform::configureLog({LogLevel::Debug, false, platform::LogBackend::Stderr, "test"});
   testing::internal::CaptureStderr();
   platform::log(*platform::Log::create("com.example.sub", "cat"), LogLevel::Error, "a\nb");
-  platform::log(LogLevel::Info, "plain");
+  // A server's body or a caller's string must not end the line, forge another or colour a terminal.
+  platform::log(LogLevel::Info, "%@", std::string("\r\x1b[31mforged\t\x7f\0.", 16));
   const std::string out = testing::internal::GetCapturedStderr(), pid = std::to_string(getpid());
   platform::configureLog({});
   const std::string stamp = "[0-9]{4}-[0-9]{2}-[0-9]{2} [0-9]{2}:[0-9]{2}:[0-9]{2}\\.[0-9]{3} test\\[" + pid + "\\] ";
-  EXPECT_THAT(out, testing::MatchesRegex(stamp + "<error> \\[com\\.example\\.sub:cat\\] a\\\\nb\n" + stamp + "<info> plain\n"));
+  EXPECT_THAT(out, testing::MatchesRegex(stamp + "<error> \\[com\\.example\\.sub:cat\\] a\\\\nb\n" + stamp +
+                                           "<info> \\\\r\\\\x1b\\[31mforged\\\\t\\\\x7f\\\\x00\\.\n"));
   using Names = std::pair<const char*, const char*>;  // module names must be printable and not empty
   for (auto [subsystem, category] : {Names{"", "cat"}, Names{"sub", ""}, Names{"sub", "bad\ncat"}, Names{"bad\x7f", "c"}, Names{"s\x1f", "c"}})
     EXPECT_FALSE(platform::Log::create(subsystem, category)) << subsystem << "/" << category;

@@ -31,7 +31,6 @@ namespace {
 constexpr std::size_t kMaxBody = 1024 * 1024;
 constexpr std::size_t kInitialWorkers = 4;
 constexpr std::size_t kMaxWorkers = 256;
-constexpr time_t kKeepAliveSeconds = 60;
 constexpr std::size_t kKeepAliveRequests = 1000000;
 
 // What the request log needs from the hooks that cpp-httplib calls around one request
@@ -112,6 +111,7 @@ struct DevServer::Impl {
   std::promise<void> running;
   std::once_flag runningOnce;
   uint16_t port = 0;
+  socket_t listeningSocket = INVALID_SOCKET;
   bool started = false;
 
   std::mutex stopMutex;
@@ -143,14 +143,15 @@ void DevServer::Impl::configureHTTP() {
   // cpp-httplib's defaults (5 requests per connection, Nagle on) cap a client near 20
   // requests per second.
   http->set_keep_alive_max_count(kKeepAliveRequests);
-  http->set_keep_alive_timeout(kKeepAliveSeconds);
+  http->set_keep_alive_timeout(options.keepAlive.count());
   http->set_tcp_nodelay(true);
   http->set_payload_max_length(kMaxBody);
   // cpp-httplib's default also sets SO_REUSEPORT, which lets a second server bind the same port
   // and take half its connections. Address reuse alone still allows an immediate restart.
-  http->set_socket_options([](socket_t sock) {
+  http->set_socket_options([this](socket_t sock) {
     const int on = 1;
     setsockopt(sock, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
+    listeningSocket = sock;  // the only socket cpp-httplib opens before it listens
   });
   http->new_task_queue = [this] {
     markRunning();  // called once the server counts as running, so stop() will reach it
@@ -297,7 +298,8 @@ void DevServer::Impl::respond(Endpoint endpoint, const httplib::Request& req, ht
       }
     }
     if (signature) {
-      res.set_header("signature", base64Encode(*signature));
+      const bool padded = mode == SignatureFault::padded;
+      res.set_header("signature", padded ? " \t " + base64Encode(*signature) + " \t" : base64Encode(*signature));
     }
   }
   setAnswer(res, answer);
@@ -390,6 +392,11 @@ std::optional<std::string> DevServer::start() {
     d.http.reset();
     return "cannot listen on " + where + " (address in use or not available)";
   }
+  // cpp-httplib listens with a fixed backlog of 5; listening again on the bound socket sets ours.
+  if (::listen(d.listeningSocket, d.options.listenBacklog) != 0) {
+    d.http.reset();
+    return "cannot listen on " + where + " with a backlog of " + std::to_string(d.options.listenBacklog);
+  }
   d.port = static_cast<uint16_t>(port);
   std::future<void> running = d.running.get_future();
   d.listener = std::thread([&d] {
@@ -433,5 +440,7 @@ std::string DevServer::baseURL() const {
 const std::filesystem::path& DevServer::stateDir() const {
   return impl_->state.dir.empty() ? impl_->options.stateDir : impl_->state.dir;
 }
+
+nlohmann::json DevServer::statistics() const { return impl_->stats.toJSON(); }
 
 }  // namespace devserver

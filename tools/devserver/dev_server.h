@@ -23,6 +23,7 @@
 #include <chrono>
 #include <cstdint>
 #include <filesystem>
+#include <nlohmann/json.hpp>
 #include <memory>
 #include <optional>
 #include <string>
@@ -37,6 +38,8 @@ struct DevServerOptions {
   bool admin = false;                                // serve /_admin/*
   std::chrono::seconds sessionValidity{3600};        // time-to-live of an association
   bool logRequests = false;                          // one line per request on stderr
+  std::chrono::seconds keepAlive{60};                // an idle connection is closed after this
+  int listenBacklog = 128;                           // connections waiting to be accepted
 };
 
 class DevServer {
@@ -53,6 +56,7 @@ class DevServer {
   uint16_t port() const;                          // the bound port, 0 before start()
   std::string baseURL() const;                    // "https://127.0.0.1:PORT", no trailing slash
   const std::filesystem::path& stateDir() const;  // absolute once started
+  nlohmann::json statistics() const;              // what GET /_admin/stats answers, admin or not
 
  private:
   struct Impl;

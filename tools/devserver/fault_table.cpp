@@ -38,6 +38,8 @@ const char* signatureName(SignatureFault mode) {
       return "missing";
     case SignatureFault::corrupt:
       return "corrupt";
+    case SignatureFault::padded:
+      return "padded";
   }
   return "";
 }
@@ -92,8 +94,10 @@ FaultRule parseFaultRule(const json& document) {
         fault.signature = SignatureFault::missing;
       } else if (mode == "corrupt") {
         fault.signature = SignatureFault::corrupt;
+      } else if (mode == "padded") {
+        fault.signature = SignatureFault::padded;
       } else {
-        invalid(member, "must be \"valid\", \"missing\" or \"corrupt\"");
+        invalid(member, "must be \"valid\", \"missing\", \"corrupt\" or \"padded\"");
       }
     } else if (member == "drop") {
       if (!value.is_boolean()) {

@@ -2,7 +2,7 @@
 // server. A rule is the JSON body of POST /_admin/faults:
 //   {"endpoint": "setup.crt"|"sapSession"|"queryProductPlan"|"activateAccessory"|"ackAccessory"|"*",
 //    "status": 200..599, "delay_ms": >= 0 (capped at 120000), "body": string,
-//    "signature": "valid"|"missing"|"corrupt", "drop": bool, "session_validity": any JSON value,
+//    "signature": "valid"|"missing"|"corrupt"|"padded", "drop": bool, "session_validity": any JSON value,
 //    "session_info": string, "remaining": >= 1 (absent: every request)}
 // with at least one fault member. One rule per endpoint (a new one replaces the old); "*" covers
 // the endpoints without a rule of their own. Thread-safe.
@@ -20,7 +20,8 @@
 
 namespace devserver {
 
-enum class SignatureFault { valid, missing, corrupt };
+// padded: a valid signature with spaces and a tab around it (optional white space, not part of it).
+enum class SignatureFault { valid, missing, corrupt, padded };
 
 struct Fault {
   std::optional<int> status;

@@ -47,6 +47,8 @@ int main(int argc, char** argv) {
   std::string catalog;
   bool admin = false;
   int64_t sessionValidity = 3600;
+  int64_t keepAlive = 60;
+  int listenBacklog = 128;
   app.add_option("--listen", listen, "Address to serve on; [::1]:PORT for IPv6, port 0 picks a free one")
       ->type_name("HOST:PORT")
       ->capture_default_str();
@@ -60,6 +62,14 @@ int main(int argc, char** argv) {
   app.add_option("--session-validity", sessionValidity, "Session time-to-live announced by the handshake")
       ->type_name("SECONDS")
       ->check(CLI::Range(int64_t{0}, int64_t{10} * 365 * 24 * 3600))
+      ->capture_default_str();
+  app.add_option("--keep-alive", keepAlive, "Seconds an idle connection is kept open before the server closes it")
+      ->type_name("SECONDS")
+      ->check(CLI::Range(int64_t{1}, int64_t{3600}))
+      ->capture_default_str();
+  app.add_option("--listen-backlog", listenBacklog, "Connections that may wait to be accepted (the kernel caps it)")
+      ->type_name("N")
+      ->check(CLI::Range(1, 65535))
       ->capture_default_str();
   app.footer(kFooter);
   CLI11_PARSE(app, argc, argv);
@@ -79,6 +89,8 @@ int main(int argc, char** argv) {
   options.admin = admin;
   options.sessionValidity = std::chrono::seconds(sessionValidity);
   options.logRequests = true;
+  options.keepAlive = std::chrono::seconds(keepAlive);
+  options.listenBacklog = listenBacklog;
 
   // Every thread inherits this mask, so the signals wait for sigwait() below.
   sigset_t stopSignals;
