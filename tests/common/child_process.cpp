@@ -18,14 +18,11 @@ extern char** environ;
 namespace zlkatest {
 
 namespace {
-
 std::string readFile(const std::filesystem::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
+  std::ostringstream text;
+  text << std::ifstream(path, std::ios::binary).rdbuf();
   return text.str();
 }
-
 }  // namespace
 
 TempDir::TempDir() {
@@ -41,7 +38,7 @@ TempDir::~TempDir() {
 ChildProcess::ChildProcess(const std::vector<std::string>& argv, const std::filesystem::path& outputDirectory,
                            const std::vector<std::string>& extraEnvironment) {
   static std::atomic<int> counter{0};
-  std::string tag = "child-" + std::to_string(getpid()) + "-" + std::to_string(++counter);
+  const std::string tag = "child-" + std::to_string(getpid()) + "-" + std::to_string(++counter);
   out_ = outputDirectory / (tag + ".out");
   err_ = outputDirectory / (tag + ".err");
   posix_spawn_file_actions_t actions;
@@ -62,8 +59,8 @@ ChildProcess::ChildProcess(const std::vector<std::string>& argv, const std::file
   env.insert(env.end(), extraEnvironment.begin(), extraEnvironment.end());
   std::vector<char*> args, envp;
   for (const auto& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-  args.push_back(nullptr);
   for (auto& e : env) envp.push_back(e.data());
+  args.push_back(nullptr);
   envp.push_back(nullptr);
   if (posix_spawn(&pid_, args[0], &actions, &attributes, args.data(), envp.data()) != 0) pid_ = -1;
   posix_spawn_file_actions_destroy(&actions);
@@ -97,11 +94,8 @@ std::string ChildProcess::standardError() const { return readFile(err_); }
 
 RunResult runToEnd(const std::vector<std::string>& argv, const std::filesystem::path& outputDirectory) {
   ChildProcess child(argv, outputDirectory);
-  RunResult result;
-  result.status = child.waitExit(std::chrono::minutes(2)).value_or(-1);
-  result.out = child.standardOutput();
-  result.err = child.standardError();
-  return result;
+  const int status = child.waitExit(std::chrono::minutes(2)).value_or(-1);
+  return {status, child.standardOutput(), child.standardError()};
 }
 
 }  // namespace zlkatest

@@ -1,25 +1,11 @@
 #include "common/log_capture.h"
 
 #include <algorithm>
+#include <cstdint>
 
 namespace zlkatest {
 
-namespace {
-
 using platform::LogEntry;
-
-constexpr size_t kEnd = static_cast<size_t>(-1);
-
-// Indices in [from, to) of the entries that `match` accepts.
-template <class Match>
-std::vector<size_t> matching(const std::vector<LogEntry>& all, size_t from, size_t to, Match match) {
-  std::vector<size_t> out;
-  for (size_t i = from; i < all.size() && i < to; ++i)
-    if (match(all[i])) out.push_back(i);
-  return out;
-}
-
-}  // namespace
 
 LogCapture::LogCapture() : previous_(platform::currentLogSettings()) {
   platform::LogSettings settings = previous_;
@@ -54,27 +40,24 @@ std::vector<LogEntry> LogCapture::entries(size_t from) const {
   return {all.begin() + static_cast<std::ptrdiff_t>(std::min(from, all.size())), all.end()};
 }
 
-std::optional<size_t> LogCapture::find(platform::LogLevel level, std::string_view text, size_t from, size_t to) const {
-  auto found = matching(entries(), from, to, [&](const LogEntry& e) { return e.level == level && e.message == text; });
-  return found.empty() ? std::nullopt : std::optional(found.front());
+int LogCapture::count(platform::LogLevel level, std::string_view text, size_t from, size_t to) const {
+  const auto all = entries(from);
+  return static_cast<int>(std::count_if(
+      all.begin(), all.begin() + static_cast<std::ptrdiff_t>(std::min(all.size(), to - std::min(to, from))),
+      [&](const LogEntry& e) { return e.level == level && e.message == text; }));
 }
 
-std::optional<size_t> LogCapture::findStartingWith(std::string_view prefix, size_t from) const {
-  auto found = matching(entries(), from, kEnd, [&](const LogEntry& e) { return e.message.starts_with(prefix); });
-  return found.empty() ? std::nullopt : std::optional(found.front());
-}
-
-int LogCapture::count(platform::LogLevel level, std::string_view text, size_t from) const {
-  return matching(entries(), from, kEnd, [&](const LogEntry& e) { return e.level == level && e.message == text; }).size();
-}
-
-int LogCapture::countStartingWith(std::string_view prefix, size_t from) const {
-  return matching(entries(), from, kEnd, [&](const LogEntry& e) { return e.message.starts_with(prefix); }).size();
+int LogCapture::countStartingWith(std::string_view prefix, size_t from, std::optional<platform::LogLevel> level) const {
+  const auto all = entries(from);
+  return static_cast<int>(std::count_if(all.begin(), all.end(), [&](const LogEntry& e) {
+    return e.message.starts_with(prefix) && (!level || e.level == *level);
+  }));
 }
 
 std::string LogCapture::dump() const {
   std::string out;
-  for (const LogEntry& e : entries()) out += "  [" + std::string(platform::logLevelName(e.level)) + "] " + e.message + "\n";
+  for (const LogEntry& e : entries())
+    out += "  [" + std::string(platform::logLevelName(e.level)) + "] " + e.message + "\n";
   return out;
 }
 

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -27,13 +28,11 @@ class LogCapture {
   size_t size() const;
   std::vector<platform::LogEntry> entries(size_t from = 0) const;  // from entry `from` on
 
-  // Index of the first entry in [from, to) whose message is `text` at `level`; or, for the
-  // *StartingWith forms, whose message starts with `prefix` at any level.
-  std::optional<size_t> find(platform::LogLevel level, std::string_view text, size_t from = 0, size_t to = static_cast<size_t>(-1)) const;
-  std::optional<size_t> findStartingWith(std::string_view prefix, size_t from = 0) const;
-  // How many entries from `from` on match, as for find.
-  int count(platform::LogLevel level, std::string_view text, size_t from = 0) const;
-  int countStartingWith(std::string_view prefix, size_t from = 0) const;
+  // How many entries in [from, to) have the message `text` at `level`; or, for the StartingWith
+  // form, a message that starts with `prefix`, at `level` if one is given.
+  int count(platform::LogLevel level, std::string_view text, size_t from = 0, size_t to = SIZE_MAX) const;
+  int countStartingWith(std::string_view prefix, size_t from = 0,
+                        std::optional<platform::LogLevel> level = std::nullopt) const;
 
   // "  [level] message" per line, for failure messages.
   std::string dump() const;

@@ -1,12 +1,11 @@
 #include "common/private_bus.h"
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <signal.h>
 #include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <gtest/gtest.h>
 
 #include <cstdlib>
 #include <cstring>
@@ -27,22 +26,18 @@ PrivateBus::PrivateBus(bool anyUser) {
   directory_ = pattern;
   if (anyUser) std::filesystem::permissions(directory_, std::filesystem::perms(0755));
   std::filesystem::path config = directory_ / "bus.conf";
-  std::ofstream(config) << "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
-                           " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
-                           "<busconfig>\n"
-                           "  <type>session</type>\n"
-                           "  <listen>unix:path=" << (directory_ / "socket").string() << "</listen>\n"
-                           "  <auth>EXTERNAL</auth>\n"
-                           // Room for the benchmark's thousand idle peers.
-                           "  <limit name=\"max_completed_connections\">4096</limit>\n"
-                           "  <limit name=\"max_connections_per_user\">4096</limit>\n"
-                           "  <policy context=\"default\">\n"
-                        << (anyUser ? "    <allow user=\"*\"/>\n" : "") <<
-                           "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
-                           "    <allow eavesdrop=\"true\"/>\n"
-                           "    <allow own=\"*\"/>\n"
-                           "  </policy>\n"
-                           "</busconfig>\n";
+  std::ofstream(config)
+      << "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
+         " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
+         "<busconfig><type>session</type><auth>EXTERNAL</auth><listen>unix:path="
+      << (directory_ / "socket").string()
+      << "</listen>\n"
+         // Room for the benchmark's thousand idle peers.
+         "<limit name=\"max_completed_connections\">4096</limit><limit name=\"max_connections_per_user\">4096</limit>\n"
+         "<policy context=\"default\">"
+      << (anyUser ? "<allow user=\"*\"/>" : "")
+      << "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/><allow own=\"*\"/></policy>\n"
+         "</busconfig>\n";
 
   int fds[2];
   if (::pipe2(fds, O_CLOEXEC) != 0) {
@@ -73,12 +68,9 @@ PrivateBus::PrivateBus(bool anyUser) {
   char c;
   while (::read(fds[0], &c, 1) == 1 && c != '\n') line.push_back(c);
   ::close(fds[0]);
-  if (line.empty()) {
-    std::ifstream in(log);
-    std::stringstream complaints;
-    complaints << in.rdbuf();
-    ADD_FAILURE() << "dbus-daemon printed no address: " << complaints.str();
-  }
+  std::ostringstream complaints;
+  complaints << std::ifstream(log).rdbuf();
+  if (line.empty()) ADD_FAILURE() << "dbus-daemon printed no address: " << complaints.str();
   address_ = line;
 }
 

@@ -23,37 +23,26 @@ namespace fs = std::filesystem;
 using nlohmann::json;
 
 namespace {
-
 ServerWorld* gWorld = nullptr;
-
-httplib::Result adminCall(uint16_t port, const fs::path& caFile, const std::string& method, const std::string& path,
-                          const std::string& body = {}) {
-  httplib::SSLClient client("127.0.0.1", port);
-  client.set_ca_cert_path(caFile.c_str());
-  client.enable_server_certificate_verification(true);
-  client.set_read_timeout(60, 0);
-  if (method == "GET") return client.Get(path);
-  if (method == "DELETE") return client.Delete(path);
-  return client.Post(path, body, "application/json");
-}
-
 }  // namespace
 
-void AdminClient::expectOK(const std::string& method, const std::string& path, const std::string& body) const {
-  auto result = adminCall(port_, caFile_, method, path, body);
-  ASSERT_TRUE(result && result->status == 200) << method << " " << path << " " << body << ": " << (result ? result->body : "no answer");
+std::string AdminClient::call(const std::string& method, const std::string& path, const std::string& body) const {
+  httplib::SSLClient client("127.0.0.1", port_);
+  client.set_ca_cert_path(caFile_.c_str());
+  client.enable_server_certificate_verification(true);
+  client.set_read_timeout(60, 0);
+  auto result = method == "GET"      ? client.Get(path)
+                : method == "DELETE" ? client.Delete(path)
+                                     : client.Post(path, body, "application/json");
+  if (result && result->status == 200) return result->body;
+  ADD_FAILURE() << method << " " << path << " " << body << ": " << (result ? result->body : "no answer");
+  return "{}";
 }
 
-void AdminClient::setFault(const json& rule) const { expectOK("POST", "/_admin/faults", rule.dump()); }
-void AdminClient::clearFaults() const { expectOK("DELETE", "/_admin/faults"); }
-void AdminClient::reset() const { expectOK("POST", "/_admin/reset"); }
-
-json AdminClient::stats() const {
-  auto result = adminCall(port_, caFile_, "GET", "/_admin/stats");
-  if (result && result->status == 200) return json::parse(result->body);
-  ADD_FAILURE() << "GET /_admin/stats failed";
-  return json::object();
-}
+void AdminClient::setFault(const json& rule) const { call("POST", "/_admin/faults", rule.dump()); }
+void AdminClient::clearFaults() const { call("DELETE", "/_admin/faults"); }
+void AdminClient::reset() const { call("POST", "/_admin/reset"); }
+json AdminClient::stats() const { return json::parse(call("GET", "/_admin/stats")); }
 
 uint64_t AdminClient::requests(std::string_view endpoint) const {
   const json all = stats()["requests"];
@@ -67,7 +56,8 @@ uint64_t AdminClient::verified() const { return stats().value("verified", uint64
 uint64_t AdminClient::rejected() const { return stats().value("rejected", uint64_t{0}); }
 
 void SettingsSuite::set(std::string_view key, const platform::Value& value) const {
-  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).setObject(key, value)) << "cannot write " << key;
+  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).setObject(key, value))
+      << "cannot write " << key;
 }
 
 void SettingsSuite::remove(std::string_view key) const {
@@ -107,16 +97,14 @@ void ServerWorld::SetUp() {
   std::string pattern = (fs::temp_directory_path() / "zlka-server-world-XXXXXX").string();
   ASSERT_NE(mkdtemp(pattern.data()), nullptr);
   tempDir_ = pattern;
-  stateDir_ = tempDir_ / "state";
-
   devserver::DevServerOptions options;
-  options.stateDir = stateDir_;
+  options.stateDir = tempDir_ / "state";
   options.admin = true;
   server_ = std::make_unique<devserver::DevServer>(options);
   if (auto error = server_->start()) FAIL() << "zlka-devserver did not start: " << *error;
 
   std::string error;
-  std::optional<platform::Configuration> loaded = platform::loadConfiguration(stateDir_ / "zlkad.toml", &error);
+  std::optional<platform::Configuration> loaded = platform::loadConfiguration(options.stateDir / "zlkad.toml", &error);
   ASSERT_TRUE(loaded) << error;
   configuration_ = std::move(*loaded);
   configuration_.device.internalBuild = internalBuild_;

@@ -42,7 +42,8 @@ class AdminClient {
   uint64_t rejected() const;
 
  private:
-  void expectOK(const std::string& method, const std::string& path, const std::string& body = {}) const;
+  // The answer's body; a failure of the current test unless it is 200.
+  std::string call(const std::string& method, const std::string& path, const std::string& body = {}) const;
   uint16_t port_;
   std::filesystem::path caFile_;
 };
@@ -71,9 +72,7 @@ class ServerWorld : public ::testing::Environment {
   void SetUp() override;
   void TearDown() override;
 
-  bool internalBuild() const { return internalBuild_; }
   std::string baseURL() const;
-  const std::filesystem::path& stateDir() const { return stateDir_; }  // zlkad.toml, ca.pem, setup.crt
   // A loopback base URL whose port is bound but never listens: every connection is refused.
   std::string refusedURL() const { return "https://127.0.0.1:" + std::to_string(refusedPort_); }
   const platform::Configuration& configuration() const { return configuration_; }
@@ -82,7 +81,7 @@ class ServerWorld : public ::testing::Environment {
 
  private:
   bool internalBuild_;
-  std::filesystem::path tempDir_, stateDir_;
+  std::filesystem::path tempDir_;
   std::unique_ptr<devserver::DevServer> server_;
   platform::Configuration configuration_;
   std::unique_ptr<AdminClient> admin_;

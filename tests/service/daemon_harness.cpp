@@ -24,31 +24,14 @@ Harness::Harness(bool anyUser) : bus_(anyUser) {
 }
 
 Harness::~Harness() {
-  if (daemon_) {
-    daemon_->signal(SIGTERM);
-    daemon_->waitExit(std::chrono::seconds(30));
-    daemon_.reset();
-  }
-  server_->stop();
+  if (daemon_) daemon_->signal(SIGTERM), daemon_->waitExit(std::chrono::seconds(30));  // a graceful end keeps its coverage data
   if (notifySocket_ >= 0) ::close(notifySocket_);
 }
 
-void Harness::writeManifest(const std::string& name, const std::string& executable, const platform::Value& value,
-                            mode_t mode, uid_t uid) {
+void Harness::writeManifest(const std::string& name, const std::string& executable, const platform::Value& value) const {
   platform::Value manifest(platform::Dictionary{
-      {"uid", uid},
-      {"executable", executable},
-      {"entitlements", platform::Dictionary{{"com.kestro.ZLKAuthentication", value}}}});
-  auto path = stateDirectory() / "entitlements.d" / (name + ".json");
-  std::ofstream(path) << *platform::json::serialize(manifest);
-  std::filesystem::permissions(path, static_cast<std::filesystem::perms>(mode));
-}
-
-std::string Harness::copyOfZlkactl(const std::string& name) {
-  auto path = directory() / "clients" / name / "zlkactl";
-  std::filesystem::create_directories(path.parent_path());
-  std::filesystem::copy_file(ZLKACTL_PATH, path, std::filesystem::copy_options::overwrite_existing);
-  return path.string();
+      {"uid", getuid()}, {"executable", executable}, {"entitlements", platform::Dictionary{{"com.kestro.ZLKAuthentication", value}}}});
+  std::ofstream(stateDirectory() / "entitlements.d" / (name + ".json")) << *platform::json::serialize(manifest);
 }
 
 bool Harness::startDaemon(const std::vector<std::string>& extraArguments, const std::vector<std::string>& launcher) {
@@ -60,19 +43,21 @@ bool Harness::startDaemon(const std::vector<std::string>& extraArguments, const 
   if (::bind(notifySocket_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return false;
   std::filesystem::permissions(socketPath, std::filesystem::perms(0666));  // a daemon of any user may notify
   std::vector<std::string> argv = launcher;
-  argv.insert(argv.end(), {ZLKAD_PATH, "--config", configFile().string(), "--bus", busAddress(), "--log", "stderr",
-                           "--log-level", "info"});
+  argv.insert(argv.end(), {ZLKAD_PATH, "--config", (stateDirectory() / "zlkad.toml").string(), "--bus", busAddress(), "--log",
+                           "stderr", "--log-level", "info"});
   argv.insert(argv.end(), extraArguments.begin(), extraArguments.end());
-  daemon_ = std::make_unique<ChildProcess>(argv, directory(), std::vector<std::string>{"NOTIFY_SOCKET=" + socketPath.string()});
+  daemon_ = std::make_unique<zlkatest::ChildProcess>(argv, directory(), std::vector<std::string>{"NOTIFY_SOCKET=" + socketPath.string()});
   // READY=1 comes once the daemon owns its name; a daemon that dies first never sends it.
   pollfd p{notifySocket_, POLLIN, 0};
-  while (::poll(&p, 1, 30000) > 0) {
-    char buffer[512];
-    ssize_t n = ::recv(notifySocket_, buffer, sizeof buffer, 0);
-    if (n <= 0) break;
+  char buffer[512];
+  for (ssize_t n; ::poll(&p, 1, 30000) > 0 && (n = ::recv(notifySocket_, buffer, sizeof buffer, 0)) > 0;)
     if (std::string_view(buffer, static_cast<size_t>(n)).find("READY=1") != std::string_view::npos) return true;
-  }
   return false;
+}
+
+std::unique_ptr<ZLKAClient> Harness::connect() const {
+  auto made = ZLKAClient::connect({.bus = busAddress()});
+  return made.ok() ? std::move(made).value() : nullptr;
 }
 
 platform::Data sampleToken() {

@@ -1,27 +1,22 @@
 // What an end-to-end test of zlkad needs: a private bus, the reference server with its admin
-// interface, its state directory with the generated configuration and entitlement manifests, and
-// the daemon as a child process, ready once it says READY=1 on its notify socket.
+// interface and state directory (configuration, entitlement manifests), and the daemon as a child
+// process, ready once it says READY=1 on its notify socket.
 #pragma once
-
-#include <sys/types.h>
-#include <unistd.h>
 
 #include <filesystem>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "client/zlka_client.h"
 #include "common/child_process.h"
 #include "common/private_bus.h"
 #include "common/server_world.h"
 #include "devserver/dev_server.h"
-#include "platform/value.h"
 
 namespace service_test {
 
-using zlkatest::ChildProcess;
-using zlkatest::runToEnd;
-using zlkatest::RunResult;
+using zlka_client::ZLKAClient;
 
 class Harness {
  public:
@@ -29,34 +24,37 @@ class Harness {
   explicit Harness(bool anyUser = false);
   ~Harness();
 
-  const std::filesystem::path& directory() const { return directory_.path(); }
-  std::filesystem::path stateDirectory() const { return directory() / "state"; }
-  std::filesystem::path configFile() const { return stateDirectory() / "zlkad.toml"; }
+  std::filesystem::path directory() const { return directory_.path(); }
+  std::filesystem::path stateDirectory() const { return directory() / "state"; }  // zlkad.toml, ca.pem, entitlements.d, defaults
   const std::string& busAddress() const { return bus_.address(); }
-
-  // A manifest that gives `executable` run by `uid` the entitlement value.
-  void writeManifest(const std::string& name, const std::string& executable, const platform::Value& entitlementValue,
-                     mode_t mode = 0644, uid_t uid = getuid());
-  // A copy of zlkactl at a path of its own, so that it is a client of its own identity.
-  std::string copyOfZlkactl(const std::string& name);
-
-  // Starts zlkad on the private bus with the generated configuration, through `launcher` (a
-  // command line that ends by running the rest of its arguments) when given; true once ready.
-  bool startDaemon(const std::vector<std::string>& extraArguments = {}, const std::vector<std::string>& launcher = {});
-  ChildProcess* daemon() { return daemon_.get(); }
-
   devserver::DevServer& server() { return *server_; }
   zlkatest::AdminClient admin() const { return {server_->port(), stateDirectory() / "ca.pem"}; }
+  zlkatest::ChildProcess* daemon() { return daemon_.get(); }
+
+  // A manifest that gives `executable`, run by this process's user, the entitlement value.
+  void writeManifest(const std::string& name, const std::string& executable,
+                     const platform::Value& value = platform::Array{"token-auth"}) const;
+  void entitleSelf() const { writeManifest("self", std::filesystem::read_symlink("/proc/self/exe").string()); }
+  // Starts zlkad on the private bus, through `launcher` (a command line that ends by running the
+  // rest of its arguments) when given; true once it is ready.
+  bool startDaemon(const std::vector<std::string>& extraArguments = {}, const std::vector<std::string>& launcher = {});
+  std::unique_ptr<ZLKAClient> connect() const;
 
  private:
   zlkatest::TempDir directory_;
   client_test::PrivateBus bus_;
   std::unique_ptr<devserver::DevServer> server_;
-  std::unique_ptr<ChildProcess> daemon_;
+  std::unique_ptr<zlkatest::ChildProcess> daemon_;
   int notifySocket_ = -1;
 };
 
 // The token an accessory would hold: two DER items back to back.
 platform::Data sampleToken();
+
+// "ok", or "domain code: description".
+template <class T>
+std::string outcome(const zlka_client::Result<T>& r) {
+  return r.ok() ? "ok" : r.error().domain() + " " + std::to_string(r.error().code()) + ": " + r.error().localizedDescription();
+}
 
 }  // namespace service_test

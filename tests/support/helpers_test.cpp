@@ -22,8 +22,6 @@ using platform::Value;
 
 namespace {
 
-std::vector<uint8_t> bytes(std::string_view s) { return {s.begin(), s.end()}; }
-
 TEST(Hex, TextToBytesSkipsEveryNonDigitAndAnOddLastDigit) {
   // clang-format off
   const std::pair<std::optional<std::string>, std::optional<std::string>> rows[] = {
@@ -32,14 +30,10 @@ TEST(Hex, TextToBytesSkipsEveryNonDigitAndAnOddLastDigit) {
       {"é1é2", "\x12"}, {std::nullopt, std::nullopt},
   };
   // clang-format on
-  for (const auto& [text, expected] : rows) {
-    auto data = convertNSStringToNSData(text);
-    ASSERT_EQ(data.has_value(), expected.has_value());
-    EXPECT_EQ(data.value_or(Data()).toVector(), bytes(expected.value_or(""))) << text.value_or("(none)");
-  }
+  for (const auto& [text, expected] : rows)
+    EXPECT_EQ(convertNSStringToNSData(text), expected ? std::optional(Data::fromString(*expected)) : std::nullopt) << text.value_or("(none)");
   uint8_t out[3] = {0xEE, 0xEE, 0xEE};
-  ascii_to_hex(out, "1", 1);  // whole pairs only
-  EXPECT_EQ(out[0], 0xEE);
+  ascii_to_hex(out + 2, "1", 1);  // whole pairs only
   ascii_to_hex(out, "fFzg9", 5);  // anything else reads as 0
   EXPECT_EQ(std::vector<uint8_t>(out, out + 3), (std::vector<uint8_t>{0xFF, 0x00, 0xEE}));
 }
@@ -49,8 +43,8 @@ TEST(Hex, BytesToTextUsesTheCallersFormatAndPrintingSkipsNoBytes) {
   EXPECT_EQ(convertNSDataToNSString(two, "%02X"), "01AB");
   EXPECT_EQ(convertNSDataToNSString(two, "%02x "), "01 ab ");
   EXPECT_EQ(convertNSDataToNSString(Value(Data()), "%02x"), "");
-  EXPECT_EQ(convertNSDataToNSString(std::nullopt, "%02x"), std::nullopt);
-  EXPECT_EQ(convertNSDataToNSString(Value("0102"), "%02x"), std::nullopt);  // bytes only
+  for (const auto& refused : {std::optional<Value>(), std::optional(Value("0102"))})  // bytes only
+    EXPECT_EQ(convertNSDataToNSString(refused, "%02x"), std::nullopt);
   EXPECT_EQ(convertNSDataToNSString(two, nullptr), std::nullopt);
   testing::internal::CaptureStdout();
   const uint8_t b[] = {0xde, 0xad};
@@ -59,8 +53,7 @@ TEST(Hex, BytesToTextUsesTheCallersFormatAndPrintingSkipsNoBytes) {
   printBytes(b, 2, "%02x", false);
   printBytes(b, 1, "<%u>", true);
   EXPECT_EQ(testing::internal::GetCapturedStdout(), "dead<222>\n");
-  using Cut = std::pair<const char*, const char*>;
-  for (auto [text, expected] : {Cut{"a\n\n", "a\n"}, Cut{"crlf\r\n", "crlf\r"}, Cut{"cr\r", "cr\r"}, Cut{"", ""}}) {
+  for (auto [text, expected] : {std::pair{"a\n\n", "a\n"}, {"crlf\r\n", "crlf\r"}, {"cr\r", "cr\r"}, {"", ""}}) {
     std::string buffer = text;
     EXPECT_STREQ(removeNewline(buffer.data()), expected);  // cuts one line feed and nothing else
   }
@@ -93,8 +86,7 @@ TEST(Objects, AbsentAndNullAreNullAndConformanceUsesTheInstanceTestForClassMetho
   EXPECT_EQ(NSObjectIfNotNull(Value()), std::nullopt);
   EXPECT_EQ(NSObjectIfNotNull(Value(false)), Value(false));
   EXPECT_TRUE(isNSObjectEqual(std::nullopt, std::nullopt) && isNSObjectEqual(Value(Array{1}), Value(Array{1.0})));
-  EXPECT_FALSE(isNSObjectEqual(std::nullopt, Value()) || isNSObjectEqual(Value(), std::nullopt));
-  EXPECT_FALSE(isNSObjectEqual(Value(1), Value(2)));
+  EXPECT_FALSE(isNSObjectEqual(std::nullopt, Value()) || isNSObjectEqual(Value(), std::nullopt) || isNSObjectEqual(Value(1), Value(2)));
 
   // A class method of C does not count: instances do not answer it.
   platform::Protocol proto{"P", {{"a", true, true}, {"b", true, true}, {"c", false, true}, {"make", true, false}}};
@@ -108,7 +100,8 @@ TEST(Objects, AbsentAndNullAreNullAndConformanceUsesTheInstanceTestForClassMetho
   EXPECT_EQ(missing, (std::set<std::string>{"make"}));
 }
 
-TEST(JSONFile, IsWrittenWholeOrNotAtAllAndUnreadableOnesReadAsNothing) {
+// What may be written and how a document is parsed are the JSON codec's rules.
+TEST(JSONFile, IsWrittenWholeAndPrettyOrNotAtAllAndUnreadableOnesReadAsNothing) {
   const auto dir = std::filesystem::temp_directory_path() / ("zlka-json-" + std::to_string(getpid()));
   std::filesystem::create_directories(dir);
   const auto path = dir / "f.json";
@@ -117,17 +110,12 @@ TEST(JSONFile, IsWrittenWholeOrNotAtAllAndUnreadableOnesReadAsNothing) {
   const Value v(Dictionary{{"a", Array{1, "x"}}, {"b", true}});
   ASSERT_TRUE(writeJSONFile(v, path));
   EXPECT_EQ(readJSONFile(path), v);
-  for (const auto& refused : {Value("scalar"), Value(Array{Data::fromString("x")})}) EXPECT_FALSE(writeJSONFile(refused, path));
-  EXPECT_FALSE(writeJSONFile(v, std::nullopt));
-  EXPECT_FALSE(writeJSONFile(v, dir / "no-such-dir" / "f.json"));
+  EXPECT_FALSE(writeJSONFile(Value(Array{Data::fromString("x")}), path) || writeJSONFile(v, std::nullopt) ||
+               writeJSONFile(v, dir / "no-such-dir" / "f.json"));
   std::ifstream in(path);
   EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "{\n  \"a\": [\n    1,\n    \"x\"\n  ],\n  \"b\": true\n}");
-  std::ofstream(dir / "scalar.json") << "42";
-  std::ofstream(dir / "bad.json") << "{\"a\":";
-  for (const auto& unreadable : {dir / "absent.json", dir / "scalar.json", dir / "bad.json", dir})
-    EXPECT_FALSE(readJSONFile(unreadable)) << unreadable;
-  EXPECT_FALSE(readJSONFile(std::nullopt));
-  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), {}), 3);  // no temporary left
+  EXPECT_FALSE(readJSONFile(dir / "absent.json") || readJSONFile(dir) || readJSONFile(std::nullopt));
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), {}), 1);  // no temporary left
   std::filesystem::remove_all(dir);
 }
 
@@ -137,13 +125,10 @@ TEST(SystemInfo, ClockRoundsHalvesAwayFromZeroAndMemoryUseWritesOnlyTheGivenPoin
       {10.5, 1, 11}, {10.49, 1, 10}, {1.0005, 1000, 1001}, {0.4, 1, 0}, {0, 1, 0}, {-3, 1000, 0}, {std::nan(""), 1, 0}};
   for (const auto& [seconds, scale, expected] : rows) EXPECT_EQ(roundedUnixTime(seconds, scale), expected) << seconds;
   const uint64_t s = systemInfo_getCurrentUnixTime(), ms = systemInfo_getCurrentUnixTimeMS();
-  EXPECT_GT(s, 1'700'000'000u);
-  EXPECT_LE(ms / 1000, s + 1);
-  EXPECT_GE(ms / 1000 + 1, s);
+  EXPECT_TRUE(s > 1'700'000'000u && ms / 1000 <= s + 1 && ms / 1000 + 1 >= s) << s << " " << ms;
   uint64_t resident = 0, virt = 0, footprint = 0;
-  ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr) && getMemoryUse(nullptr, &virt, &footprint));
+  ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr) && getMemoryUse(nullptr, &virt, &footprint) && getMemoryUse(nullptr, nullptr, nullptr));
   EXPECT_TRUE(resident > 0 && virt >= resident && footprint > 0);
-  EXPECT_TRUE(getMemoryUse(nullptr, nullptr, nullptr));
 }
 
 TEST(SystemInfo, InternalBuildIsAskedOnceAndDeviceClassEveryTime) {

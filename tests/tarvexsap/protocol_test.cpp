@@ -1,7 +1,7 @@
 // What device and server compute alike: the transcript hash, the key split and the message
 // signatures (against values worked out apart from this code, with Python's hashlib and hmac, so
-// that a mistake both sides share cannot hide behind their agreement), and the server's replay
-// window.
+// that a mistake both sides share cannot hide behind their agreement), and the replay window.
+// That every byte of a signature and its body counts is the fuzz targets' property.
 #include "tarvexsap/tsap_protocol.h"
 #include "tarvexsap/tsap_replay_window.h"
 #include "tsap_test_support.h"

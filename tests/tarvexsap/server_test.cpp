@@ -1,13 +1,11 @@
 // TarvexSAPServer, and device and server together once associated: which handshake requests are
-// answered, signed requests and responses round trip while every altered or misdirected
-// signature is refused on either side, each request passes the replay window once and each
-// response is taken once, associations are replaced, expire and are swept. Also the server's
-// set-up and the certificate tooling's refusals.
+// answered, each request passes the replay window once and each response is taken once,
+// associations are replaced, expire and are swept; also the server's set-up and the certificate
+// tooling. The request layout, and forged or altered signatures on either side, are the fuzz
+// targets' properties (fuzz/tarvexsap), each with its seeds.
 #include "tsap_test_support.h"
 
 #include <gtest/gtest.h>
-
-#include <openssl/x509v3.h>
 
 #include <stdexcept>
 
@@ -22,8 +20,8 @@ constexpr int32_t INVALID = kTarvexSAPErrorSignatureInvalid;
 class ServerTest : public TsapTest {
 protected:
     // The server's signature of the response to `seq`.
-    Bytes response(uint64_t seq, const Bytes &body, const char *session = "S") {
-        const auto r = server_->signResponse(session, seq, body);
+    Bytes response(uint64_t seq, const Bytes &body) {
+        const auto r = server_->signResponse("S", seq, body);
         EXPECT_EQ(r.status, Status::ok);
         return Bytes(r.signature.begin(), r.signature.end());
     }
@@ -34,92 +32,19 @@ protected:
     }
 };
 
-const struct {
-    const char *name;
-    void (*apply)(Bytes &request);
-} kMalformedRequests[] = {
-    // clang-format off
-    {"89 bytes", [](Bytes &r) { r.pop_back(); }},
-    {"91 bytes", [](Bytes &r) { r.push_back(0); }},
-    {"magic", [](Bytes &r) { r[3] = 'X'; }},
-    {"version 0", [](Bytes &r) { r[4] = 0; }},
-    {"version 2", [](Bytes &r) { r[4] = 2; }},
-    {"identifier of 21", [](Bytes &r) { r[5] = 21; }},
-    {"padding not zero", [](Bytes &r) { r[5] = 19; }},  // the 20th identifier byte becomes padding
-    {"all-zero client key", [](Bytes &r) { std::fill_n(r.begin() + 26, 32, 0); }},  // low order
-    // clang-format on
-};
-
-TEST_F(ServerTest, AnswersOnlyWellFormedRequestsUnderAnAcceptableIdentifier) {
+TEST_F(ServerTest, AnswersRequestsUnderAnAcceptableIdentifierWithAUsableKey) {
     TarvexHWInfo_ hw{20, {}};
     std::fill_n(hw.ID, 20, 0x41);
     Device device(hw), shortID(TarvexHWInfo_{3, {1, 2, 3}});
-    const Bytes good = device.exchange(pki_.setupDER).out;
+    Bytes good = device.exchange(pki_.setupDER).out;
     ASSERT_EQ(server_->handshake("S", shortID.exchange(pki_.setupDER).out, seconds(60)).status, Status::ok);
-    for (const auto &fault : kMalformedRequests) {
-        Bytes bad = good;
-        fault.apply(bad);
-        EXPECT_EQ(server_->handshake("T", bad, seconds(60)).status, Status::malformed) << fault.name;
-    }
     const std::string longest(TarvexSAPServer::kMaxSessionIdentifierLength, 'A');
     EXPECT_EQ(server_->handshake("", good, seconds(60)).status, Status::malformed);
     EXPECT_EQ(server_->handshake(longest + "A", good, seconds(60)).status, Status::malformed);
     EXPECT_EQ(server_->handshake(longest, good, seconds(60)).status, Status::ok);
+    std::fill_n(good.begin() + 26, 32, 0); // a low-order client key
+    EXPECT_EQ(server_->handshake("T", good, seconds(60)).status, Status::malformed);
     EXPECT_EQ(server_->associationCount(), 2u);
-}
-
-TEST_F(ServerTest, RequestsAndResponsesRoundTripInAnyOrder) {
-    Device device;
-    ASSERT_TRUE(associate(device, *server_, "S", pki_.setupDER));
-    const Bytes bodies[] = {bytesOf("{\"token\":\"AAEC\"}"), {}, Bytes(300, 7)};
-    for (uint64_t seq = 1; seq <= 3; ++seq) {
-        Bytes signature;
-        ASSERT_EQ(device.sign(bodies[seq - 1], &signature), kTarvexSAPOK);
-        const auto accepted = server_->verifyRequest("S", signature, bodies[seq - 1]);
-        EXPECT_TRUE(accepted.status == Status::ok && accepted.seq == seq); // the device counts from 1
-    }
-    for (uint64_t seq = 3; seq >= 1; --seq) {
-        EXPECT_EQ(device.verify(response(seq, bodies[seq - 1]), bodies[seq - 1]), kTarvexSAPOK) << seq;
-    }
-}
-
-const struct {
-    const char *name;
-    void (*apply)(Bytes &signature, Bytes &body);
-    int32_t deviceStatus; // the server says badSignature to all
-} kFaults[] = {
-    // clang-format off
-    {"body altered", [](Bytes &, Bytes &b) { b[0] ^= 0x01; }, INVALID},
-    {"body longer", [](Bytes &, Bytes &b) { b.push_back(0); }, INVALID},
-    {"first seq byte", [](Bytes &s, Bytes &) { s[0] ^= 0x80; }, INVALID},
-    {"last seq byte", [](Bytes &s, Bytes &) { s[7] ^= 0x01; }, INVALID},
-    {"first MAC byte", [](Bytes &s, Bytes &) { s[8] ^= 0x01; }, INVALID},
-    {"last MAC byte", [](Bytes &s, Bytes &) { s[39] ^= 0x80; }, INVALID},
-    {"39 bytes", [](Bytes &s, Bytes &) { s.pop_back(); }, kTarvexSAPErrorMalformedMessage},
-    {"41 bytes", [](Bytes &s, Bytes &) { s.push_back(0); }, kTarvexSAPErrorMalformedMessage},
-    // clang-format on
-};
-
-TEST_F(ServerTest, AlteredSignaturesAreRefusedAndUseNothingUp) {
-    Device device;
-    ASSERT_TRUE(associate(device, *server_, "S", pki_.setupDER));
-    for (const auto &fault : kFaults) {
-        SCOPED_TRACE(fault.name);
-        const Bytes body = bytesOf("body");
-        Bytes signature, alteredBody = body;
-        ASSERT_EQ(device.sign(body, &signature), kTarvexSAPOK);
-        Bytes altered = signature;
-        fault.apply(altered, alteredBody);
-        EXPECT_EQ(server_->verifyRequest("S", altered, alteredBody).status, Status::badSignature);
-        const auto accepted = server_->verifyRequest("S", signature, body);
-        ASSERT_EQ(accepted.status, Status::ok);
-        const Bytes answer = response(accepted.seq, body);
-        altered = answer;
-        alteredBody = body;
-        fault.apply(altered, alteredBody);
-        EXPECT_EQ(device.verify(altered, alteredBody), fault.deviceStatus);
-        EXPECT_EQ(device.verify(answer, body), kTarvexSAPOK);
-    }
 }
 
 TEST_F(ServerTest, EachRequestPassesOnceAndEachOutstandingRequestIsAnsweredOnce) {
@@ -132,13 +57,15 @@ TEST_F(ServerTest, EachRequestPassesOnceAndEachOutstandingRequestIsAnsweredOnce)
     // A forged seq far ahead must not move the window: only an authentic signature may.
     EXPECT_EQ(server_->verifyRequest("S", Bytes{0x7F} + Bytes(second.begin() + 1, second.end()), body).status,
               Status::badSignature);
-    EXPECT_EQ(server_->verifyRequest("S", second, body).status, Status::ok);
+    const auto accepted = server_->verifyRequest("S", second, body);
+    EXPECT_TRUE(accepted.status == Status::ok && accepted.seq == 2); // the device counts from 1
     EXPECT_EQ(server_->verifyRequest("S", second, body).status, Status::replay);
     EXPECT_EQ(server_->verifyRequest("S", first, body).status, Status::ok); // late, inside the window
     EXPECT_EQ(server_->verifyRequest("S", first, body).status, Status::replay);
 
     // seq 1 is outstanding, so only the key and label tell a request from a response.
     EXPECT_EQ(device.verify(first, body), INVALID);
+    EXPECT_EQ(device.verify(first + Bytes{0}, body), kTarvexSAPErrorMalformedMessage);
     EXPECT_EQ(server_->verifyRequest("S", response(3, body), body).status, Status::badSignature);
     EXPECT_EQ(device.verify(response(3, body), body), INVALID); // never issued
     EXPECT_EQ(device.verify(response(1, body), body), kTarvexSAPOK);
@@ -211,11 +138,6 @@ TEST(CertsToolingTest, RefusesWhatDoesNotParseAndKeepsKeysFromSeeds) {
     EXPECT_THROW(TarvexSAPMakeRoot(""), std::runtime_error);
     EXPECT_EQ(TarvexSAPCertToDER(TarvexSAPCertFromPEM(TarvexSAPCertToPEM(root.certificate.get())).get()), der);
     EXPECT_EQ(EVP_PKEY_eq(TarvexSAPKeyFromDER(TarvexSAPKeyToDER(root.key.get())).get(), root.key.get()), 1);
-    // Strict verification wants key identifiers on both certificates.
-    const TarvexSAPCredential setup = TarvexSAPIssueSetupCertificate(root, "Tooling Setup");
-    for (X509 *cert : {root.certificate.get(), setup.certificate.get()}) {
-        EXPECT_TRUE(X509_get0_subject_key_id(cert) != nullptr && X509_get0_authority_key_id(cert) != nullptr);
-    }
     // The fuzz targets' seed corpora rely on a fixed seed giving a fixed key.
     const std::array<uint8_t, 32> seed{7};
     EXPECT_EQ(EVP_PKEY_eq(TarvexSAPEd25519KeyFromSeed(seed).get(), TarvexSAPEd25519KeyFromSeed(seed).get()), 1);
