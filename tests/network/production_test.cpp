@@ -66,6 +66,9 @@ TEST_F(NetworkTest, TheSuiteChangesNothing) {
       EXPECT_EQ(url, world().baseURL());
     EXPECT_EQ(log().size(), mark) << log().dump();
   }
+  // Nor do the switches: an operation never reads the unparsable suite (which would log that).
+  EXPECT_FALSE(run({.op = Op::confirmation}).error);
+  EXPECT_EQ(log().countStartingWith("Settings suite"), 0) << log().dump();
 }
 
 }  // namespace

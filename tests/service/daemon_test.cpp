@@ -23,6 +23,18 @@ std::string readText(const std::filesystem::path& file) {
   return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
+// An a{sv} argument whose only key is a token of `size` zero bytes.
+int appendToken(sd_bus_message* m, size_t size) {
+  const std::vector<uint8_t> token(size);
+  int r = sd_bus_message_open_container(m, 'a', "{sv}");
+  if (r >= 0) r = sd_bus_message_open_container(m, 'e', "sv");
+  if (r >= 0) r = sd_bus_message_append(m, "s", "token");
+  if (r >= 0) r = sd_bus_message_open_container(m, 'v', "ay");
+  if (r >= 0) r = sd_bus_message_append_array(m, 'y', token.data(), token.size());
+  for (int i = 0; i < 3 && r >= 0; ++i) r = sd_bus_message_close_container(m);
+  return r;
+}
+
 // A daemon that entitles this program, on an internal build so that its settings suite counts.
 class Daemon : public testing::Test {
  protected:
@@ -59,6 +71,8 @@ TEST_F(Daemon, ArgumentsAreDecodedBeforeTheOperationAndItsErrorsKeepTheirCodes) 
        "Unknown key 'requestedLocale'."},
       {"ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 2, "uuid", "s", "A", "uuid", "s", "B"); },
        "Key 'uuid' is given twice."},
+      // Tokens are tens of bytes; a larger one would grow about 120-fold on its way to the server.
+      {"ConfirmActivationForToken", [](sd_bus_message* m) { return appendToken(m, 64 * 1024 + 1); }, "Key 'token' must hold at most 65536 bytes."},
       {"ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "s", "x"); },
        "Invalid arguments 's' to call com.kestro.ZLKAuthentication.ZLKANetworkProtocol.ConfirmActivationForToken(), expecting 'a{sv}'."},
   };
@@ -74,6 +88,10 @@ TEST_F(Daemon, ArgumentsAreDecodedBeforeTheOperationAndItsErrorsKeepTheirCodes) 
             failed + "-4: An internal error has occurred.");
   harness.admin().setFault({{"endpoint", "activateAccessory"}, {"status", 500}});
   EXPECT_EQ(outcome(client->requestActivation({sampleToken(), "U"})), failed + "-6: An internal server error has occurred.");
+  // A string that D-Bus cannot carry whole is a bad answer, not a silently shortened one.
+  harness.admin().setFault({{"endpoint", "queryProductPlan"}, {"body", std::string(R"({"ppid":"PP\u0000-1","locale":"en_US","ppid_metadata":{}})")}});
+  EXPECT_EQ(outcome(client->requestMetadata({sampleToken(), "U", "en_US"})), failed + "-6: An internal server error has occurred.");
+  EXPECT_THAT(harness.daemon()->standardError(), HasSubstr("The answer's ppid cannot be sent over D-Bus"));
   // Honoured only because the configuration declares an internal build.
   zlkatest::SettingsSuite(harness.stateDirectory() / "defaults").set("ForceNetworkFailure", true);
   EXPECT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), failed + "-5: There was a problem connecting to the network.");

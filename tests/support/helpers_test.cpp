@@ -148,6 +148,8 @@ TEST(ObfuscatedPointer, KeepsNullAndDistancesButHidesAddresses) {
   EXPECT_EQ(obfuscatedPointer(buffer + 10) - a, 10u);
   EXPECT_NE(a, reinterpret_cast<uintptr_t>(buffer));
   EXPECT_EQ(obfuscatedPointer(buffer), a);  // the offset is drawn once
+  // Not the first value of an unseeded random(), the same in every process (1 in 2^31 to fail).
+  EXPECT_NE(a - reinterpret_cast<uintptr_t>(buffer), 0x6b8b4567u);
   EXPECT_EQ(obfuscatedPointer(nullptr), 0u);
 }
 
