@@ -159,16 +159,16 @@ std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<st
     auto expected = keys.find(key);
     if (expected == keys.end()) return BusError{kBusErrorInvalidArgs, "Unknown key '" + key + "'."};
     if (!seen.insert(key).second) return BusError{kBusErrorInvalidArgs, "Key '" + key + "' is given twice."};
-    const BusKey& spec = expected->second;
+    const BusKey& wanted = expected->second;
     char type = 0;
     const char* contents = nullptr;
-    if (sd_bus_message_peek_type(m, &type, &contents) <= 0 || type != 'v' || !contents || spec.signature != contents)
-      return BusError{kBusErrorInvalidArgs, "Key '" + key + "' must hold a value of type " + spec.signature + "."};
+    if (sd_bus_message_peek_type(m, &type, &contents) <= 0 || type != 'v' || !contents || wanted.signature != contents)
+      return BusError{kBusErrorInvalidArgs, "Key '" + key + "' must hold a value of type " + wanted.signature + "."};
     if (sd_bus_message_enter_container(m, 'v', contents) <= 0)
       return BusError{kBusErrorInvalidArgs, "The value of key '" + key + "' could not be read."};
-    if (spec.maximumLength && isLongerThan(m, spec.signature, spec.maximumLength))
+    if (wanted.maximumLength && isLongerThan(m, wanted.signature, wanted.maximumLength))
       return BusError{kBusErrorInvalidArgs,
-                      "Key '" + key + "' must hold at most " + std::to_string(spec.maximumLength) + " bytes."};
+                      "Key '" + key + "' must hold at most " + std::to_string(wanted.maximumLength) + " bytes."};
     if (take(key, m) < 0 || sd_bus_message_exit_container(m) < 0)
       return BusError{kBusErrorInvalidArgs, "The value of key '" + key + "' could not be read."};
     if (sd_bus_message_exit_container(m) < 0) return malformed();
