@@ -2,10 +2,10 @@
 
 #include <chrono>
 #include <cmath>
+#include <cstdio>
 #include <mutex>
 
-#include "platform/device_facts.h"
-#include "platform/process_memory.h"
+#include "platform/config/device_facts.h"
 
 bool systemInfo_isInternalBuild() {
   static std::once_flag once;
@@ -33,11 +33,29 @@ double clockSeconds() {
 uint64_t systemInfo_getCurrentUnixTime() { return systemInfo_detail::roundedUnixTime(clockSeconds(), 1.0); }
 uint64_t systemInfo_getCurrentUnixTimeMS() { return systemInfo_detail::roundedUnixTime(clockSeconds(), 1000.0); }
 
+// Reads /proc/self/status; the footprint is anonymous resident memory plus swapped-out memory.
 bool getMemoryUse(uint64_t* residentSize, uint64_t* virtualSize, uint64_t* footprint) {
-  std::optional<platform::ProcessMemory> m = platform::readProcessMemory();
-  if (!m) return false;
-  if (residentSize) *residentSize = m->resident;
-  if (virtualSize) *virtualSize = m->virtualSize;
-  if (footprint) *footprint = m->footprint;
+  std::FILE* f = std::fopen("/proc/self/status", "re");
+  if (!f) return false;
+  uint64_t resident = 0, size = 0, anonymous = 0;
+  unsigned seen = 0;
+  char line[256];
+  while (std::fgets(line, sizeof line, f)) {
+    unsigned long long kb = 0;
+    if (std::sscanf(line, "VmRSS: %llu kB", &kb) == 1) {
+      resident = kb * 1024;
+      seen |= 1;
+    } else if (std::sscanf(line, "VmSize: %llu kB", &kb) == 1) {
+      size = kb * 1024;
+      seen |= 2;
+    } else if (std::sscanf(line, "RssAnon: %llu kB", &kb) == 1 || std::sscanf(line, "VmSwap: %llu kB", &kb) == 1) {
+      anonymous += kb * 1024;
+    }
+  }
+  std::fclose(f);
+  if ((seen & 3) != 3) return false;
+  if (residentSize) *residentSize = resident;
+  if (virtualSize) *virtualSize = size;
+  if (footprint) *footprint = anonymous;
   return true;
 }

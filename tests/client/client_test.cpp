@@ -24,7 +24,7 @@
 #include "client/zlka_client.h"
 #include "common/child_process.h"
 #include "common/private_bus.h"
-#include "platform/json.h"
+#include "platform/values/json.h"
 #include "zlkactl/command_line.h"
 #include "zlkactl/commands.h"
 #include "zlkactl/token_input.h"

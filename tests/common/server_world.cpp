@@ -13,8 +13,8 @@
 
 #include "devserver/dev_server.h"
 #include "network/zlka_network_constants.h"
-#include "platform/device_facts.h"
-#include "platform/settings_store.h"
+#include "platform/config/device_facts.h"
+#include "platform/config/settings_store.h"
 #include "tarvexsap/tarvex_sap.h"
 
 namespace zlkatest {

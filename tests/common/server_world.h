@@ -16,8 +16,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/configuration.h"
-#include "platform/value.h"
+#include "platform/config/configuration.h"
+#include "platform/values/value.h"
 
 namespace devserver {
 class DevServer;

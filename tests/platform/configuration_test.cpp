@@ -1,4 +1,4 @@
-#include "platform/configuration.h"
+#include "platform/config/configuration.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -6,8 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "platform/device_facts.h"
-#include "platform/process_memory.h"
+#include "platform/config/device_facts.h"
 
 namespace {
 
@@ -118,16 +117,6 @@ TEST(DeviceFacts, AreReadOnceFromTheDeviceTableAndAMissingOrBrokenFileAnswersPro
           std::exit(ok ? 0 : 1);
         },
         testing::ExitedWithCode(0), logged);
-}
-
-TEST(ProcessMemory, FootprintGrowsWithTouchedMemory) {
-  auto before = platform::readProcessMemory();
-  ASSERT_TRUE(before);
-  EXPECT_GE(before->virtualSize, before->resident);
-  std::vector<char> block(64 << 20, 1);  // touched, so resident
-  auto after = platform::readProcessMemory();
-  ASSERT_TRUE(after && block[12345] == 1);
-  EXPECT_TRUE(after->footprint > before->footprint + (32u << 20) && after->resident > before->resident + (32u << 20));
 }
 
 }  // namespace

@@ -5,8 +5,9 @@
 #include <cmath>
 #include <filesystem>
 #include <fstream>
+#include <vector>
 
-#include "platform/device_facts.h"
+#include "platform/config/device_facts.h"
 #include "support/base64_array.h"
 #include "support/hex.h"
 #include "support/json_file.h"
@@ -129,6 +130,10 @@ TEST(SystemInfo, ClockRoundsHalvesAwayFromZeroAndMemoryUseWritesOnlyTheGivenPoin
   uint64_t resident = 0, virt = 0, footprint = 0;
   ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr) && getMemoryUse(nullptr, &virt, &footprint) && getMemoryUse(nullptr, nullptr, nullptr));
   EXPECT_TRUE(resident > 0 && virt >= resident && footprint > 0);
+  std::vector<char> block(64 << 20, 1);  // touched, so resident and anonymous
+  uint64_t grown = 0;
+  ASSERT_TRUE(getMemoryUse(nullptr, nullptr, &grown) && block[12345] == 1);
+  EXPECT_GT(grown, footprint + (32u << 20));
 }
 
 TEST(SystemInfo, InternalBuildIsAskedOnceAndDeviceClassEveryTime) {

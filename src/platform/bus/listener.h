@@ -1,0 +1,66 @@
+// Listener: the service side of the messaging service. configure() names the bus, the service
+// name, the object and the interface to export; serviceListener() is the one listener of the
+// process; resume() owns the bus and runs the event loop on the calling thread.
+//
+// resume() blocks SIGTERM, SIGINT and SIGHUP itself only on its own thread: call
+// Listener::blockSignals() first thing in main, before any thread starts. SIGTERM and SIGINT drain:
+// the name is released, calls still arriving are refused, calls in flight are answered (or failed
+// when the drain limit passes), then resume() returns. SIGHUP runs the reload hook.
+#pragma once
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/bus/connection.h"
+#include "platform/bus/entitlement_manifests.h"
+#include "platform/bus/messaging.h"
+
+namespace platform {
+
+struct ListenerOptions {
+  std::string bus = "system";  // "system", "session", or a bus address ("unix:path=...")
+  std::string serviceName;
+  std::string objectPath;
+  std::shared_ptr<const Interface> interface;  // registered on the object
+  // The entitlement lookup of a new peer, from the credentials the bus recorded for it. Runs once
+  // per peer, on the peer's queue before any of its calls, so it may read /proc at leisure.
+  std::function<EntitlementLookup(const PeerCredentials&)> entitlementsForPeer;
+  std::function<void()> onReload;              // SIGHUP
+  std::optional<std::chrono::seconds> exitOnIdle;
+  std::chrono::seconds drainLimit{120};        // longest wait for calls in flight at shutdown
+  // Calls of one peer worked on at once; its further calls wait in order, so a greedy peer cannot
+  // take the workers, connections or memory that the others need.
+  size_t maxCallsPerPeer = 8;
+  bool notifyReady = true;                     // READY=1 through sd_notify once the name is owned
+};
+
+class Listener {
+ public:
+  static void configure(ListenerOptions options);
+  static Listener& serviceListener();
+  static void blockSignals();
+
+  void setDelegate(std::shared_ptr<ListenerDelegate> delegate);
+  std::shared_ptr<ListenerDelegate> delegate() const;
+
+  // Runs until shutdown; returns 0 after a clean stop, non-zero when the bus could not be used.
+  int resume();
+  // Starts the same drain as SIGTERM, from any thread.
+  void stop();
+
+  size_t connectionCount() const;
+  size_t callsInFlight() const;
+
+  class Core;
+
+ private:
+  Listener() = default;
+  std::shared_ptr<Core> core_;
+  std::shared_ptr<ListenerDelegate> delegate_;
+  mutable std::mutex mutex_;
+};
+
+}  // namespace platform

@@ -1,0 +1,61 @@
+// Settings store: a named suite of developer settings kept as one JSON object in
+// <directory>/<suite>.json. The file is read at every lookup (parsed again only when it changed),
+// so edits act at once; writes replace it atomically. A missing, unreadable or unparsable file
+// reads as empty; an unparsable one is logged once per change.
+#pragma once
+
+#include <filesystem>
+#include <functional>
+#include <sys/stat.h>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/values/value.h"
+
+namespace platform {
+
+class SettingsStore {
+ public:
+  SettingsStore(std::string suiteName, std::filesystem::path directory);
+  // The suite in the directory of the current configuration ([settings] suite_dir).
+  static std::shared_ptr<SettingsStore> openSuite(std::string suiteName);
+
+  const std::string& suiteName() const { return suite_; }
+  const std::filesystem::path& filePath() const { return path_; }
+
+  std::optional<Value> objectForKey(std::string_view key);
+  // true, a non-zero number, or "YES", "true" or "1" in any letter case.
+  bool boolForKey(std::string_view key);
+  // Strings only; anything else is nullopt.
+  std::optional<std::string> stringForKey(std::string_view key);
+  Dictionary dictionaryRepresentation();
+
+  // Read-modify-write under a lock file, so that concurrent writers lose nothing.
+  bool setObject(std::string_view key, const Value& value);
+  bool removeObject(std::string_view key);
+
+ private:
+  Dictionary load();
+  bool modify(const std::function<void(Dictionary&)>& change);
+
+  std::string suite_;
+  std::filesystem::path path_;
+  std::mutex mutex_;
+  struct Stamp {
+    dev_t device = 0;
+    ino_t inode = 0;
+    off_t size = -1;
+    struct timespec modified {};
+    bool operator==(const Stamp& o) const {
+      return device == o.device && inode == o.inode && size == o.size && modified.tv_sec == o.modified.tv_sec &&
+             modified.tv_nsec == o.modified.tv_nsec;
+    }
+  };
+  std::optional<Stamp> stamp_;
+  Dictionary cached_;
+};
+
+}  // namespace platform
