@@ -20,7 +20,6 @@ namespace {
 
 constexpr char kClassName[] = "TarvexSAPSession";
 constexpr double kDistantFuture = 64092211200.0;  // 4001-01-01, far beyond any time-to-live
-constexpr uint64_t kStateOpen = 6;
 
 double now() {
   return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
@@ -60,6 +59,11 @@ TarvexSAPDataCompletion firstAnswerOnly(TarvexSAPDataCompletion answer) {
   };
 }
 
+// Owns an output buffer that a primitive allocated with malloc.
+struct FreeBytes {
+  void operator()(uint8_t* p) const { std::free(p); }
+};
+
 std::string className(const std::optional<Value>& v) { return v ? v->typeName() : "(null)"; }
 
 }  // namespace
@@ -96,13 +100,13 @@ std::optional<std::string> TarvexSAPSession::stateName(uint64_t state_int) {
                                       "[Waiting For Handshake Response]",
                                       "[Processing Handshake Response]",
                                       "[Open]"};
-  if (state_int > kStateOpen) return std::nullopt;
+  if (state_int > static_cast<uint64_t>(Step::Open)) return std::nullopt;
   return names[state_int];
 }
 
-void TarvexSAPSession::setState_int(uint64_t value) {
-  state_int_ = value;
-  platform::log(LogLevel::Info, "[#TarvexSAPSession] self.state_int: %@", stateName(value));
+void TarvexSAPSession::setStep(Step step) {
+  step_ = step;
+  platform::log(LogLevel::Info, "[#TarvexSAPSession] self.state_int: %@", stateName(state_int()));
 }
 
 void TarvexSAPSession::_close() {
@@ -112,13 +116,13 @@ void TarvexSAPSession::_close() {
   // harmlessly, and the next open overwrites it.
   if (sessionContext_ && primitives_.teardown(sessionContext_) != 0)
     platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not tear down Tarvex SAP session!");
-  setState_int(0);
+  setStep(Step::Closed);
 }
 
 void TarvexSAPSession::_checkExpiration() {
   // An opening session has no valid expiration yet (a reopened one still carries the moment of
   // its last close), so only a closed or open session can expire.
-  if (state_int_ != 0 && state_int_ != kStateOpen) return;
+  if (step_ != Step::Closed && step_ != Step::Open) return;
   if (expiration_ - now() < 0) {
     platform::log(LogLevel::Default, "[#TarvexSAPSession] Session is past expiration, closing session...");
     _close();
@@ -131,13 +135,18 @@ void TarvexSAPSession::_complete(const OpenCompletion& completion, std::optional
   completionQueue_->async([completion, error = std::move(error)] { completion(error); });
 }
 
+void TarvexSAPSession::_failOpen(const OpenCompletion& completion, Error error) {
+  _close();
+  _complete(completion, std::move(error));
+}
+
 void TarvexSAPSession::openWithCompletionHandler(OpenCompletion completion) {
   internalQueue_->async([self = shared_from_this(), completion = once(std::move(completion))] { self->_open(completion); });
 }
 
 void TarvexSAPSession::_open(OpenCompletion completion) {
   _checkExpiration();
-  if (state_int_ != 0) {
+  if (step_ != Step::Closed) {
     _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session is already open or initializing."));
     return;
   }
@@ -149,108 +158,110 @@ void TarvexSAPSession::_open(OpenCompletion completion) {
     return;
   }
   const uint64_t generation = ++openGeneration_;
-  setState_int(1);
-  setState_int(2);
-  delegateQueue_->async([self = shared_from_this(), generation, completion] {
+  setStep(Step::Initialized);
+  setStep(Step::WaitingForCertificate);
+  _askDelegate(
+      generation, completion,
+      [](TarvexSAPSessionDelegate& delegate, TarvexSAPSession& self, TarvexSAPDataCompletion answer) {
+        delegate.sessionRequestCertificateWithCompletionHandler(self, std::move(answer));
+      },
+      &TarvexSAPSession::_receivedCertificate);
+}
+
+// One leg of the handshake: the delegate is asked on its queue, and its first answer continues the
+// open on the internal queue.
+void TarvexSAPSession::_askDelegate(uint64_t generation, OpenCompletion completion, DelegateLeg leg, Continuation next) {
+  delegateQueue_->async([self = shared_from_this(), generation, completion, leg = std::move(leg), next] {
     auto delegate = self->delegate_.lock();
     if (!delegate) return;
-    delegate->sessionRequestCertificateWithCompletionHandler(
-        *self, firstAnswerOnly([self, generation, completion](std::optional<Data> certificate, std::optional<Error> error) {
-          self->internalQueue_->async([self, generation, completion, certificate = std::move(certificate),
-                                       error = std::move(error)]() mutable {
-            self->_receivedCertificate(generation, std::move(certificate), std::move(error), completion);
+    leg(*delegate, *self, firstAnswerOnly([self, generation, completion, next](std::optional<Data> answer, std::optional<Error> error) {
+      self->internalQueue_->async(
+          [self, generation, completion, next, answer = std::move(answer), error = std::move(error)]() mutable {
+            ((*self).*next)(generation, std::move(answer), std::move(error), completion);
           });
-        }));
+    }));
   });
 }
 
-bool TarvexSAPSession::_stillOpening(uint64_t generation, uint64_t expectedState, const OpenCompletion& completion) {
-  if (generation == openGeneration_ && state_int_ == expectedState) return true;
+bool TarvexSAPSession::_stillOpening(uint64_t generation, Step expected, const OpenCompletion& completion) {
+  if (generation == openGeneration_ && step_ == expected) return true;
   // The session was closed (or reopened) while the delegate worked: leave it alone.
   _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState));
   return false;
 }
 
+// What one exchange primitive call gave back; the output buffer is the primitive's malloc'd one.
+struct TarvexSAPSession::Exchanged {
+  int32_t status = 0;
+  uint8_t returnCode = 255;
+  std::unique_ptr<uint8_t, FreeBytes> out;
+  uint32_t outLength = 0;
+};
+
+TarvexSAPSession::Exchanged TarvexSAPSession::_exchange(const Data& input) {
+  Exchanged result;
+  uint8_t* out = nullptr;
+  result.status = primitives_.exchange(kTarvexSAPExchangeSelector, &hwInfo_, sessionContext_, input.bytes(),
+                                       input.length(), &out, &result.outLength, &result.returnCode);
+  result.out.reset(out);
+  return result;
+}
+
 void TarvexSAPSession::_receivedCertificate(uint64_t generation, std::optional<Data> certificate,
                                             std::optional<Error> error, OpenCompletion completion) {
-  if (!_stillOpening(generation, 2, completion)) return;
+  if (!_stillOpening(generation, Step::WaitingForCertificate, completion)) return;
   if (error) {
     platform::log(LogLevel::Error, "[#TarvexSAPSession] Error requesting certificate: %@", error);
-    _close();
-    _complete(completion, std::move(error));
-    return;
+    return _failOpen(completion, std::move(*error));
   }
   if (!certificate || certificate->empty()) {
     platform::log(LogLevel::Default, "[#TarvexSAPSession] Invalid certificate received!");
-    _close();
-    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
-    return;
+    return _failOpen(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
   }
   platform::log(LogLevel::Info, "[#TarvexSAPSession] Received certificate!");
-  setState_int(3);
+  setStep(Step::GeneratingHandshakeRequest);
 
-  uint8_t* out = nullptr;
-  uint32_t outLength = 0;
-  uint8_t returnCode = 255;
-  int32_t status = primitives_.exchange(kTarvexSAPExchangeSelector, &hwInfo_, sessionContext_, certificate->bytes(),
-                                        certificate->length(), &out, &outLength, &returnCode);
-  if (status != 0 || returnCode != 1 || !out || outLength == 0) {
+  Exchanged request = _exchange(*certificate);
+  if (request.status != 0 || request.returnCode != 1 || !request.out || request.outLength == 0) {
     platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not generate handshake request data! (status: %d, returnCode: %d)",
-                  status, returnCode);
-    std::free(out);
-    _close();
-    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
-    return;
+                  request.status, request.returnCode);
+    return _failOpen(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
   }
-  Data request = Data::adoptMalloc(out, outLength);
-  setState_int(4);
-  delegateQueue_->async([self = shared_from_this(), generation, completion, request] {
-    auto delegate = self->delegate_.lock();
-    if (!delegate) return;
-    delegate->sessionRequestHandshakeWithServerCompletionHandler(
-        *self, request, firstAnswerOnly([self, generation, completion](std::optional<Data> response, std::optional<Error> error) {
-          self->internalQueue_->async([self, generation, completion, response = std::move(response),
-                                       error = std::move(error)]() mutable {
-            self->_receivedHandshake(generation, std::move(response), std::move(error), completion);
-          });
-        }));
-  });
+  Data body = Data::adoptMalloc(request.out.release(), request.outLength);
+  setStep(Step::WaitingForHandshakeResponse);
+  _askDelegate(
+      generation, completion,
+      [body](TarvexSAPSessionDelegate& delegate, TarvexSAPSession& self, TarvexSAPDataCompletion answer) {
+        delegate.sessionRequestHandshakeWithServerCompletionHandler(self, body, std::move(answer));
+      },
+      &TarvexSAPSession::_receivedHandshake);
 }
 
 void TarvexSAPSession::_receivedHandshake(uint64_t generation, std::optional<Data> response, std::optional<Error> error,
                                           OpenCompletion completion) {
-  if (!_stillOpening(generation, 4, completion)) return;
+  if (!_stillOpening(generation, Step::WaitingForHandshakeResponse, completion)) return;
   if (error) {
     platform::log(LogLevel::Error, "[#TarvexSAPSession] Error requesting handshake: %@", error);
-    _close();
-    _complete(completion, std::move(error));
-    return;
+    return _failOpen(completion, std::move(*error));
   }
   if (!response) {
     platform::log(LogLevel::Default, "[#TarvexSAPSession] Invalid handshake response received!");
-    _close();
-    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
-    return;
+    return _failOpen(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
   }
   platform::log(LogLevel::Info, "[#TarvexSAPSession] Received handshake response!");
-  setState_int(5);
+  setStep(Step::ProcessingHandshakeResponse);
 
-  uint8_t* out = nullptr;
-  uint32_t outLength = 0;
-  uint8_t returnCode = 255;
-  int32_t status = primitives_.exchange(kTarvexSAPExchangeSelector, &hwInfo_, sessionContext_, response->bytes(),
-                                        response->length(), &out, &outLength, &returnCode);
-  std::free(out);  // nothing follows the handshake: any output is unread
-  // One round trip only: a primitive that wants another round has failed.
-  if (status == 0 && returnCode == 0) {
-    setState_int(kStateOpen);
+  // Nothing follows the handshake, so any output is unread; and one round trip only: a primitive
+  // that wants another round has failed.
+  Exchanged done = _exchange(*response);
+  if (done.status == 0 && done.returnCode == 0) {
+    setStep(Step::Open);
     _complete(completion, std::nullopt);
     return;
   }
-  platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not process handshake response! (status: %d, returnCode: %d)", status,
-                returnCode);
-  _close();
-  _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
+  platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not process handshake response! (status: %d, returnCode: %d)",
+                done.status, done.returnCode);
+  _failOpen(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
 }
 
 void TarvexSAPSession::close() {
@@ -276,21 +287,21 @@ void TarvexSAPSession::signatureForData(const std::optional<Value>& data, SignCo
       reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
       return;
     }
-    if (self->state_int_ != kStateOpen) {
+    if (self->step_ != Step::Open) {
       reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to generate signature."));
       return;
     }
     const Data& bytes = *data->data();
-    uint8_t* signature = nullptr;
+    uint8_t* raw = nullptr;
     uint32_t signatureLength = 0;
-    int32_t status = self->primitives_.sign(self->sessionContext_, bytes.bytes(), bytes.length(), &signature, &signatureLength);
+    int32_t status = self->primitives_.sign(self->sessionContext_, bytes.bytes(), bytes.length(), &raw, &signatureLength);
+    std::unique_ptr<uint8_t, FreeBytes> signature(raw);
     if (status != 0) {
       platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not generate signature! (status: %d)", status);
-      std::free(signature);
       reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
       return;
     }
-    reply(Data::adoptMalloc(signature, signatureLength), std::nullopt);
+    reply(Data::adoptMalloc(signature.release(), signatureLength), std::nullopt);
   });
 }
 
@@ -316,7 +327,7 @@ void TarvexSAPSession::verifySignature(const std::optional<Value>& signature, co
       reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
       return;
     }
-    if (self->state_int_ != kStateOpen) {
+    if (self->step_ != Step::Open) {
       reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to verify signature."));
       return;
     }
@@ -338,10 +349,11 @@ TarvexSAPSessionState TarvexSAPSession::state() {
   TarvexSAPSessionState result = TarvexSAPSessionStateClosed;
   internalQueue_->sync([&] {
     _checkExpiration();
-    static const TarvexSAPSessionState publicStates[] = {TarvexSAPSessionStateInitializing, TarvexSAPSessionStateInitializing,
-                                                         TarvexSAPSessionStateInitializing, TarvexSAPSessionStateInitializing,
-                                                         TarvexSAPSessionStateInitializing, TarvexSAPSessionStateOpen};
-    if (state_int_ >= 1 && state_int_ <= kStateOpen) result = publicStates[state_int_ - 1];
+    // Every step between closed and open is one public state: initializing.
+    if (step_ == Step::Open)
+      result = TarvexSAPSessionStateOpen;
+    else if (step_ != Step::Closed)
+      result = TarvexSAPSessionStateInitializing;
   });
   return result;
 }
@@ -349,7 +361,7 @@ TarvexSAPSessionState TarvexSAPSession::state() {
 double TarvexSAPSession::TTL() {
   double ttl = 0.0;
   internalQueue_->sync([&] {
-    if (state_int_ == kStateOpen) ttl = _secondsUntilExpiration();
+    if (step_ == Step::Open) ttl = _secondsUntilExpiration();
   });
   return ttl;
 }

@@ -65,8 +65,19 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   const std::shared_ptr<platform::Queue>& internalQueue() const { return internalQueue_; }
   const std::shared_ptr<platform::Queue>& delegateQueue() const { return delegateQueue_; }
 
-  // Internal state 0..6, readable on the internal queue only (and by tests through it).
-  uint64_t state_int() const { return state_int_; }
+  // The steps of the session's life; the numbers are what the log and the tests know them by.
+  enum class Step : uint64_t {
+    Closed = 0,
+    Initialized = 1,
+    WaitingForCertificate = 2,
+    GeneratingHandshakeRequest = 3,
+    WaitingForHandshakeResponse = 4,
+    ProcessingHandshakeResponse = 5,
+    Open = 6,
+  };
+  // The current step as its number, readable on the internal queue only (and by tests through it).
+  uint64_t state_int() const { return static_cast<uint64_t>(step_); }
+  // "[Waiting For Certificate]" and so on; nullopt for a number that is no step.
   static std::optional<std::string> stateName(uint64_t state_int);
 
  private:
@@ -77,21 +88,29 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
 
  private:
   // All of these run on the internal queue.
-  void setState_int(uint64_t value);
+  using Continuation = void (TarvexSAPSession::*)(uint64_t generation, std::optional<platform::Data> answer,
+                                                  std::optional<platform::Error> error, OpenCompletion completion);
+  using DelegateLeg = std::function<void(TarvexSAPSessionDelegate&, TarvexSAPSession&, TarvexSAPDataCompletion)>;
+  struct Exchanged;
+
+  void setStep(Step step);
   void _close();
   void _checkExpiration();
   void _open(OpenCompletion completion);
+  void _askDelegate(uint64_t generation, OpenCompletion completion, DelegateLeg leg, Continuation next);
   void _receivedCertificate(uint64_t generation, std::optional<platform::Data> certificate,
                             std::optional<platform::Error> error, OpenCompletion completion);
   void _receivedHandshake(uint64_t generation, std::optional<platform::Data> response,
                           std::optional<platform::Error> error, OpenCompletion completion);
-  bool _stillOpening(uint64_t generation, uint64_t expectedState, const OpenCompletion& completion);
+  Exchanged _exchange(const platform::Data& input);
+  bool _stillOpening(uint64_t generation, Step expected, const OpenCompletion& completion);
+  void _failOpen(const OpenCompletion& completion, platform::Error error);
   void _complete(const OpenCompletion& completion, std::optional<platform::Error> error);
   double _secondsUntilExpiration() const;
 
   std::weak_ptr<TarvexSAPSessionDelegate> delegate_;
   const platform::UUID uuid_;
-  uint64_t state_int_ = 0;
+  Step step_ = Step::Closed;
   std::shared_ptr<platform::Queue> completionQueue_;
   std::shared_ptr<platform::Queue> internalQueue_;
   std::shared_ptr<platform::Queue> delegateQueue_;
