@@ -1,8 +1,5 @@
 #include "client/bus_caller.h"
 
-#include <sys/eventfd.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <cstring>
 #include <future>
@@ -12,26 +9,20 @@
 
 namespace zlka_client {
 
-struct BusCaller::Pending {
-  BusCaller* owner;
-  sd_bus_slot* slot = nullptr;
-  ReplyHandler handler;
-};
-
 namespace {
 
 platform::Error cancelled() {
   return clientError(ClientErrorCode::Cancelled, "The client was closed before the service answered.");
 }
 
-int openBus(const std::string& where, sd_bus** bus) {
-  if (where == "system") return sd_bus_open_system(bus);
-  if (where == "session") return sd_bus_open_user(bus);
-  int r = sd_bus_new(bus);
-  if (r < 0) return r;
-  if ((r = sd_bus_set_address(*bus, where.c_str())) < 0) return r;
-  if ((r = sd_bus_set_bus_client(*bus, 1)) < 0) return r;
-  return sd_bus_start(*bus);
+int openBus(const std::string& where, platform::BusPtr& bus) {
+  sd_bus* made = nullptr;
+  int r = where == "system" ? sd_bus_open_system(&made) : where == "session" ? sd_bus_open_user(&made) : sd_bus_new(&made);
+  bus.reset(made);
+  if (r < 0 || where == "system" || where == "session") return r;
+  if ((r = sd_bus_set_address(made, where.c_str())) < 0) return r;
+  if ((r = sd_bus_set_bus_client(made, 1)) < 0) return r;
+  return sd_bus_start(made);
 }
 
 std::string busLabel(const std::string& where) {
@@ -46,19 +37,18 @@ platform::Error encodingFailure(int r) {
 }  // namespace
 
 Result<std::shared_ptr<BusCaller>> BusCaller::open(const std::string& where, std::chrono::microseconds callTimeout) {
-  sd_bus* bus = nullptr;
-  int r = openBus(where, &bus);
+  platform::BusPtr bus;
+  int r = openBus(where, bus);
   const char* unique = nullptr;
   // The name comes with the bus's answer to Hello: a bus that does not accept us fails here.
-  if (r >= 0) r = sd_bus_get_unique_name(bus, &unique);
+  if (r >= 0) r = sd_bus_get_unique_name(bus.get(), &unique);
   if (r < 0) {
-    sd_bus_flush_close_unref(bus);
     // sd-bus says "No medium found" when it has no address for the session bus at all.
     std::string reason = where == "session" && r == -ENOMEDIUM ? "no session bus (DBUS_SESSION_BUS_ADDRESS and XDG_RUNTIME_DIR are unset)"
                                                               : std::strerror(-r);
     return clientError(ClientErrorCode::ConnectionFailed, "Cannot connect to " + busLabel(where) + ": " + reason + ".");
   }
-  std::shared_ptr<BusCaller> caller(new BusCaller(bus, callTimeout));
+  std::shared_ptr<BusCaller> caller(new BusCaller(std::move(bus), callTimeout));
   if ((r = caller->start()) < 0)
     return clientError(ClientErrorCode::ConnectionFailed, std::string("Cannot start the client's event loop: ") + std::strerror(-r) + ".");
   caller->thread_ = std::thread([self = caller] { self->run(); });
@@ -66,45 +56,37 @@ Result<std::shared_ptr<BusCaller>> BusCaller::open(const std::string& where, std
   return caller;
 }
 
-BusCaller::BusCaller(sd_bus* bus, std::chrono::microseconds callTimeout)
-    : bus_(bus), timeoutUsec_(static_cast<uint64_t>(callTimeout.count() > 0 ? callTimeout.count() : 1)) {}
+BusCaller::BusCaller(platform::BusPtr bus, std::chrono::microseconds callTimeout)
+    : bus_(std::move(bus)), timeoutUsec_(static_cast<uint64_t>(callTimeout.count() > 0 ? callTimeout.count() : 1)) {}
 
 BusCaller::~BusCaller() {
-  // The thread, if it ever ran, has released everything in finish(); this covers a failed start.
+  // The thread, if it ever ran, has released the bus in finish(); this covers a failed start.
   if (thread_.joinable()) thread_.detach();
-  sd_event_source_unref(wakeSource_);
-  if (bus_) {
-    sd_bus_detach_event(bus_);
-    sd_bus_flush_close_unref(bus_);
-  }
-  sd_event_unref(event_);
-  if (wakeFd_ >= 0) ::close(wakeFd_);
 }
 
 int BusCaller::start() {
-  int r = sd_event_new(&event_);
+  sd_event* event = nullptr;
+  int r = sd_event_new(&event);
+  event_.reset(event);
   if (r < 0) return r;
-  if ((wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) < 0) return -errno;
-  if ((r = sd_event_add_io(event_, &wakeSource_, wakeFd_, EPOLLIN, &BusCaller::onWake, this)) < 0) return r;
-  return sd_bus_attach_event(bus_, event_, SD_EVENT_PRIORITY_NORMAL);
+  if ((r = mailbox_.attach(event)) < 0) return r;
+  return sd_bus_attach_event(bus_.get(), event, SD_EVENT_PRIORITY_NORMAL);
 }
 
-bool BusCaller::post(Job job) {
-  {
-    std::lock_guard lock(mutex_);
-    if (closing_) return false;
-    jobs_.push_back(std::move(job));
-  }
-  uint64_t one = 1;
-  // The counter cannot overflow in practice; a failed write would only leave a wake-up pending.
-  [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
-  return true;
+bool BusCaller::post(std::function<void(bool closing)> job) {
+  return mailbox_.post([this, job = std::move(job)] { job(mailbox_.isClosed()); });
+}
+
+// Refused while closing, only a handler on the event thread can still be calling; otherwise memory
+// ran out. Either way the caller's handler runs at once with this.
+platform::Error BusCaller::postFailure() const {
+  return mailbox_.isClosed() ? cancelled() : errorFromSendFailure(-ENOMEM);
 }
 
 void BusCaller::callAsync(std::string method, ArgumentWriter write, ReplyHandler handler) {
   auto shared = std::make_shared<ReplyHandler>(std::move(handler));
-  bool queued = post([this, method = std::move(method), write = std::move(write), shared](bool isCancelled) {
-    if (isCancelled) {
+  bool queued = post([this, method = std::move(method), write = std::move(write), shared](bool closing) {
+    if (closing) {
       platform::Error error = cancelled();
       (*shared)(nullptr, &error);
     } else {
@@ -112,8 +94,7 @@ void BusCaller::callAsync(std::string method, ArgumentWriter write, ReplyHandler
     }
   });
   if (!queued) {
-    // Closing: only a handler on the event thread can still be calling, so this is that thread.
-    platform::Error error = cancelled();
+    platform::Error error = postFailure();
     (*shared)(nullptr, &error);
   }
 }
@@ -125,12 +106,7 @@ void BusCaller::failAsync(platform::Error error, ReplyHandler handler) {
 
 void BusCaller::callAndWait(const std::string& method, const ArgumentWriter& write, const ReplyHandler& handler) {
   if (onEventThread()) {
-    bool isClosing;
-    {
-      std::lock_guard lock(mutex_);
-      isClosing = closing_;
-    }
-    if (isClosing) {
+    if (mailbox_.isClosed()) {
       platform::Error error = cancelled();
       return handler(nullptr, &error);
     }
@@ -142,8 +118,8 @@ void BusCaller::callAndWait(const std::string& method, const ArgumentWriter& wri
     handler(reply, error);
     done.set_value();
   };
-  bool queued = post([this, &method, &write, &signal](bool isCancelled) {
-    if (isCancelled) {
+  bool queued = post([this, &method, &write, &signal](bool closing) {
+    if (closing) {
       platform::Error error = cancelled();
       signal(nullptr, &error);
     } else {
@@ -151,68 +127,57 @@ void BusCaller::callAndWait(const std::string& method, const ArgumentWriter& wri
     }
   });
   if (!queued) {
-    platform::Error error = cancelled();
+    platform::Error error = postFailure();
     return handler(nullptr, &error);
   }
   answered.wait();
 }
 
+Result<platform::BusMessagePtr> BusCaller::newCall(const std::string& method, const ArgumentWriter& write) {
+  sd_bus_message* made = nullptr;
+  int r = sd_bus_message_new_method_call(bus_.get(), &made, kServiceName, kObjectPath, kInterfaceName, method.c_str());
+  platform::BusMessagePtr call(made);
+  if (r < 0) return errorFromSendFailure(r);
+  if ((r = write(call.get())) < 0) return encodingFailure(r);
+  return call;
+}
+
 void BusCaller::send(const std::string& method, const ArgumentWriter& write, ReplyHandler handler) {
-  sd_bus_message* call = nullptr;
-  int r = sd_bus_message_new_method_call(bus_, &call, kServiceName, kObjectPath, kInterfaceName, method.c_str());
+  Result<platform::BusMessagePtr> call = newCall(method, write);
+  if (!call) return handler(nullptr, &call.error());
+  uint64_t id = ++lastId_;
+  Pending& pending = pending_.emplace(id, Pending{this, id, nullptr, std::move(handler)}).first->second;
+  sd_bus_slot* slot = nullptr;
+  int r = sd_bus_call_async(bus_.get(), &slot, call.value().get(), &BusCaller::onReply, &pending, timeoutUsec_);
+  pending.slot.reset(slot);
   if (r < 0) {
+    ReplyHandler failed = std::move(pending.handler);
+    pending_.erase(id);
     platform::Error error = errorFromSendFailure(r);
-    return handler(nullptr, &error);
+    failed(nullptr, &error);
   }
-  if ((r = write(call)) < 0) {
-    sd_bus_message_unref(call);
-    platform::Error error = encodingFailure(r);
-    return handler(nullptr, &error);
-  }
-  auto* pending = new Pending{this, nullptr, std::move(handler)};
-  r = sd_bus_call_async(bus_, &pending->slot, call, &BusCaller::onReply, pending, timeoutUsec_);
-  sd_bus_message_unref(call);
-  if (r < 0) {
-    ReplyHandler failed = std::move(pending->handler);
-    delete pending;
-    platform::Error error = errorFromSendFailure(r);
-    return failed(nullptr, &error);
-  }
-  pending_.insert(pending);
 }
 
 void BusCaller::sendAndWait(const std::string& method, const ArgumentWriter& write, const ReplyHandler& handler) {
-  sd_bus_message* call = nullptr;
-  int r = sd_bus_message_new_method_call(bus_, &call, kServiceName, kObjectPath, kInterfaceName, method.c_str());
+  Result<platform::BusMessagePtr> call = newCall(method, write);
+  if (!call) return handler(nullptr, &call.error());
+  platform::BusErrorGuard busError;
+  sd_bus_message* answer = nullptr;
+  int r = sd_bus_call(bus_.get(), call.value().get(), timeoutUsec_, &busError.error, &answer);
+  platform::BusMessagePtr reply(answer);
   if (r < 0) {
-    platform::Error error = errorFromSendFailure(r);
+    const sd_bus_error& e = busError.error;
+    platform::Error error = sd_bus_error_is_set(&e) ? errorFromBusError(e.name, e.message ? e.message : "") : errorFromSendFailure(r);
     return handler(nullptr, &error);
   }
-  if ((r = write(call)) < 0) {
-    sd_bus_message_unref(call);
-    platform::Error error = encodingFailure(r);
-    return handler(nullptr, &error);
-  }
-  sd_bus_error busError{};  // no error yet
-  sd_bus_message* reply = nullptr;
-  r = sd_bus_call(bus_, call, timeoutUsec_, &busError, &reply);
-  sd_bus_message_unref(call);
-  if (r < 0) {
-    platform::Error error = sd_bus_error_is_set(&busError) ? errorFromBusError(busError.name, busError.message ? busError.message : "")
-                                                           : errorFromSendFailure(r);
-    sd_bus_error_free(&busError);
-    return handler(nullptr, &error);
-  }
-  handler(reply, nullptr);
-  sd_bus_message_unref(reply);
+  handler(reply.get(), nullptr);
 }
 
 int BusCaller::onReply(sd_bus_message* reply, void* userdata, sd_bus_error*) noexcept {
   auto* pending = static_cast<Pending*>(userdata);
-  pending->owner->pending_.erase(pending);
   ReplyHandler handler = std::move(pending->handler);
-  sd_bus_slot_unref(pending->slot);  // sd-bus holds its own reference while this runs
-  delete pending;
+  uint64_t id = pending->id;
+  pending->owner->pending_.erase(id);  // releases the slot; sd-bus holds its own reference while this runs
   if (sd_bus_message_is_method_error(reply, nullptr)) {
     const sd_bus_error* e = sd_bus_message_get_error(reply);
     platform::Error error = errorFromBusError(e && e->name ? e->name : "", e && e->message ? e->message : "");
@@ -223,66 +188,29 @@ int BusCaller::onReply(sd_bus_message* reply, void* userdata, sd_bus_error*) noe
   return 0;
 }
 
-int BusCaller::onWake(sd_event_source*, int fd, uint32_t, void* userdata) noexcept {
-  auto* self = static_cast<BusCaller*>(userdata);
-  uint64_t count = 0;
-  [[maybe_unused]] ssize_t n = ::read(fd, &count, sizeof count);
-  std::deque<Job> jobs;
-  bool stop;
-  {
-    std::lock_guard lock(self->mutex_);
-    jobs.swap(self->jobs_);
-    stop = self->closing_;
-  }
-  for (Job& job : jobs) job(stop);
-  if (stop) sd_event_exit(self->event_, 0);
-  return 0;
-}
-
 void BusCaller::run() {
-  sd_event_loop(event_);
+  sd_event_loop(event_.get());
   finish();
 }
 
 void BusCaller::finish() {
-  // Whatever is still queued or unanswered gets Cancelled; handlers may call again, and are then
-  // answered at once, so this ends.
-  for (;;) {
-    std::deque<Job> jobs;
-    {
-      std::lock_guard lock(mutex_);
-      closing_ = true;
-      jobs.swap(jobs_);
-    }
-    std::unordered_set<Pending*> pending;
-    pending.swap(pending_);
-    if (jobs.empty() && pending.empty()) break;
-    for (Job& job : jobs) job(true);
-    for (Pending* p : pending) {
-      ReplyHandler handler = std::move(p->handler);
-      sd_bus_slot_unref(p->slot);
-      delete p;
-      platform::Error error = cancelled();
-      handler(nullptr, &error);
-    }
+  // Whatever is still queued or unanswered gets Cancelled. Handlers may call again: the mailbox is
+  // closed by then, so those calls are cancelled at once and nothing new waits for an answer.
+  mailbox_.drain();
+  std::unordered_map<uint64_t, Pending> pending;
+  pending.swap(pending_);
+  for (auto& [id, p] : pending) {
+    ReplyHandler handler = std::move(p.handler);
+    p.slot.reset();
+    platform::Error error = cancelled();
+    handler(nullptr, &error);
   }
-  wakeSource_ = sd_event_source_unref(wakeSource_);
-  sd_bus_detach_event(bus_);
-  bus_ = sd_bus_flush_close_unref(bus_);
-  event_ = sd_event_unref(event_);
-  ::close(wakeFd_);
-  wakeFd_ = -1;
+  sd_bus_detach_event(bus_.get());
+  bus_.reset();
 }
 
 void BusCaller::close() {
-  {
-    std::lock_guard lock(mutex_);
-    if (closing_) return;
-    closing_ = true;
-  }
-  uint64_t one = 1;
-  [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
-  if (!thread_.joinable()) return;
+  if (!mailbox_.close() || !thread_.joinable()) return;
   if (onEventThread()) thread_.detach();
   else thread_.join();
 }

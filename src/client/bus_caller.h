@@ -2,26 +2,28 @@
 // method calls to the daemon's object and hands each answer to a handler on that thread.
 //
 // sd-bus objects are not thread-safe, so the connection is touched only on the event thread:
-// calls from other threads are queued to it (through an eventfd). Every call's handler runs exactly
-// once, on the event thread: with the reply, or with an error (a D-Bus error reply, a send failure,
-// the timeout, or Cancelled when the caller is closed first). A blocking call made on the event
-// thread itself (from a handler) is sent with sd_bus_call there, holding up other answers until it
-// returns; from any other thread it waits for its handler to have run.
+// calls from other threads are queued to it (through a platform::LoopMailbox). Every call's handler
+// runs exactly once, on the event thread: with the reply, or with an error (a D-Bus error reply, a
+// send failure, the timeout, or Cancelled when the caller is closed first). Only a call that cannot
+// be queued for want of memory has its handler run at once on the calling thread, with that error.
+// A blocking call made on the event thread itself (from a handler) is sent with sd_bus_call there,
+// holding up other answers until it returns; from any other thread it waits for its handler to have
+// run.
 #pragma once
 
 #include <systemd/sd-bus.h>
 #include <systemd/sd-event.h>
 
 #include <chrono>
-#include <deque>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
-#include <unordered_set>
+#include <unordered_map>
 
 #include "client/result.h"
+#include "platform/bus/handles.h"
+#include "platform/bus/loop_mailbox.h"
 
 namespace zlka_client {
 
@@ -50,30 +52,34 @@ class BusCaller : public std::enable_shared_from_this<BusCaller> {
   bool onEventThread() const { return std::this_thread::get_id() == threadId_; }
 
  private:
-  struct Pending;
-  using Job = std::function<void(bool cancelled)>;
+  struct Pending {
+    BusCaller* owner;
+    uint64_t id;
+    platform::BusSlotPtr slot;
+    ReplyHandler handler;
+  };
 
-  BusCaller(sd_bus* bus, std::chrono::microseconds callTimeout);
+  BusCaller(platform::BusPtr bus, std::chrono::microseconds callTimeout);
   int start();
-  bool post(Job job);
+  // Queues `job` for the event thread, where it learns whether the caller is closing (and its call
+  // is then cancelled). False when it cannot be queued; the job is then dropped unrun.
+  bool post(std::function<void(bool closing)> job);
+  platform::Error postFailure() const;
   void run();
   void finish();
+  Result<platform::BusMessagePtr> newCall(const std::string& method, const ArgumentWriter& write);
   void send(const std::string& method, const ArgumentWriter& write, ReplyHandler handler);
   void sendAndWait(const std::string& method, const ArgumentWriter& write, const ReplyHandler& handler);
-  static int onWake(sd_event_source* source, int fd, uint32_t events, void* userdata) noexcept;
   static int onReply(sd_bus_message* reply, void* userdata, sd_bus_error* error) noexcept;
 
-  sd_bus* bus_ = nullptr;
-  sd_event* event_ = nullptr;
-  sd_event_source* wakeSource_ = nullptr;
-  int wakeFd_ = -1;
+  // Declared in the order they depend on each other, so that they are released in reverse.
+  platform::EventPtr event_;
+  platform::BusPtr bus_;
+  platform::LoopMailbox mailbox_;
   uint64_t timeoutUsec_;
 
-  std::mutex mutex_;  // guards jobs_ and closing_
-  std::deque<Job> jobs_;
-  bool closing_ = false;
-
-  std::unordered_set<Pending*> pending_;  // event thread only
+  std::unordered_map<uint64_t, Pending> pending_;  // event thread only; nodes stay put for sd-bus
+  uint64_t lastId_ = 0;
   std::thread thread_;
   std::thread::id threadId_;
 };

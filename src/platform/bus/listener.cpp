@@ -2,10 +2,10 @@
 #include "platform/bus/listener.h"
 
 #include <signal.h>
-#include <sys/eventfd.h>
 #include <sys/signalfd.h>
 #include <systemd/sd-daemon.h>
-#include <unistd.h>
+
+#include <cstring>
 
 #include "platform/bus/listener_core.h"
 
@@ -33,10 +33,7 @@ int Listener::Core::run() {
   if (rc < 0) return fail("cannot connect to the " + options_.bus + " bus", rc);
   rc = sd_bus_attach_event(bus_.get(), event_.get(), SD_EVENT_PRIORITY_NORMAL);
   if (rc < 0) return fail("cannot attach the bus to the event loop", rc);
-  wakeFd_.reset(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
-  if (!wakeFd_) return fail("cannot create an eventfd", -errno);
-  if ((rc = addSource(sd_event_add_io, wakeFd_.get(), EPOLLIN, &Guarded<&Core::onPosted>::call)) < 0)
-    return fail("cannot watch the eventfd", rc);
+  if ((rc = mailbox_.attach(event_.get())) < 0) return fail("cannot watch the mailbox of the event loop", rc);
   for (int sig : {SIGTERM, SIGINT, SIGHUP})
     if ((rc = addSource(sd_event_add_signal, sig, &Guarded<&Core::onSignal>::call)) < 0)
       return fail("cannot handle signals (call Listener::blockSignals() first)", rc);
@@ -46,10 +43,7 @@ int Listener::Core::run() {
                                 vtable_.data(), this);
   vtableSlot_.reset(slot);
   if (rc < 0) return fail("cannot export " + options_.objectPath, rc);
-  rc = sd_bus_match_signal(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
-                           "NameOwnerChanged", &Guarded<&Core::onNameOwnerChanged>::call, this);
-  matchSlot_.reset(slot);
-  if (rc < 0) return fail("cannot watch peers leaving the bus", rc);
+  if ((rc = peers_.watch(bus_.get())) < 0) return fail("cannot watch peers leaving the bus", rc);
   rc = sd_bus_request_name(bus_.get(), options_.serviceName.c_str(), 0);
   if (rc < 0) return fail("cannot own the name " + options_.serviceName, rc);
   lastActivity_ = now();
@@ -58,47 +52,16 @@ int Listener::Core::run() {
   if (options_.notifyReady) sd_notify(0, "READY=1\nSTATUS=Serving requests");
   rc = sd_event_loop(event_.get());
   if (options_.notifyReady) sd_notify(0, "STOPPING=1");
+  // Answers handed over as the loop ended still go out, and a call left open (the loop failed) is
+  // answered rather than left waiting.
+  mailbox_.drain();
+  if (size_t left = ledger_.failAll(BusError{kBusErrorNoServer, "The service shut down before the operation finished."}))
+    log(LogLevel::Error, "Messaging: the event loop ended with %zu call(s) unanswered", left);
   return rc < 0 ? 1 : rc;
-}
-
-// Runs `work` on the bus thread. Fails only for want of memory, and then drops the work.
-void Listener::Core::post(std::function<void()> work) noexcept {
-  try {
-    std::lock_guard lock(postMutex_);
-    posted_.push_back(std::move(work));
-  } catch (const std::exception& e) {
-    log(LogLevel::Error, "Messaging: cannot hand work to the bus thread: %s", e.what());
-    return;
-  }
-  uint64_t one = 1;
-  if (::write(wakeFd_.get(), &one, sizeof one) < 0) {
-    // The counter saturating still wakes the loop; nothing else can go wrong here.
-  }
 }
 
 void Listener::Core::requestStop() {
   post([self = shared_from_this()] { self->beginDrain("stop requested"); });
-}
-
-int Listener::Core::onPosted(sd_event_source*, int fd, uint32_t, void* userdata) {
-  auto* self = static_cast<Core*>(userdata);
-  uint64_t count = 0;
-  if (::read(fd, &count, sizeof count) < 0) {
-    // Spurious wake-up: nothing to read, nothing to do.
-  }
-  std::vector<std::function<void()>> work;
-  {
-    std::lock_guard lock(self->postMutex_);
-    work.swap(self->posted_);
-  }
-  for (auto& w : work) {
-    try {
-      w();
-    } catch (const std::exception& e) {
-      log(LogLevel::Error, "Messaging: work on the bus thread failed: %s", e.what());
-    }
-  }
-  return 0;
 }
 
 int Listener::Core::onSignal(sd_event_source*, const struct signalfd_siginfo* info, void* userdata) {
@@ -115,10 +78,10 @@ int Listener::Core::onSignal(sd_event_source*, const struct signalfd_siginfo* in
 void Listener::Core::beginDrain(const std::string& why) {
   if (draining_) return;
   draining_ = true;
-  log(LogLevel::Default, "Shutting down (%s) with %zu call(s) in flight", why, inFlight_.load());
+  log(LogLevel::Default, "Shutting down (%s) with %zu call(s) in flight", why, ledger_.open());
   if (options_.notifyReady) sd_notify(0, "STOPPING=1");
   sd_bus_release_name(bus_.get(), options_.serviceName.c_str());
-  if (inFlight_.load() == 0) {
+  if (ledger_.open() == 0) {
     sd_event_exit(event_.get(), 0);
     return;
   }
@@ -128,15 +91,8 @@ void Listener::Core::beginDrain(const std::string& why) {
 
 int Listener::Core::onDrainLimit(sd_event_source*, uint64_t, void* userdata) {
   auto* self = static_cast<Core*>(userdata);
-  log(LogLevel::Error, "Calls still in flight after the drain limit: failing %zu of them", self->pending_.size());
-  for (auto& [id, call] : self->pending_)
-    if (auto state = call.state.lock(); state && !state->done.exchange(true)) {
-      self->sendErrorNow(state->call,
-                         BusError{kBusErrorNoServer, "The service shut down before the operation finished."});
-      sd_bus_message_unref(state->call);
-      state->call = nullptr;
-    }
-  self->pending_.clear();
+  log(LogLevel::Error, "Calls still in flight after the drain limit: failing %zu of them", self->ledger_.open());
+  self->ledger_.failAll(BusError{kBusErrorNoServer, "The service shut down before the operation finished."});
   sd_event_exit(self->event_.get(), 0);
   return 0;
 }
@@ -155,7 +111,7 @@ int Listener::Core::onIdleTimer(sd_event_source*, uint64_t, void* userdata) {
   auto* self = static_cast<Core*>(userdata);
   uint64_t limit = toUsec(*self->options_.exitOnIdle);
   uint64_t t = self->now();
-  if (self->inFlight_.load() == 0 && t - self->lastActivity_ >= limit) {
+  if (self->ledger_.open() == 0 && t - self->lastActivity_ >= limit) {
     self->beginDrain("idle");
     return 0;
   }

@@ -1,5 +1,5 @@
-// The listener's bus endpoint and call ledger: the exported object, the calls that come in, and
-// exactly one answer to each.
+// The listener's bus endpoint: the exported object, the calls that come in, and the way each one's
+// answer travels back to the bus thread and into the ledger.
 #include <cstring>
 
 #include "platform/bus/listener_core.h"
@@ -57,27 +57,27 @@ int Listener::Core::onMethodCall(sd_bus_message* m, void* userdata, sd_bus_error
     return self->dispatch(m);
   } catch (const std::exception& e) {
     // Before its reply state exists (dispatch's last step), a call is answered here.
-    log(LogLevel::Error, "Cannot serve a call to %s: %s", memberOf(m), e.what());
-    self->sendErrorNow(m, BusError{kBusErrorFailed, "The service is short of resources; try again."});
+    log(LogLevel::Error, "Cannot serve a call to %s: %s", CallLedger::memberOf(m), e.what());
+    CallLedger::sendError(m, BusError{kBusErrorFailed, "The service is short of resources; try again."});
   }
   return 1;
 }
 
 int Listener::Core::dispatch(sd_bus_message* m) {
   const char* senderRaw = sd_bus_message_get_sender(m);
-  std::string member = memberOf(m);
+  std::string member = CallLedger::memberOf(m);
   if (draining_) {
-    sendErrorNow(m, BusError{kBusErrorNoServer, "The service is shutting down."});
+    CallLedger::sendError(m, BusError{kBusErrorNoServer, "The service is shutting down."});
     return 1;
   }
   if (!senderRaw) {
-    sendErrorNow(m, BusError{kBusErrorAccessDenied, "Calls must come through the bus."});
+    CallLedger::sendError(m, BusError{kBusErrorAccessDenied, "Calls must come through the bus."});
     return 1;
   }
-  Peer& peer = peerFor(senderRaw);
-  std::shared_ptr<Connection> connection = peer.connection;
+  std::string sender = senderRaw;
+  std::shared_ptr<Connection> connection = peers_.connectionFor(sender);
   if (!connection || !connection->isResumed()) {
-    sendErrorNow(m, BusError{kBusErrorAccessDenied, "The connection was not accepted."});
+    CallLedger::sendError(m, BusError{kBusErrorAccessDenied, "The connection was not accepted."});
     return 1;
   }
   std::shared_ptr<const Interface> interface = connection->exportedInterface();
@@ -86,7 +86,7 @@ int Listener::Core::dispatch(sd_bus_message* m) {
     for (const auto& candidate : interface->methods)
       if (candidate.name == member) method = &candidate;
   if (!method) {
-    sendErrorNow(m, BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
+    CallLedger::sendError(m, BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
     return 1;
   }
   DecodedCall decoded;
@@ -96,96 +96,60 @@ int Listener::Core::dispatch(sd_bus_message* m) {
     decoded.error = BusError{kBusErrorFailed, std::string("The call could not be decoded: ") + e.what()};
   }
   if (decoded.error || !decoded.invocation) {
-    sendErrorNow(m, decoded.error.value_or(BusError{kBusErrorFailed, "The call could not be decoded."}));
+    CallLedger::sendError(m, decoded.error.value_or(BusError{kBusErrorFailed, "The call could not be decoded."}));
     return 1;
   }
   auto state = std::make_shared<Reply::State>();
   state->core = weak_from_this();
-  state->id = ++nextId_;
-  pending_.emplace(state->id, PendingCall{state, senderRaw});
-  // From here on the call is answered exactly once through its state: dropped unanswered (as
-  // when it cannot be queued for want of memory), the state answers with an error itself.
-  state->call = sd_bus_message_ref(m);
-  inFlight_.fetch_add(1);
+  // From here on the call is answered exactly once through the ledger: dropped unanswered (as
+  // when it cannot be queued for want of memory), its state answers with an error itself.
+  state->id = ledger_.take(m, sender);
   lastActivity_ = now();
   Reply reply(state);
   try {
-    peer.backlog.emplace_back(std::move(decoded.invocation), reply);
-    pump(peer);
+    peers_.enqueue(sender, std::move(decoded.invocation), std::move(reply));
   } catch (const std::exception& e) {
     log(LogLevel::Error, "Cannot queue a call to %s: %s", member, e.what());
   }
   return 1;
 }
 
-std::string Listener::Core::memberOf(sd_bus_message* m) {
-  const char* member = sd_bus_message_get_member(m);
-  return member ? member : "?";
+void Listener::Core::sendReturn(uint64_t id, const Reply::Writer& writer) {
+  if (auto peer = ledger_.answer(id, writer)) finishCall(*peer);
 }
 
-// Bus thread: the answer to a call, then its bookkeeping.
-void Listener::Core::sendReturn(sd_bus_message* call, const Reply::Writer& writer, uint64_t id) {
-  sd_bus_message* made = nullptr;
-  int rc = sd_bus_message_new_method_return(call, &made);
-  BusMessagePtr reply(made);
-  if (rc >= 0 && writer) rc = writer(reply.get());
-  if (rc >= 0) rc = sd_bus_send(bus_.get(), reply.get(), nullptr);
-  if (rc < 0) {
-    log(LogLevel::Error, "Could not encode the answer to %s: %s", memberOf(call), std::string(strerror(-rc)));
-    sendErrorNow(call, BusError{kBusErrorFailed, "The answer could not be encoded."});
-  }
-  sd_bus_message_unref(call);
-  finishCall(id);
+void Listener::Core::sendError(uint64_t id, const BusError& error) {
+  if (auto peer = ledger_.fail(id, error)) finishCall(*peer);
 }
 
-void Listener::Core::sendError(sd_bus_message* call, const BusError& error, uint64_t id) {
-  sendErrorNow(call, error);
-  sd_bus_message_unref(call);
-  finishCall(id);
-}
-
-void Listener::Core::sendErrorNow(sd_bus_message* call, const BusError& error) {
-  sd_bus_error e{};  // no error yet
-  sd_bus_error_set(&e, error.name.c_str(), error.message.c_str());
-  sd_bus_reply_method_error(call, &e);
-  sd_bus_error_free(&e);
-}
-
-void Listener::Core::finishCall(uint64_t id) {
-  if (auto call = pending_.find(id); call != pending_.end()) {
-    if (auto peer = peers_.find(call->second.peer); peer != peers_.end()) {
-      --peer->second.working;
-      pump(peer->second);
-    }
-    pending_.erase(call);
-  }
-  inFlight_.fetch_sub(1);
+void Listener::Core::finishCall(const std::string& peer) {
+  peers_.finished(peer);
   lastActivity_ = now();
-  if (draining_ && inFlight_.load() == 0) sd_event_exit(event_.get(), 0);
+  if (draining_ && ledger_.open() == 0) sd_event_exit(event_.get(), 0);
 }
 
 Reply::State::~State() {
-  if (done.exchange(true) || !call) return;
-  // Dropped without an answer: the caller still gets one.
-  if (auto c = core.lock()) {
-    c->post([c, call = call, id = id] {
-      c->sendError(call, BusError{kBusErrorFailed, "The operation ended without an answer."}, id);
-    });
-  }
+  if (done.exchange(true) || id == 0) return;
+  // Dropped without an answer: the caller still gets one. Should even that not reach the bus
+  // thread, the call stays in the ledger, which answers it when the service shuts down.
+  if (auto c = core.lock())
+    c->post([c, id = id] { c->sendError(id, BusError{kBusErrorFailed, "The operation ended without an answer."}); });
 }
 
+// A reply that cannot be handed to the bus thread is not lost: it is taken back, and the state
+// answers with an error when its last copy goes.
 void Reply::send(Writer writer) const {
   if (state_->done.exchange(true)) return;
-  if (auto core = state_->core.lock())
-    core->post([core, call = state_->call, writer = std::move(writer), id = state_->id] {
-      core->sendReturn(call, writer, id);
-    });
+  auto core = state_->core.lock();
+  if (core && !core->post([core, writer = std::move(writer), id = state_->id] { core->sendReturn(id, writer); }))
+    state_->done = false;
 }
 
 void Reply::fail(BusError error) const {
   if (state_->done.exchange(true)) return;
-  if (auto core = state_->core.lock())
-    core->post(
-        [core, call = state_->call, error = std::move(error), id = state_->id] { core->sendError(call, error, id); });
+  auto core = state_->core.lock();
+  if (core && !core->post([core, error = std::move(error), id = state_->id] { core->sendError(id, error); }))
+    state_->done = false;
 }
+
 }  // namespace platform

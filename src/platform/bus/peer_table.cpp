@@ -1,17 +1,32 @@
-// The listener's peer table: who each peer is, and its calls waiting their turn.
+#include "platform/bus/peer_table.h"
+
 #include <fcntl.h>
 
 #include <cstring>
 
-#include "platform/bus/listener_core.h"
+#include "platform/bus/guarded.h"
+#include "platform/bus/listener.h"
+#include "platform/log/log.h"
 
 namespace platform {
 
-// The peer's entry, made at its first message. Nothing is recorded when making it fails (the
-// delegate may run out of threads or memory), so that the peer's next message tries again.
-Listener::Core::Peer& Listener::Core::peerFor(const std::string& sender) {
+PeerTable::PeerTable(Listener& owner, EntitlementsForPeer entitlementsForPeer, size_t maxCallsPerPeer)
+    : owner_(owner), entitlementsForPeer_(std::move(entitlementsForPeer)), maxCallsPerPeer_(maxCallsPerPeer) {}
+
+int PeerTable::watch(sd_bus* bus) {
+  bus_ = bus;
+  sd_bus_slot* slot = nullptr;
+  int rc = sd_bus_match_signal(bus, &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+                               "NameOwnerChanged", &Guarded<&PeerTable::onNameOwnerChanged>::call, this);
+  matchSlot_.reset(slot);
+  return rc;
+}
+
+// Nothing is recorded when making the entry fails (the delegate may run out of threads or memory),
+// so that the peer's next message tries again.
+std::shared_ptr<Connection> PeerTable::connectionFor(const std::string& sender) {
   auto it = peers_.find(sender);
-  if (it != peers_.end()) return it->second;
+  if (it != peers_.end()) return it->second.connection;
   Peer made;
   auto connection = std::make_shared<Connection>(sender);
   std::shared_ptr<ListenerDelegate> delegate = owner_.delegate();
@@ -19,45 +34,59 @@ Listener::Core::Peer& Listener::Core::peerFor(const std::string& sender) {
     made.connection = std::move(connection);
   if (made.connection) made.request = std::make_unique<CredentialsRequest>(CredentialsRequest{this, sender});
   Peer& peer = peers_.emplace(sender, std::move(made)).first->second;
-  connectionCount_.store(peers_.size());
-  if (!peer.connection) return peer;
+  count_.store(peers_.size());
+  if (!peer.connection) return nullptr;
   // Asked once, without waiting: the answer comes back to this thread like any other message.
   sd_bus_slot* slot = nullptr;
-  int rc = sd_bus_call_method_async(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus",
+  int rc = sd_bus_call_method_async(bus_, &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus",
                                     "org.freedesktop.DBus", "GetConnectionCredentials",
-                                    &Guarded<&Core::onCredentials>::call, peer.request.get(), "s", sender.c_str());
+                                    &Guarded<&PeerTable::onCredentials>::call, peer.request.get(), "s", sender.c_str());
   peer.credentialsCall.reset(slot);
   if (rc < 0) identify(peer, nullptr, std::string(strerror(-rc)));
-  return peer;
+  return peer.connection;
 }
 
-int Listener::Core::onCredentials(sd_bus_message* reply, void* userdata, sd_bus_error*) {
+void PeerTable::enqueue(const std::string& sender, MethodInvocation invocation, Reply reply) {
+  auto it = peers_.find(sender);
+  if (it == peers_.end()) return;
+  it->second.backlog.emplace_back(std::move(invocation), std::move(reply));
+  pump(it->second);
+}
+
+void PeerTable::finished(const std::string& sender) {
+  if (auto it = peers_.find(sender); it != peers_.end()) {
+    --it->second.working;
+    pump(it->second);
+  }
+}
+
+int PeerTable::onCredentials(sd_bus_message* reply, void* userdata, sd_bus_error*) {
   auto* request = static_cast<CredentialsRequest*>(userdata);
-  auto it = request->core->peers_.find(request->peer);
-  if (it == request->core->peers_.end()) return 0;
+  auto it = request->table->peers_.find(request->peer);
+  if (it == request->table->peers_.end()) return 0;
   const sd_bus_error* error = sd_bus_message_get_error(reply);
-  request->core->identify(it->second, error ? nullptr : reply, error && error->message ? error->message : "");
+  request->table->identify(it->second, error ? nullptr : reply, error && error->message ? error->message : "");
   return 0;
 }
 
 // Bus thread: the peer's identity is worked out first on its own queue (reading /proc may be
 // slow), then its waiting calls follow in order. Without credentials it holds no entitlements.
-void Listener::Core::identify(Peer& peer, sd_bus_message* credentialsReply, const std::string& error) {
+void PeerTable::identify(Peer& peer, sd_bus_message* credentialsReply, const std::string& error) {
   auto credentials = std::make_shared<std::optional<PeerCredentials>>();
   if (credentialsReply) *credentials = parseCredentials(credentialsReply);
   if (!*credentials)
     log(LogLevel::Error, "No credentials for peer %s%s%s: it holds no entitlements", peer.connection->peerName(),
         error.empty() ? "" : ": ", error);
-  else if (options_.entitlementsForPeer)
+  else if (entitlementsForPeer_)
     peer.connection->queue()->async(
-        [connection = peer.connection, credentials, identify = options_.entitlementsForPeer] {
+        [connection = peer.connection, credentials, identify = entitlementsForPeer_] {
           connection->setEntitlementLookup(identify(**credentials));
         });
   peer.identified = true;
   pump(peer);
 }
 
-std::optional<PeerCredentials> Listener::Core::parseCredentials(sd_bus_message* reply) {
+std::optional<PeerCredentials> PeerTable::parseCredentials(sd_bus_message* reply) {
   PeerCredentials c;
   bool haveUid = false, havePid = false;
   if (sd_bus_message_enter_container(reply, 'a', "{sv}") <= 0) return std::nullopt;
@@ -97,17 +126,19 @@ std::optional<PeerCredentials> Listener::Core::parseCredentials(sd_bus_message* 
   return c;
 }
 
-void Listener::Core::pump(Peer& peer) {
-  while (peer.identified && peer.working < options_.maxCallsPerPeer && !peer.backlog.empty()) {
-    auto& [invocation, reply] = peer.backlog.front();
-    schedule(peer.connection, std::move(invocation), std::move(reply));
+void PeerTable::pump(Peer& peer) {
+  while (peer.identified && peer.working < maxCallsPerPeer_ && !peer.backlog.empty()) {
+    // Out of the backlog and counted first: should scheduling fail, the reply answers for itself
+    // and its answer gives the turn back, as any other would.
+    auto [invocation, reply] = std::move(peer.backlog.front());
     peer.backlog.pop_front();
     ++peer.working;
+    schedule(peer.connection, std::move(invocation), std::move(reply));
   }
 }
 
 // Runs a call on its peer's queue, with the peer's connection current.
-void Listener::Core::schedule(const std::shared_ptr<Connection>& connection, MethodInvocation invocation, Reply reply) {
+void PeerTable::schedule(const std::shared_ptr<Connection>& connection, MethodInvocation invocation, Reply reply) {
   connection->queue()->async([connection, invocation = std::move(invocation), reply = std::move(reply)] {
     Connection::CurrentScope scope(connection.get());
     try {
@@ -118,14 +149,14 @@ void Listener::Core::schedule(const std::shared_ptr<Connection>& connection, Met
   });
 }
 
-int Listener::Core::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error*) {
-  auto* self = static_cast<Core*>(userdata);
+int PeerTable::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error*) {
+  auto* self = static_cast<PeerTable*>(userdata);
   const char *name = nullptr, *oldOwner = nullptr, *newOwner = nullptr;
   if (sd_bus_message_read(m, "sss", &name, &oldOwner, &newOwner) < 0) return 0;
   // A unique name never comes back: its connection ends with it. Work already queued finishes.
   if (name && name[0] == ':' && newOwner && !*newOwner) {
     self->peers_.erase(name);
-    self->connectionCount_.store(self->peers_.size());
+    self->count_.store(self->peers_.size());
   }
   return 0;
 }
