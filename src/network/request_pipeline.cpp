@@ -58,7 +58,8 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
   if (!tokenArray) return ZLKAErrorInvalidParameter;
   platform::Array encoded;
   for (std::string& s : base64EncodeArray(tokenArray)) encoded.emplace_back(std::move(s));
-  platform::log(LogLevel::Debug, "[#TokenAuth] encodedTokenArray: %{private}@", Value(encoded));
+  if (platform::Log::enabled(LogLevel::Debug))
+    platform::log(LogLevel::Debug, "[#TokenAuth] encodedTokenArray: %{private}@", Value(encoded));
 
   Value requestDict(plan.requestDict(std::move(encoded)));
   platform::log(LogLevel::Debug, "[#TokenAuth] requestDict: %{private}@", requestDict);
@@ -94,11 +95,14 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
     }
   }
 
-  platform::log(LogLevel::Info, "[#TokenAuth] self._selectedAPIServer: %@", network._selectedAPIServer());
+  // Lines below their level are not written, so their arguments are not even made.
+  if (platform::Log::enabled(LogLevel::Info))
+    platform::log(LogLevel::Info, "[#TokenAuth] self._selectedAPIServer: %@", network._selectedAPIServer());
   std::string sessionID = network.tarvexSAPSession()->UUID().UUIDString();
   platform::HTTPRequest request = network._generateTokenAuthURLRequestForEndpoint(plan.endpoint, sessionID, signature);
-  platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request.description());
-  platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@", Value(request.allHTTPHeaderFields()));
+  platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request);
+  if (platform::Log::enabled(LogLevel::Debug))
+    platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@", Value(request.allHTTPHeaderFields()));
   platform::log(LogLevel::Debug, "[#TokenAuth] requestDict: %{private}@", requestDict);
   platform::log(LogLevel::Debug, "[#TokenAuth] requestData.length: %lu", body.length());
   platform::log(LogLevel::Debug, "[#TokenAuth] requestData (string): %{private}@", *text);
@@ -116,10 +120,10 @@ std::optional<int64_t> checkTransportAndStatus(const std::optional<Error>& taskE
     platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
     return ZLKAErrorNetwork;
   }
-  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", response->description());
+  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", *response);
   platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", body ? body->length() : 0);
   if (body && !body->empty())
-    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", std::string(body->view()));
+    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", body->view());
   long status = response->statusCode;
   if (status == 200 || (acceptNoContent && status == 204)) return std::nullopt;
   platform::log(LogLevel::Error,

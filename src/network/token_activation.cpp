@@ -31,7 +31,8 @@ void replyWithNewToken(const Value& answer, const std::function<void(int64_t)>& 
   std::vector<std::string> strings;
   for (const Value& v : pieces) strings.push_back(*v.string());
   std::vector<Data> decoded = base64DecodeArray(strings);
-  platform::log(LogLevel::Debug, "[#TokenAuth] decodedNewTokenArray: %{private}@", Value(platform::Array(decoded.begin(), decoded.end())));
+  if (platform::Log::enabled(LogLevel::Debug))  // the array copies every piece
+    platform::log(LogLevel::Debug, "[#TokenAuth] decodedNewTokenArray: %{private}@", Value(platform::Array(decoded.begin(), decoded.end())));
   std::vector<uint8_t> newToken;
   for (const Data& piece : decoded) newToken.insert(newToken.end(), piece.bytes(), piece.bytes() + piece.length());
   Data result(std::move(newToken));

@@ -23,7 +23,8 @@ Error sessionError(int64_t code, std::optional<platform::Dictionary> userInfo = 
 }
 
 void logRequest(const platform::HTTPRequest& request) {
-  platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request.description());
+  if (!platform::Log::enabled(LogLevel::Debug)) return;  // the header dictionary is made only to be written
+  platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request);
   platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@", Value(request.allHTTPHeaderFields()));
 }
 
@@ -35,10 +36,10 @@ std::optional<Error> checkAnswer(const std::optional<Data>& data, const std::opt
     platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
     return sessionError(TarvexSAPSessionErrorTransport, taskError ? taskError->userInfo() : std::nullopt);
   }
-  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", response->description());
+  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", *response);
   platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", data ? data->length() : 0);
   if (showBody && data && !data->empty())
-    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", std::string(data->view()));
+    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", data->view());
   if (response->statusCode != 200) {
     platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!", response->statusCode);
     return sessionError(TarvexSAPSessionErrorBadResponse);

@@ -177,6 +177,34 @@ TEST(WorkerPool, GrowsOnlyWhileWorkBlocksUpToItsBoundShrinksBackWhenIdleAndRunsE
   }
 }
 
+TEST(WorkerPool, AWorkerBlockedOnWorkOfItsOwnPoolRunsThatWorkWhenNoThreadCanBeStarted) {
+  // Without help, the only worker would wait out the 30 s guards below, and the test would fail.
+  platform::WorkerPool pool("test.help", {.minimum = 1, .maximum = 8, .helpWhileBlocked = true});
+  pool.refuseThreadStarts(true);
+  auto waiter = Queue::serial("test.help.waiter", &pool);
+  auto serial = Queue::serial("test.help.serial", &pool);
+  auto concurrent = Queue::concurrent("test.help.concurrent", 2, &pool);
+  std::string ran;  // plain on purpose: the one worker runs everything
+  Semaphore done;
+  waiter->async([&] {
+    Semaphore signed_, verified;
+    serial->async([&] { ran += 'a'; });
+    serial->async([&] { ran += 'b', signed_.signal(); });
+    EXPECT_TRUE(arrives(signed_));
+    concurrent->async([&] { ran += 'c'; });
+    concurrent->barrierAsync([&] { ran += 'd', verified.signal(); });
+    concurrent->async([&] { ran += 'e'; });
+    EXPECT_TRUE(arrives(verified));
+    serial->sync([&] { ran += 'f'; });
+    done.signal();
+  });
+  ASSERT_TRUE(arrives(done));
+  concurrent->barrierSync([] {});
+  EXPECT_EQ(ran, "abcdfe");  // each queue's order and the barrier kept; 'e' waits its turn in the pool
+  EXPECT_EQ(pool.threads(), 1u);
+  EXPECT_GT(pool.threadStartFailures(), 0u);
+}
+
 TEST(QueueDeathTest, EmptyWorkAndZeroWidthThrowWaitingOnItselfAbortsAThrowingItemOrASelfDestroyingPoolEndsTheProcess) {
   for (bool serial : {true, false}) {
     auto queue = make(serial, "test.reject");

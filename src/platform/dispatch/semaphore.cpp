@@ -1,7 +1,6 @@
 #include "platform/dispatch/semaphore.h"
 
 #include <limits>
-#include <optional>
 #include <stdexcept>
 
 #include "platform/dispatch/worker_pool.h"
@@ -19,19 +18,7 @@ void Semaphore::signal() {
   available_.notify_one();
 }
 
-// A worker of a pool that waits here tells its pool, so that the pool may start another worker
-// meanwhile; taking a signal that is already there costs nothing of the kind.
-void Semaphore::wait() {
-  std::optional<WorkerPool::Blocking> blocking;
-  std::unique_lock lock(mutex_);
-  if (count_ == 0) {
-    lock.unlock();
-    blocking.emplace();
-    lock.lock();
-  }
-  available_.wait(lock, [this] { return count_ > 0; });
-  --count_;
-}
+void Semaphore::wait() { take(std::nullopt); }
 
 bool Semaphore::waitFor(std::chrono::nanoseconds timeout) {
   using Clock = std::chrono::steady_clock;
@@ -44,17 +31,45 @@ bool Semaphore::waitFor(std::chrono::nanoseconds timeout) {
   return waitUntil(now + std::chrono::duration_cast<Clock::duration>(timeout));
 }
 
-bool Semaphore::waitUntil(std::chrono::steady_clock::time_point deadline) {
-  std::optional<WorkerPool::Blocking> blocking;
+bool Semaphore::waitUntil(std::chrono::steady_clock::time_point deadline) { return take(deadline); }
+
+// Taking a signal that is already there tells no pool anything. A blocked worker of a helping pool
+// looks for work to help with once before it first sleeps, then whenever its pool asks or its last
+// look ran a job; its own signal and deadline are checked between jobs, so it never runs more than
+// one job past them.
+bool Semaphore::take(std::optional<std::chrono::steady_clock::time_point> deadline) {
+  using Clock = std::chrono::steady_clock;
   std::unique_lock lock(mutex_);
-  if (count_ == 0 && deadline > std::chrono::steady_clock::now()) {
+  if (count_ == 0 && (!deadline || *deadline > Clock::now())) {
     lock.unlock();
-    blocking.emplace();
+    WorkerPool::Blocking blocking(this);
+    const bool helper = blocking.helps();
     lock.lock();
+    bool look = helper;
+    while (count_ == 0) {
+      if (helper && (look || helpWanted_)) {
+        helpWanted_ = false;
+        lock.unlock();
+        look = blocking.help();
+        lock.lock();
+        if (deadline && Clock::now() >= *deadline) break;
+      } else if (!deadline) {
+        available_.wait(lock);
+      } else if (available_.wait_until(lock, *deadline) == std::cv_status::timeout && count_ == 0 &&
+                 !(helper && helpWanted_)) {
+        break;
+      }
+    }
   }
-  if (!available_.wait_until(lock, deadline, [this] { return count_ > 0; })) return false;
+  if (count_ == 0) return false;
   --count_;
   return true;
+}
+
+void Semaphore::wakeToHelp() {
+  std::lock_guard lock(mutex_);
+  helpWanted_ = true;
+  available_.notify_all();
 }
 
 }  // namespace platform

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <iterator>
 #include <system_error>
 #include <thread>
 
@@ -34,10 +35,12 @@ WorkerPool::~WorkerPool() {
 void WorkerPool::post(std::function<void()> job) {
   std::lock_guard lock(mutex_);
   jobs_.push_back(std::move(job));
-  if (idle_ > 0)
+  if (idle_ > 0) {
     available_.notify_one();
-  else
+  } else {
     growIfNeeded();
+    callHelpers();
+  }
 }
 
 void WorkerPool::setMaximum(unsigned maximum) {
@@ -55,8 +58,15 @@ size_t WorkerPool::threadStartFailures() const {
   return startFailures_;
 }
 
+void WorkerPool::refuseThreadStarts(bool refuse) {
+  std::lock_guard lock(mutex_);
+  refuseStarts_ = refuse;
+}
+
 WorkerPool& WorkerPool::shared() {
-  static WorkerPool* pool = new WorkerPool("shared", {.minimum = 1, .maximum = 64});
+  // Its blocking work (an HTTP callback verifying an answer) waits only on the session's queues,
+  // whose work never waits: it may help.
+  static WorkerPool* pool = new WorkerPool("shared", {.minimum = 1, .maximum = 64, .helpWhileBlocked = true});
   return *pool;
 }
 
@@ -65,23 +75,35 @@ WorkerPool& WorkerPool::connections() {
   return *pool;
 }
 
+// Work waits and fewer workers than the minimum are free to take it: only blocked workers (or
+// workers that could not be started) make that so.
+bool WorkerPool::starved() const {
+  return jobs_.size() > idle_ && threads_ - blocked_ < limits_.minimum && threads_ < limits_.maximum;
+}
+
 void WorkerPool::growIfNeeded() {
-  // Work waits and fewer workers than the minimum are free to take it: only blocked workers (or
-  // workers that could not be started) make that so.
-  bool waiting = jobs_.size() > idle_;
-  if (waiting && threads_ - blocked_ < limits_.minimum && threads_ < limits_.maximum) startWorker();
+  if (starved()) startWorker();
 }
 
 bool WorkerPool::startWorker() {
-  ++threads_;
-  try {
-    std::thread([this] { work(); }).detach();
-    return true;
-  } catch (const std::system_error&) {
-    --threads_;
-    ++startFailures_;
-    return false;
+  if (!refuseStarts_) {
+    ++threads_;
+    try {
+      std::thread([this] { work(); }).detach();
+      return true;
+    } catch (const std::system_error&) {
+      --threads_;
+    }
   }
+  ++startFailures_;
+  return false;
+}
+
+// Still starved once growing has been tried: no thread could be started, and the blocked workers
+// are the only ones left to run the work.
+void WorkerPool::callHelpers() {
+  if (!limits_.helpWhileBlocked || !starved()) return;
+  for (HelpWaker* helper : helpers_) helper->wakeToHelp();
 }
 
 void WorkerPool::work() {
@@ -112,22 +134,46 @@ void WorkerPool::work() {
   if (trim) malloc_trim(0);
 }
 
-void WorkerPool::setBlocked(bool blocked) {
+void WorkerPool::setBlocked(bool blocked, HelpWaker* waker) {
   std::lock_guard lock(mutex_);
   if (blocked) {
     ++blocked_;
+    if (waker && limits_.helpWhileBlocked) helpers_.push_back(waker);
     growIfNeeded();
+    callHelpers();
   } else {
     --blocked_;
+    // The same semaphore may be waited on by two workers: take away one registration of it.
+    auto it = std::find(helpers_.rbegin(), helpers_.rend(), waker);
+    if (it != helpers_.rend()) helpers_.erase(std::next(it).base());
   }
 }
 
-WorkerPool::Blocking::Blocking() : pool_(tPool) {
-  if (pool_) pool_->setBlocked(true);
+WorkerPool::Blocking::Blocking(HelpWaker* waker) : pool_(tPool), waker_(waker) {
+  if (pool_) pool_->setBlocked(true, waker_);
 }
 
 WorkerPool::Blocking::~Blocking() {
-  if (pool_) pool_->setBlocked(false);
+  if (pool_) pool_->setBlocked(false, waker_);
+}
+
+// The job runs as the worker's own would, in the order posted, outside the lock; the worker counts
+// as free meanwhile, so that a job it nests may block and be helped in turn.
+bool WorkerPool::Blocking::helps() const { return pool_ && waker_ && pool_->limits_.helpWhileBlocked; }
+
+bool WorkerPool::Blocking::help() {
+  if (!helps()) return false;
+  std::unique_lock lock(pool_->mutex_);
+  if (!pool_->starved() || pool_->startWorker()) return false;
+  std::function<void()> job = std::move(pool_->jobs_.front());
+  pool_->jobs_.pop_front();
+  --pool_->blocked_;
+  lock.unlock();
+  job();
+  job = nullptr;
+  lock.lock();
+  ++pool_->blocked_;
+  return true;
 }
 
 }  // namespace platform

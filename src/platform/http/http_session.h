@@ -1,4 +1,4 @@
-// HTTPSession: HTTPS requests over one libcurl multi handle and one worker thread per session.
+// HTTPSession: HTTPS requests over one libcurl multi handle and one event thread per session.
 //
 // Tasks are made suspended and start with resume(); each calls its completion exactly once, on the
 // session's serial callback queue, with (body, response, nullopt) when an answer arrived (whatever
@@ -60,8 +60,12 @@ class ConnectionClaim;
 
 class HTTPTask {
  public:
+  // resume starts the task once (later calls do nothing); a session that is gone or cannot start
+  // its event thread completes it with an error instead.
   void resume();
-  void cancel();  // completes with HTTPErrorCancelled unless already complete
+  // cancel completes the task with HTTPErrorCancelled unless it has already completed.
+  void cancel();
+  // originalRequest is the request the task was made with, owned by the task.
   const HTTPRequest& originalRequest() const;
 
  private:
@@ -72,13 +76,18 @@ class HTTPTask {
 
 class HTTPSession {
  public:
+  // sessionWithConfiguration makes a session of its own; it never fails (its thread starts later
+  // if none can be had now).
   static std::shared_ptr<HTTPSession> sessionWithConfiguration(HTTPSessionConfiguration configuration);
+  // sharedSession is the process-wide session, made on first use with the default configuration.
   static std::shared_ptr<HTTPSession> sharedSession();
+  // The destructor cancels every task still running, as invalidateAndCancel does.
   ~HTTPSession();
 
-  // A task that sends `body`; with a claim, the task holds it until it completes.
+  // A suspended task that sends `body`; with a claim, the task holds it until it completes.
   std::shared_ptr<HTTPTask> uploadTaskWithRequest(HTTPRequest request, Data body, HTTPCompletion completion,
                                                   std::shared_ptr<ConnectionClaim> claim = nullptr);
+  // A suspended task that sends the request without a body.
   std::shared_ptr<HTTPTask> dataTaskWithRequest(HTTPRequest request, HTTPCompletion completion);
 
   // Waits, as blocking work, until fewer than `maximumConnectionsPerHost` claims of this session
@@ -89,6 +98,7 @@ class HTTPSession {
 
   // Cancels every task (each completes with HTTPErrorCancelled) and refuses new ones.
   void invalidateAndCancel();
+  // callbackQueue is the serial queue that every completion of this session runs on.
   const std::shared_ptr<Queue>& callbackQueue() const;
 
   // Caps the time-out of every request made from now on (tests); nullopt removes the cap.
