@@ -14,23 +14,18 @@
 #include <string_view>
 
 #include "platform/values/error.h"
+#include "zlka/client.h"
 
 namespace zlka_client {
 
-inline constexpr char kOperationErrorDomain[] = "ZLKATokenManagerErrorDomain";
-inline constexpr char kClientErrorDomain[] = "ZLKAClientErrorDomain";
+// One definition with the public header, which states them to applications.
+using zlka::kClientErrorDomain;
+using zlka::kOperationErrorDomain;
+using zlka::ClientErrorCode;
+
 // User-info keys of client errors made from a D-Bus error.
 inline constexpr char kBusErrorNameKey[] = "DBusErrorName";
 inline constexpr char kBusErrorMessageKey[] = "DBusErrorMessage";
-
-enum class ClientErrorCode : int64_t {
-  ConnectionFailed = 1,    // the bus itself could not be connected to
-  ServiceUnavailable = 2,  // the service is not on the bus, did not answer, or the connection dropped
-  InvalidRequest = 3,      // the arguments cannot be sent (a null, a non-UTF-8 string, too deep)
-  Refused = 4,             // the bus or the service refused the call with a D-Bus error
-  MalformedReply = 5,      // the answer does not have the form the method promises
-  Cancelled = 6,           // the client was closed before the answer came
-};
 
 platform::Error clientError(ClientErrorCode code, std::string description);
 

@@ -99,4 +99,8 @@ void ZLKAClient::callRawAsync(const std::string& method, ArgumentWriter write, R
   caller_->callAsync(method, std::move(write), handlerFor(std::move(callback), &decodeAnyReply));
 }
 
+void ZLKAClient::failAsync(platform::Error error, MetadataCallback callback) {
+  caller_->failAsync(std::move(error), handlerFor(std::move(callback), &decodeMetadataReply));
+}
+
 }  // namespace zlka_client

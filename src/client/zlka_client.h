@@ -70,6 +70,10 @@ class ZLKAClient {
   Result<platform::Array> callRaw(const std::string& method, const ArgumentWriter& write);
   void callRawAsync(const std::string& method, ArgumentWriter write, RawCallback callback);
 
+  // failAsync hands `error` to `callback` on the event thread, as for a call refused before it is
+  // sent (arguments the caller's own types could not express).
+  void failAsync(platform::Error error, MetadataCallback callback);
+
  private:
   explicit ZLKAClient(std::shared_ptr<BusCaller> caller) : caller_(std::move(caller)) {}
   std::shared_ptr<BusCaller> caller_;

@@ -10,6 +10,17 @@ inline constexpr char ZLKAUserDefaultsKey_ForceNetworkFailure[] = "ForceNetworkF
 inline constexpr char ZLKAUserDefaultsKey_ForceTokenActivationFailure[] = "ForceTokenActivationFailure";
 inline constexpr char ZLKAUserDefaultsKey_ForceTokenConfirmationFailure[] = "ForceTokenConfirmationFailure";
 inline constexpr char ZLKAUserDefaultsKey_ForceTarvexSAPFailure[] = "ForceTarvexSAPFailure";
+// Every key above that the daemon reads: zlkactl refuses to write any other without --force.
+inline constexpr const char* ZLKAUserDefaultsKeys[] = {
+    ZLKAUserDefaultsKey_Server,
+    ZLKAUserDefaultsKey_CustomServer,
+    ZLKAUserDefaultsKey_StaticContentServer,
+    ZLKAUserDefaultsKey_TarvexSAPServer,
+    ZLKAUserDefaultsKey_ForceNetworkFailure,
+    ZLKAUserDefaultsKey_ForceTokenActivationFailure,
+    ZLKAUserDefaultsKey_ForceTokenConfirmationFailure,
+    ZLKAUserDefaultsKey_ForceTarvexSAPFailure,
+};
 inline constexpr char ZLKAUserDefaultsNotification[] = "com.kestro.ZLKAuthentication.PreferencesDidChangeNotification";
 
 // The entitlement callers must hold, and the category in it that admits them.

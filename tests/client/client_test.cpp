@@ -1,8 +1,9 @@
 // The client library and zlkactl against a stand-in for the daemon: how bus errors map back to
 // domains and codes, what each kind of argument puts on the wire and what is refused before it, how
 // answers are decoded, how calls end that can get no answer, on which thread and how often
-// callbacks run; and what zlkactl adds: options turned into exactly the arguments given, answers
-// and errors printed, one exit status per class of failure, and the settings suite.
+// callbacks run, the installed interface's own types; and what zlkactl adds: required options,
+// options turned into exactly the arguments given, answers and errors printed (as JSON with
+// --json), one exit status per class of failure, and the settings suite.
 #include <gmock/gmock.h>
 #include <systemd/sd-bus.h>
 
@@ -15,6 +16,7 @@
 #include <limits>
 #include <map>
 #include <memory>
+#include <future>
 #include <mutex>
 #include <set>
 #include <sstream>
@@ -25,6 +27,7 @@
 #include "common/child_process.h"
 #include "common/private_bus.h"
 #include "platform/values/json.h"
+#include "zlka/client.h"
 #include "zlkactl/command_line.h"
 #include "zlkactl/commands.h"
 #include "zlkactl/token_input.h"
@@ -426,6 +429,35 @@ TEST_F(ClientTest, ClosingTheClientCancelsWhatIsUnanswered) {
   EXPECT_EQ(stranded.wait(1), std::vector<std::string>{cancelled});
 }
 
+// The installed interface: its own types in and out, and a refusal answered on the client's
+// thread like any answer.
+TEST_F(ClientTest, ThePublicInterfaceSpeaksOnlyItsOwnTypes) {
+  auto made = zlka::Client::connect({.bus = bus->address()});
+  ASSERT_TRUE(made.ok());
+  zlka::Client& c = *made.value();
+  auto text = [](const zlka::Error& e) { return e.domain + " " + std::to_string(e.code) + " " + e.busErrorName + ": " + e.description; };
+  std::promise<std::string> refused, activated;
+  std::thread::id refusedOn;
+  c.requestMetadataAsync({.requestInfoJSON = "[1]"}, [&](zlka::Result<zlka::Metadata> r) {
+    refusedOn = std::this_thread::get_id();
+    refused.set_value(r ? "answered" : text(r.error()));
+  });
+  c.requestActivationAsync({.token = zlka::Bytes{1}}, [&](zlka::Result<zlka::Bytes> r) {
+    activated.set_value(r ? hex(r.value().data(), r.value().size()) : text(r.error()));
+  });
+  EXPECT_EQ(refused.get_future().get(), "ZLKAClientErrorDomain 3 : Cannot send the call: requestInfo is an array, not a JSON object.");
+  EXPECT_NE(refusedOn, std::this_thread::get_id());
+  EXPECT_EQ(activated.get_future().get(), "deadbeef");
+  auto metadata = c.requestMetadata({.requestInfoJSON = R"({"n":1})"});
+  EXPECT_EQ(metadata ? metadata.value().ppid + " " + metadata.value().metadataJSON : text(metadata.error()), R"(ppid-1 {"plan":"basic","seats":2})");
+  service->answerWith(EchoService::error("org.freedesktop.DBus.Error.AccessDenied", "No."));
+  auto denied = c.confirmActivation({});
+  EXPECT_EQ(denied ? "confirmed" : text(denied.error()),
+            "ZLKAClientErrorDomain 4 org.freedesktop.DBus.Error.AccessDenied: The call was refused with org.freedesktop.DBus.Error.AccessDenied: No.");
+  EXPECT_EQ(newCalls(), "RequestActivationForToken a{sv}[s:\"token\"=<ay:01>]\n"
+                        "RequestMetadataForToken a{sv}[s:\"requestInfo\"=<a{sv}[s:\"n\"=<x:1>]>]\nConfirmActivationForToken a{sv}[]");
+}
+
 // Parses and runs, as main() does.
 zlkatest::RunResult zlkactl(std::vector<std::string> arguments) {
   arguments.insert(arguments.begin(), "zlkactl");
@@ -442,37 +474,59 @@ TEST_F(ClientTest, ZlkactlSendsWhatItIsGivenAndExitsByTheKindOfFailure) {
   const std::string token = (dir.path() / "token").string(), large = (dir.path() / "large").string(), b = bus->address();
   std::ofstream(token) << std::string("\x00\x01\xff", 3);
   std::ofstream(large) << std::string(zlkactl::kMaxTokenFileSize + 1, 'x');
+  const std::string confirmed = R"(ConfirmActivationForToken a{sv}[s:"token"=<ay:01>,s:"uuid"=<s:"U">])";
   // Usage errors (2) and unreachable services (3) send nothing; the rest sends `sent`.
   // clang-format off
   const struct { std::vector<std::string> arguments; EchoService::Answer answer; int status; std::string out, err, sent; } rows[] = {
-      {{"--bus", b, "--json", "metadata", "--token-hex", "0a0B", "--locale", "en_US", "--request-info", R"({"s":"setup","n":7})"}, nullptr, 0,
+      {{"--bus", b, "--json", "metadata", "--token-hex", "0a0B", "--uuid", "U", "--locale", "en_US", "--request-info", R"({"s":"setup","n":7})"}, nullptr, 0,
        R"({"locale":"en_US","metadata":{"plan":"basic","seats":2},"ppid":"ppid-1"})" "\n", "",
-       R"(RequestMetadataForToken a{sv}[s:"token"=<ay:0a0b>,s:"requestedLocale"=<s:"en_US">,s:"requestInfo"=<a{sv}[s:"n"=<x:7>,s:"s"=<s:"setup">]>])"},
-      {{"metadata", "--uuid", "U", "--bus", b}, nullptr, 0, "ppid: ppid-1\nlocale: en_US\nmetadata:\n{\n  \"plan\": \"basic\",\n  \"seats\": 2\n}\n", "",
-       R"(RequestMetadataForToken a{sv}[s:"uuid"=<s:"U">])"},
+       R"(RequestMetadataForToken a{sv}[s:"token"=<ay:0a0b>,s:"uuid"=<s:"U">,s:"requestedLocale"=<s:"en_US">,s:"requestInfo"=<a{sv}[s:"n"=<x:7>,s:"s"=<s:"setup">]>])"},
+      {{"metadata", "--uuid", "U", "--token-hex", "01", "--locale", "en_US", "--bus", b}, nullptr, 0,
+       "ppid: ppid-1\nlocale: en_US\nmetadata:\n{\n  \"plan\": \"basic\",\n  \"seats\": 2\n}\n", "",
+       R"(RequestMetadataForToken a{sv}[s:"token"=<ay:01>,s:"uuid"=<s:"U">,s:"requestedLocale"=<s:"en_US">])"},
       {{"--bus", b, "activate", "--token-base64", "AQI=", "--uuid", "U-9"}, nullptr, 0, "token: deadbeef\nlength: 4 bytes\n", "",
        R"(RequestActivationForToken a{sv}[s:"token"=<ay:0102>,s:"uuid"=<s:"U-9">])"},
-      {{"--bus", b, "--json", "activate", "--token-file", token}, nullptr, 0, R"({"length":4,"token_base64":"3q2+7w==","token_hex":"deadbeef"})" "\n", "",
-       R"(RequestActivationForToken a{sv}[s:"token"=<ay:0001ff>])"},
-      {{"--bus", b, "confirm"}, nullptr, 0, "confirmed\n", "", "ConfirmActivationForToken a{sv}[]"},
-      {{"--bus", b, "--json", "confirm"}, nullptr, 0, "{\"confirmed\":true}\n", "", "ConfirmActivationForToken a{sv}[]"},
-      {{"--bus", b, "confirm"}, EchoService::error("com.kestro.ZLKAuthentication.Error.Network", "Gone."), 1, "",
-       "zlkactl: ZLKATokenManagerErrorDomain -5: Gone.\n", "ConfirmActivationForToken a{sv}[]"},
-      {{"--bus", "unix:path=/nonexistent/zlka", "confirm"}, nullptr, 3, "",
+      {{"--bus", b, "--json", "activate", "--token-file", token, "--uuid", "U"}, nullptr, 0,
+       R"({"length":4,"token_base64":"3q2+7w==","token_hex":"deadbeef"})" "\n", "", R"(RequestActivationForToken a{sv}[s:"token"=<ay:0001ff>,s:"uuid"=<s:"U">])"},
+      {{"--bus", b, "confirm", "--token-hex", "01", "--uuid", "U"}, nullptr, 0, "confirmed\n", "", confirmed},
+      {{"--bus", b, "--json", "confirm", "--token-hex", "01", "--uuid", "U"}, nullptr, 0, "{\"confirmed\":true}\n", "", confirmed},
+      {{"--bus", b, "confirm", "--token-hex", "01", "--uuid", "U"}, EchoService::error("com.kestro.ZLKAuthentication.Error.Network", "Gone."), 1, "",
+       "zlkactl: ZLKATokenManagerErrorDomain -5: Gone.\n", confirmed},
+      {{"--bus", "unix:path=/nonexistent/zlka", "confirm", "--token-hex", "01", "--uuid", "U"}, nullptr, 3, "",
        "zlkactl: ZLKAClientErrorDomain 1: Cannot connect to the bus at \"unix:path=/nonexistent/zlka\": No such file or directory.\n", ""},
-      {{"--bus", b, "metadata", "--token-hex", "abc"}, nullptr, 2, "", "zlkactl: --token-hex: an odd number of hex digits\n", ""},
-      {{"--bus", b, "metadata", "--token-hex", "0g"}, nullptr, 2, "", "zlkactl: --token-hex: character 2 is not a hex digit\n", ""},
-      {{"--bus", b, "confirm", "--token-base64", "AQI"}, nullptr, 2, "", "zlkactl: --token-base64: not valid base64", ""},
-      {{"--bus", b, "activate", "--token-file", "/nonexistent/t"}, nullptr, 2, "", "zlkactl: --token-file: cannot read /nonexistent/t: No such file", ""},
-      {{"--bus", b, "activate", "--token-file", large}, nullptr, 2, "", "zlkactl: --token-file: " + large + " is larger than 1048576 bytes\n", ""},
-      {{"--bus", b, "activate", "--uuid", "\xff"}, nullptr, 2, "", "zlkactl: --uuid: not UTF-8 text\n", ""},
-      {{"--bus", b, "metadata", "--request-info", "[1]"}, nullptr, 2, "", "zlkactl: --request-info: must be a JSON object, not an array\n", ""},
-      {{"--bus", b, "metadata", "--request-info", "{\"a\":"}, nullptr, 2, "", "zlkactl: --request-info: not valid JSON", ""},
-      {{"--bus", b, "metadata", "--request-info", R"({"a":[null]})"}, nullptr, 2, "", "zlkactl: --request-info: requestInfo.a[0] is null", ""},
+      {{"--bus", b, "--timeout", "0.05", "confirm", "--token-hex", "01", "--uuid", "U"}, EchoService::hold, 3, "",
+       "zlkactl: ZLKAClientErrorDomain 2: The service com.kestro.ZLKAuthentication.ZLKANetwork cannot be reached (org.freedesktop.DBus.Error.NoReply",
+       confirmed},
+      // Under --json every error is one JSON object on standard error, with the same exit status.
+      {{"--bus", b, "--json", "confirm", "--token-hex", "01", "--uuid", "U"}, EchoService::error("com.kestro.ZLKAuthentication.Error.Network", "Gone."), 1,
+       "", R"({"code":-5,"description":"Gone.","domain":"ZLKATokenManagerErrorDomain"})" "\n", confirmed},
+      {{"--bus", "unix:path=/nonexistent/zlka", "--json", "confirm", "--token-hex", "01", "--uuid", "U"}, nullptr, 3, "",
+       R"({"code":1,"description":"Cannot connect to the bus at \"unix:path=/nonexistent/zlka\": No such file or directory.","domain":"ZLKAClientErrorDomain"})" "\n", ""},
+      {{"--bus", b, "--json", "confirm", "--token-hex", "abc", "--uuid", "U"}, nullptr, 2, "",
+       R"({"code":2,"description":"--token-hex: an odd number of hex digits","domain":"zlkactl"})" "\n", ""},
+      {{"--bus", b, "--json", "confirm", "--token-hex", "01"}, nullptr, 2, "", R"({"code":2,"description":"--uuid is required","domain":"zlkactl"})" "\n", ""},
+      // What the daemon needs is required before anything is sent.
+      {{"--bus", b, "activate", "--uuid", "U"}, nullptr, 2, "", "zlkactl: A token (--token-file, --token-hex or --token-base64) is required\n", ""},
+      {{"--bus", b, "confirm", "--token-hex", "01"}, nullptr, 2, "", "zlkactl: --uuid is required\n", ""},
+      {{"--bus", b, "metadata", "--token-hex", "01", "--uuid", "U"}, nullptr, 2, "", "zlkactl: --locale is required\n", ""},
+      {{"--bus", b, "metadata", "--token-hex", "abc", "--uuid", "U", "--locale", "en_US"}, nullptr, 2, "", "zlkactl: --token-hex: an odd number of hex digits\n", ""},
+      {{"--bus", b, "metadata", "--token-hex", "0g", "--uuid", "U", "--locale", "en_US"}, nullptr, 2, "", "zlkactl: --token-hex: character 2 is not a hex digit\n", ""},
+      {{"--bus", b, "confirm", "--token-base64", "AQI", "--uuid", "U"}, nullptr, 2, "", "zlkactl: --token-base64: not valid base64", ""},
+      {{"--bus", b, "activate", "--token-file", "/nonexistent/t", "--uuid", "U"}, nullptr, 2, "", "zlkactl: --token-file: cannot read /nonexistent/t: No such file", ""},
+      {{"--bus", b, "activate", "--token-file", large, "--uuid", "U"}, nullptr, 2, "", "zlkactl: --token-file: " + large + " is larger than 1048576 bytes\n", ""},
+      {{"--bus", b, "activate", "--token-hex", "01", "--uuid", "\xff"}, nullptr, 2, "", "zlkactl: --uuid: not UTF-8 text\n", ""},
+      {{"--bus", b, "metadata", "--token-hex", "01", "--uuid", "U", "--locale", "en_US", "--request-info", "[1]"}, nullptr, 2, "",
+       "zlkactl: --request-info: must be a JSON object, not an array\n", ""},
+      {{"--bus", b, "metadata", "--token-hex", "01", "--uuid", "U", "--locale", "en_US", "--request-info", "{\"a\":"}, nullptr, 2, "",
+       "zlkactl: --request-info: not valid JSON", ""},
+      {{"--bus", b, "metadata", "--token-hex", "01", "--uuid", "U", "--locale", "en_US", "--request-info", R"({"a":[null]})"}, nullptr, 2, "",
+       "zlkactl: --request-info: requestInfo.a[0] is null", ""},
       {{"--bus", b, "metadata", "--token-hex", "00", "--token-base64", "AA=="}, nullptr, 2, "", "zlkactl: ", ""},  // one token source
       {{"--bus", b, "activate", "--locale", "en_US"}, nullptr, 2, "", "zlkactl: ", ""},  // metadata only
       {{"--bus", "nowhere", "confirm"}, nullptr, 2, "", "zlkactl: ", ""},
       {{"--bus", b}, nullptr, 2, "", "zlkactl: ", ""},
+      {{"--bus", b, "--timeout", "0", "confirm", "--token-hex", "01", "--uuid", "U"}, nullptr, 2, "", "zlkactl: --timeout: ", ""},
+      {{"--version"}, nullptr, 0, "zlkactl " ZLKA_VERSION "\n", "", ""},
   };
   // clang-format on
   for (const auto& row : rows) {
@@ -488,7 +542,7 @@ TEST_F(ClientTest, ZlkactlSendsWhatItIsGivenAndExitsByTheKindOfFailure) {
   using zlka_client::ClientErrorCode;
   for (const auto& [code, status] : {std::pair{ClientErrorCode::ServiceUnavailable, 3}, {ClientErrorCode::InvalidRequest, 2},
                                      {ClientErrorCode::Refused, 1}, {ClientErrorCode::MalformedReply, 1}, {ClientErrorCode::Cancelled, 1}})
-    EXPECT_EQ(zlkactl::exitStatusFor(zlka_client::clientError(code, "")), status) << static_cast<int>(code);
+    EXPECT_EQ(zlkactl::exitStatusFor({zlka::kClientErrorDomain, static_cast<int64_t>(code), "", ""}), status) << static_cast<int>(code);
 }
 
 TEST(Zlkactl, DefaultsKeepJSONValuesAndPlainStrings) {
@@ -499,12 +553,18 @@ TEST(Zlkactl, DefaultsKeepJSONValuesAndPlainStrings) {
                            "[sap]\ntrust_anchor = \"/x.pem\"\n[settings]\nsuite_dir = \"" << dir.string() << "\"\n";
   const std::string suite = (dir / "com.kestro.ZLKAuthentication.json").string();
   const struct { std::vector<std::string> arguments; int status; std::string out, err; } rows[] = {
-      {{"write", "Plan", R"({"a":[1]})"}, 0, "", ""},
-      {{"write", "Pair", "1,2"}, 0, "", ""},  // not one JSON value
+      {{"write", "--force", "Plan", R"({"a":[1]})"}, 0, "", ""},
+      {{"write", "--force", "Pair", "1,2"}, 0, "", ""},  // not one JSON value
       {{"read", "Plan"}, 0, "{\n  \"a\": [\n    1\n  ]\n}\n", ""},
       {{"delete", "Plan"}, 0, "", ""},
       {{"read"}, 0, "{\n  \"Pair\": \"1,2\"\n}\n", ""},
       {{"read", "Plan"}, 1, "", "zlkactl: com.kestro.ZLKAuthentication has no value for 'Plan' (" + suite + ")\n"},
+      // Only keys the daemon reads, unless forced: a misspelt one would be ignored silently.
+      {{"write", "ForceNetworkFailur", "true"}, 2, "", "zlkactl: zlkad reads no setting 'ForceNetworkFailur' (it reads Server, CustomServer, "
+       "StaticContentServer, TarvexSAPServer, ForceNetworkFailure, ForceTokenActivationFailure, ForceTokenConfirmationFailure, "
+       "ForceTarvexSAPFailure); --force writes it anyway\n"},
+      {{"write", "ForceNetworkFailure", "true"}, 0, "", ""},
+      {{"read", "ForceNetworkFailure"}, 0, "true\n", ""},
   };
   for (const auto& row : rows) {
     std::vector<std::string> arguments = {"--config", config.string(), "defaults"};

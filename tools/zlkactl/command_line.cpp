@@ -2,6 +2,10 @@
 
 #include <CLI/CLI.hpp>
 
+#include <algorithm>
+
+#include "platform/bus/bus_values.h"
+#include "zlkactl/output_format.h"
 #include "zlkactl/token_input.h"
 
 namespace zlkactl {
@@ -34,18 +38,28 @@ bool validBus(const std::string& bus) {
   return bus == "system" || bus == "session" || bus.find(':') != std::string::npos;
 }
 
-std::optional<std::optional<platform::Data>> token(const Invocation& inv, std::string* error) {
+std::optional<zlka::Bytes> token(const Invocation& inv, std::string* error) {
   std::optional<platform::Data> data;
   if (inv.tokenFile) data = readTokenFile(*inv.tokenFile, error);
   else if (inv.tokenHex) data = parseHexToken(*inv.tokenHex, error);
   else if (inv.tokenBase64) data = parseBase64Token(*inv.tokenBase64, error);
-  else return std::optional<platform::Data>();  // no token option: the argument is absent
   if (!data) return std::nullopt;
-  return data;
+  return data->toVector();
+}
+
+// What the daemon refuses as InvalidParameter when it is absent, named as the user gives it.
+void requireArguments(const Invocation& inv) {
+  if (!inv.tokenFile && !inv.tokenHex && !inv.tokenBase64) throw CLI::RequiredError("A token (--token-file, --token-hex or --token-base64)");
+  if (!inv.uuid) throw CLI::RequiredError("--uuid");
+  if (inv.command == Command::Metadata && !inv.locale) throw CLI::RequiredError("--locale");
+}
+
+bool jsonRequested(int argc, const char* const* argv) {
+  return std::any_of(argv + std::min(argc, 1), argv + argc, [](const char* a) { return std::string_view(a) == "--json"; });
 }
 
 bool checkText(const std::optional<std::string>& text, const char* option, std::string* error) {
-  if (!text || zlka_client::isBusString(*text)) return true;
+  if (!text || platform::isBusString(*text)) return true;
   if (error) *error = std::string(option) + ": not UTF-8 text";
   return false;
 }
@@ -60,15 +74,22 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
     return "zlkactl: " + std::string(e.what()) + "\nRun with --help for more information.\n";
   });
   app.require_subcommand(1);
+  app.set_version_flag("--version", std::string("zlkactl ") + ZLKA_VERSION);
   app.add_option("--bus", inv.bus, "The bus to reach zlkad on: system, session, or a D-Bus address (unix:path=...)")
       ->type_name("BUS")
       ->capture_default_str();
-  app.add_flag("--json", inv.json, "Print the answer as one line of JSON");
+  app.add_flag("--json", inv.json, "Print the answer, and any error, as one line of JSON");
+  app.add_option("--timeout", inv.timeoutSeconds, "Give up on the call after SECONDS (opening a session can take minutes)")
+      ->type_name("SECONDS")
+      ->check(CLI::Range(0.001, 86400.0))
+      ->capture_default_str();
   app.add_option("--config", inv.configPath, "The configuration file whose [settings] suite_dir holds the settings (defaults only)")
       ->type_name("PATH")
       ->capture_default_str();
   app.footer(
       "Exit status: 0 success, 1 the operation failed, 2 usage error, 3 the service cannot be reached.\n"
+      "Errors go to standard error, with --json as {\"code\":C,\"description\":D,\"domain\":N}; zlkactl's own\n"
+      "errors (usage, input, settings) have the domain \"zlkactl\" and the exit status as their code.\n"
       "Examples:\n"
       "  zlkactl metadata --token-hex 0a1b2c --uuid 6f1c9a52-0000-4000-8000-000000000001 --locale en_US\n"
       "  zlkactl --bus session --json activate --token-file token.bin --uuid 6f1c9a52-0000-4000-8000-000000000001\n"
@@ -116,22 +137,14 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
   CLI::App* read = defaults->add_subcommand("read", "Print one setting, or the whole suite, as JSON");
   read->add_option("KEY", key, "The setting to print; all of them when left out");
   read->footer("Example:\n  zlkactl defaults read ForceNetworkFailure");
-  CLI::App* write = defaults->add_subcommand("write", "Set a setting");
+  CLI::App* write = defaults->add_subcommand("write", "Set a setting (only one zlkad reads, unless --force)");
+  write->add_flag("--force", inv.force, "Write a key that zlkad is not known to read");
   write->add_option("KEY", key, "The setting")->required();
   write->add_option("VALUE", value, "Its value: JSON when it is one JSON value (true, 3, \"x\", {...}), else a plain string")->required();
   write->footer("Examples:\n  zlkactl defaults write ForceNetworkFailure true\n  zlkactl defaults write Server it");
   CLI::App* remove = defaults->add_subcommand("delete", "Remove a setting");
   remove->add_option("KEY", key, "The setting")->required();
   remove->footer("Example:\n  zlkactl defaults delete ForceNetworkFailure");
-
-  try {
-    app.parse(argc, argv);
-    if (!validBus(inv.bus))
-      throw CLI::ValidationError("--bus", "must be system, session or a D-Bus address such as unix:path=/run/dbus/system_bus_socket");
-  } catch (const CLI::ParseError& e) {
-    int status = app.exit(e, out, err);
-    return {std::nullopt, status == 0 ? kExitSuccess : kExitUsage};
-  }
 
   auto takeOperation = [&](Command command, const TokenOptions& t, CLI::Option* uuidOption) {
     inv.command = command;
@@ -140,43 +153,55 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
     inv.tokenBase64 = given(t.base64, base64);
     inv.uuid = given(uuidOption, uuid);
   };
-  if (*metadata) {
-    takeOperation(Command::Metadata, metadataToken, metadataUUID);
-    inv.locale = given(metadataLocale, locale);
-    inv.requestInfo = given(metadataInfo, requestInfo);
-  } else if (*activate) {
-    takeOperation(Command::Activate, activateToken, activateUUID);
-  } else if (*confirm) {
-    takeOperation(Command::Confirm, confirmToken, confirmUUID);
-  } else if (*read) {
+  try {
+    app.parse(argc, argv);
+    if (!validBus(inv.bus))
+      throw CLI::ValidationError("--bus", "must be system, session or a D-Bus address such as unix:path=/run/dbus/system_bus_socket");
+    if (*metadata) {
+      takeOperation(Command::Metadata, metadataToken, metadataUUID);
+      inv.locale = given(metadataLocale, locale);
+      inv.requestInfo = given(metadataInfo, requestInfo);
+    } else if (*activate) {
+      takeOperation(Command::Activate, activateToken, activateUUID);
+    } else if (*confirm) {
+      takeOperation(Command::Confirm, confirmToken, confirmUUID);
+    }
+    if (*metadata || *activate || *confirm) requireArguments(inv);
+  } catch (const CLI::ParseError& e) {
+    if (e.get_exit_code() == 0 || !jsonRequested(argc, argv)) {
+      int status = app.exit(e, out, err);
+      return {std::nullopt, status == 0 ? kExitSuccess : kExitUsage};
+    }
+    err << formatError(toolError(kExitUsage, e.what()), true);
+    return {std::nullopt, kExitUsage};
+  }
+
+  if (*read) {
     inv.command = Command::DefaultsRead;
     if (read->count("KEY") > 0) inv.key = key;
   } else if (*write) {
     inv.command = Command::DefaultsWrite;
     inv.key = key;
     inv.value = value;
-  } else {
+  } else if (*remove) {
     inv.command = Command::DefaultsDelete;
     inv.key = key;
   }
   return {std::move(inv), kExitSuccess};
 }
 
-std::optional<zlka_client::TokenArguments> tokenArguments(const Invocation& inv, std::string* error) {
+std::optional<zlka::TokenArguments> tokenArguments(const Invocation& inv, std::string* error) {
   auto data = token(inv, error);
   if (!data || !checkText(inv.uuid, "--uuid", error)) return std::nullopt;
-  return zlka_client::TokenArguments{*data, inv.uuid};
+  return zlka::TokenArguments{std::move(*data), inv.uuid};
 }
 
-std::optional<zlka_client::MetadataArguments> metadataArguments(const Invocation& inv, std::string* error) {
+std::optional<zlka::MetadataArguments> metadataArguments(const Invocation& inv, std::string* error) {
   auto data = token(inv, error);
   if (!data || !checkText(inv.uuid, "--uuid", error) || !checkText(inv.locale, "--locale", error)) return std::nullopt;
-  zlka_client::MetadataArguments arguments{*data, inv.uuid, inv.locale, std::nullopt};
-  if (inv.requestInfo) {
-    arguments.requestInfo = parseRequestInfo(*inv.requestInfo, error);
-    if (!arguments.requestInfo) return std::nullopt;
-  }
-  return arguments;
+  // Checked here too, for a message that names the option; the library sends the text as it is.
+  if (inv.requestInfo && !parseRequestInfo(*inv.requestInfo, error)) return std::nullopt;
+  return zlka::MetadataArguments{std::move(*data), inv.uuid, inv.locale, inv.requestInfo};
 }
 
 }  // namespace zlkactl

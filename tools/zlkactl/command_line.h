@@ -1,18 +1,20 @@
 // zlkactl's command line: what the user asked for, parsed with CLI11.
 //
-//   zlkactl [--bus system|session|ADDRESS] [--json] metadata|activate|confirm
-//           [--token-file PATH | --token-hex HEX | --token-base64 B64] [--uuid UUID]
+//   zlkactl [--bus system|session|ADDRESS] [--json] [--timeout SECONDS] metadata|activate|confirm
+//           --token-file PATH | --token-hex HEX | --token-base64 B64  --uuid UUID
 //           [--locale ID] [--request-info JSON]          (the last two for metadata only)
-//   zlkactl [--config PATH] defaults read [KEY] | write KEY VALUE | delete KEY
+//   zlkactl [--config PATH] defaults read [KEY] | write [--force] KEY VALUE | delete KEY
+//   zlkactl --version | --help
 //
-// An option left out leaves the argument absent: the daemon is sent no key for it.
+// The arguments the daemon needs (a token and a uuid, and a locale for metadata) are checked here,
+// so that leaving one out is a usage error rather than the daemon's InvalidParameter.
 #pragma once
 
 #include <optional>
 #include <ostream>
 #include <string>
 
-#include "client/request_encoding.h"
+#include "zlka/client.h"
 
 namespace zlkactl {
 
@@ -32,16 +34,18 @@ struct Invocation {
   Command command = Command::Metadata;
   std::string bus = "system";
   bool json = false;
+  double timeoutSeconds = 300;  // the library's default: an operation may wait for a session to open
   std::string configPath = kDefaultConfigPath;
   // Operations: exactly what was given on the command line.
   std::optional<std::string> tokenFile, tokenHex, tokenBase64;
   std::optional<std::string> uuid, locale, requestInfo;
   // defaults
   std::optional<std::string> key, value;
+  bool force = false;  // write a key the daemon is not known to read
 };
 
-// Either an invocation to run, or the exit status after help (0, printed on `out`) or a usage
-// error (kExitUsage, printed on `err`).
+// Either an invocation to run, or the exit status after help or the version (0, printed on `out`)
+// or a usage error (kExitUsage, printed on `err`, as JSON when --json was given).
 struct ParsedCommandLine {
   std::optional<Invocation> invocation;
   int exitStatus = kExitSuccess;
@@ -50,7 +54,7 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
 
 // The call arguments of an operation invocation, reading the token from whichever source was
 // given; nullopt with *error set for unusable input (a usage error).
-std::optional<zlka_client::MetadataArguments> metadataArguments(const Invocation& invocation, std::string* error);
-std::optional<zlka_client::TokenArguments> tokenArguments(const Invocation& invocation, std::string* error);
+std::optional<zlka::MetadataArguments> metadataArguments(const Invocation& invocation, std::string* error);
+std::optional<zlka::TokenArguments> tokenArguments(const Invocation& invocation, std::string* error);
 
 }  // namespace zlkactl

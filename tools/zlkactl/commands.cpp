@@ -1,6 +1,7 @@
 #include "zlkactl/commands.h"
 
-#include "client/zlka_client.h"
+#include <chrono>
+
 #include "zlkactl/output_format.h"
 
 namespace zlkactl {
@@ -8,45 +9,52 @@ namespace zlkactl {
 namespace {
 
 template <class T>
-int finish(const zlka_client::Result<T>& result, std::ostream& out, std::ostream& err, std::string (*format)(const T&, bool), bool json) {
+int finish(const zlka::Result<T>& result, std::ostream& out, std::ostream& err, std::string (*format)(const T&, bool), bool json) {
   if (!result) {
-    err << formatError(result.error());
+    err << formatError(result.error(), json);
     return exitStatusFor(result.error());
   }
   out << format(result.value(), json);
   return kExitSuccess;
 }
 
-std::string confirmationText(const zlka_client::Confirmation&, bool json) { return formatConfirmation(json); }
+std::string confirmationText(const zlka::Confirmation&, bool json) { return formatConfirmation(json); }
+
+bool isClientError(const zlka::Error& error, zlka::ClientErrorCode code) {
+  return error.domain == zlka::kClientErrorDomain && error.code == static_cast<int64_t>(code);
+}
 
 }  // namespace
 
-int exitStatusFor(const platform::Error& error) {
-  if (zlka_client::isServiceUnreachable(error)) return kExitUnreachable;
-  if (error.domain() == zlka_client::kClientErrorDomain &&
-      error.code() == static_cast<int64_t>(zlka_client::ClientErrorCode::InvalidRequest))
-    return kExitUsage;
+int exitStatusFor(const zlka::Error& error) {
+  using zlka::ClientErrorCode;
+  if (isClientError(error, ClientErrorCode::ConnectionFailed) || isClientError(error, ClientErrorCode::ServiceUnavailable))
+    return kExitUnreachable;
+  if (isClientError(error, ClientErrorCode::InvalidRequest)) return kExitUsage;
   return kExitOperationFailed;
+}
+
+int fail(const Invocation& inv, std::ostream& err, int exitStatus, std::string description) {
+  err << formatError(toolError(exitStatus, std::move(description)), inv.json);
+  return exitStatus;
 }
 
 int runOperation(const Invocation& inv, std::ostream& out, std::ostream& err) {
   // Input is checked before the bus is touched, so that a typo never costs a round trip.
   std::string problem;
-  std::optional<zlka_client::MetadataArguments> metadata;
-  std::optional<zlka_client::TokenArguments> token;
+  std::optional<zlka::MetadataArguments> metadata;
+  std::optional<zlka::TokenArguments> token;
   if (inv.command == Command::Metadata) metadata = metadataArguments(inv, &problem);
   else token = tokenArguments(inv, &problem);
-  if (!metadata && !token) {
-    err << "zlkactl: " << problem << "\n";
-    return kExitUsage;
-  }
+  if (!metadata && !token) return fail(inv, err, kExitUsage, problem);
 
-  auto client = zlka_client::ZLKAClient::connect({.bus = inv.bus});
+  const auto timeout = std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::duration<double>(inv.timeoutSeconds));
+  auto client = zlka::Client::connect({.bus = inv.bus, .callTimeout = timeout});
   if (!client) {
-    err << formatError(client.error());
+    err << formatError(client.error(), inv.json);
     return exitStatusFor(client.error());
   }
-  zlka_client::ZLKAClient& c = *client.value();
+  zlka::Client& c = *client.value();
   switch (inv.command) {
     case Command::Metadata: return finish(c.requestMetadata(*metadata), out, err, &formatMetadata, inv.json);
     case Command::Activate: return finish(c.requestActivation(*token), out, err, &formatActivation, inv.json);

@@ -1,3 +1,7 @@
+#include <algorithm>
+#include <iterator>
+
+#include "network/zlka_network_constants.h"
 #include "platform/config/configuration.h"
 #include "platform/config/settings_store.h"
 #include "zlkactl/commands.h"
@@ -8,18 +12,26 @@ namespace zlkactl {
 
 namespace {
 
-constexpr char kSuiteName[] = "com.kestro.ZLKAuthentication";
+bool daemonReads(const std::string& key) {
+  return std::any_of(std::begin(ZLKAUserDefaultsKeys), std::end(ZLKAUserDefaultsKeys), [&](const char* known) { return key == known; });
+}
+
+std::string knownKeys() {
+  std::string list;
+  for (const char* known : ZLKAUserDefaultsKeys) list += (list.empty() ? "" : ", ") + std::string(known);
+  return list;
+}
 
 }  // namespace
 
 int runDefaults(const Invocation& inv, std::ostream& out, std::ostream& err) {
+  // A misspelt key would be written and silently ignored by the daemon.
+  if (inv.command == Command::DefaultsWrite && !inv.force && !daemonReads(*inv.key))
+    return fail(inv, err, kExitUsage, "zlkad reads no setting '" + *inv.key + "' (it reads " + knownKeys() + "); --force writes it anyway");
   std::string problem;
   std::optional<platform::Configuration> configuration = platform::loadConfiguration(inv.configPath, &problem);
-  if (!configuration) {
-    err << "zlkactl: " << problem << "\n";
-    return kExitUsage;
-  }
-  platform::SettingsStore store(kSuiteName, configuration->settingsDirectory);
+  if (!configuration) return fail(inv, err, kExitUsage, problem);
+  platform::SettingsStore store(ZLKAUserDefaultsDomain, configuration->settingsDirectory);
   const std::string path = store.filePath().string();
 
   switch (inv.command) {
@@ -29,24 +41,16 @@ int runDefaults(const Invocation& inv, std::ostream& out, std::ostream& err) {
         return kExitSuccess;
       }
       std::optional<platform::Value> value = store.objectForKey(*inv.key);
-      if (!value) {
-        err << "zlkactl: " << kSuiteName << " has no value for '" << *inv.key << "' (" << path << ")\n";
-        return kExitOperationFailed;
-      }
+      if (!value)
+        return fail(inv, err, kExitOperationFailed, std::string(ZLKAUserDefaultsDomain) + " has no value for '" + *inv.key + "' (" + path + ")");
       out << jsonText(*value, true) << "\n";
       return kExitSuccess;
     }
     case Command::DefaultsWrite:
-      if (!store.setObject(*inv.key, parseSettingsValue(*inv.value))) {
-        err << "zlkactl: cannot write " << path << "\n";
-        return kExitOperationFailed;
-      }
+      if (!store.setObject(*inv.key, parseSettingsValue(*inv.value))) return fail(inv, err, kExitOperationFailed, "cannot write " + path);
       return kExitSuccess;
     default:
-      if (!store.removeObject(*inv.key)) {
-        err << "zlkactl: cannot write " << path << "\n";
-        return kExitOperationFailed;
-      }
+      if (!store.removeObject(*inv.key)) return fail(inv, err, kExitOperationFailed, "cannot write " + path);
       return kExitSuccess;
   }
 }

@@ -13,15 +13,18 @@ std::string jsonText(const platform::Value& value, bool pretty) {
   return wrapped.substr(1, wrapped.size() - 2);
 }
 
-std::string formatMetadata(const zlka_client::MetadataReply& reply, bool json) {
+std::string formatMetadata(const zlka::Metadata& reply, bool json) {
+  // The library hands over JSON it has already parsed once, so this parse succeeds.
+  platform::Value metadata = platform::json::parse(reply.metadataJSON).value_or(platform::Value(platform::Dictionary{}));
   if (json) {
-    platform::Dictionary out{{"ppid", reply.ppid}, {"locale", reply.locale}, {"metadata", reply.metadata}};
+    platform::Dictionary out{{"ppid", reply.ppid}, {"locale", reply.locale}, {"metadata", std::move(metadata)}};
     return jsonText(platform::Value(std::move(out)), false) + "\n";
   }
-  return "ppid: " + reply.ppid + "\nlocale: " + reply.locale + "\nmetadata:\n" + jsonText(reply.metadata, true) + "\n";
+  return "ppid: " + reply.ppid + "\nlocale: " + reply.locale + "\nmetadata:\n" + jsonText(metadata, true) + "\n";
 }
 
-std::string formatActivation(const platform::Data& token, bool json) {
+std::string formatActivation(const zlka::Bytes& bytes, bool json) {
+  platform::Data token(bytes.data(), bytes.size());
   if (json) {
     platform::Dictionary out{{"token_hex", hexString(token)}, {"token_base64", platform::base64Encode(token.span())},
                              {"length", static_cast<uint64_t>(token.length())}};
@@ -32,8 +35,15 @@ std::string formatActivation(const platform::Data& token, bool json) {
 
 std::string formatConfirmation(bool json) { return json ? "{\"confirmed\":true}\n" : "confirmed\n"; }
 
-std::string formatError(const platform::Error& error) {
-  return "zlkactl: " + error.domain() + " " + std::to_string(error.code()) + ": " + error.localizedDescription() + "\n";
+std::string formatError(const zlka::Error& error, bool json) {
+  if (json) {
+    platform::Dictionary out{{"domain", error.domain}, {"code", error.code}, {"description", error.description}};
+    return jsonText(platform::Value(std::move(out)), false) + "\n";
+  }
+  if (error.domain == kToolErrorDomain) return "zlkactl: " + error.description + "\n";
+  return "zlkactl: " + error.domain + " " + std::to_string(error.code) + ": " + error.description + "\n";
 }
+
+zlka::Error toolError(int exitStatus, std::string description) { return {kToolErrorDomain, exitStatus, std::move(description), {}}; }
 
 }  // namespace zlkactl
