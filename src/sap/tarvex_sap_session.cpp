@@ -102,6 +102,8 @@ std::optional<std::string> TarvexSAPSession::stateName(uint64_t state_int) {
 
 void TarvexSAPSession::setState_int(uint64_t value) {
   state_int_ = value;
+  observedState_.store(value, std::memory_order_relaxed);
+  observedExpiration_.store(expiration_, std::memory_order_relaxed);
   platform::log(LogLevel::Info, "[#TarvexSAPSession] self.state_int: %@", stateName(value));
 }
 
@@ -357,9 +359,21 @@ double TarvexSAPSession::TTL() {
 void TarvexSAPSession::setTTL(double seconds) {
   internalQueue_->barrierSync([&] {
     expiration_ = now() + seconds;
+    observedExpiration_.store(expiration_, std::memory_order_relaxed);
     platform::log(LogLevel::Debug, "[#TarvexSAPSession] Setting TTL... (TTL: %f, self.expiration: %@)", seconds,
                   formatDate(expiration_));
   });
+}
+
+TarvexSAPSessionState TarvexSAPSession::observedState() const {
+  uint64_t s = observedState_.load(std::memory_order_relaxed);
+  if (s == 0) return TarvexSAPSessionStateClosed;
+  return s == kStateOpen ? TarvexSAPSessionStateOpen : TarvexSAPSessionStateInitializing;
+}
+
+double TarvexSAPSession::observedTTL() const {
+  if (observedState_.load(std::memory_order_relaxed) != kStateOpen) return 0.0;
+  return observedExpiration_.load(std::memory_order_relaxed) - now();
 }
 
 std::string TarvexSAPSession::description() {

@@ -50,6 +50,7 @@ int Listener::Core::run() {
                            "NameOwnerChanged", &Guarded<&Core::onNameOwnerChanged>::call, this);
   matchSlot_.reset(slot);
   if (rc < 0) return fail("cannot watch peers leaving the bus", rc);
+  if (options_.onServing) serving_ = options_.onServing(bus_.get(), event_.get());
   rc = sd_bus_request_name(bus_.get(), options_.serviceName.c_str(), 0);
   if (rc < 0) return fail("cannot own the name " + options_.serviceName, rc);
   lastActivity_ = now();
@@ -57,6 +58,7 @@ int Listener::Core::run() {
   log(LogLevel::Default, "Listening as %s on %s at %s", options_.serviceName, options_.bus, options_.objectPath);
   if (options_.notifyReady) sd_notify(0, "READY=1\nSTATUS=Serving requests");
   rc = sd_event_loop(event_.get());
+  serving_.reset();
   if (options_.notifyReady) sd_notify(0, "STOPPING=1");
   return rc < 0 ? 1 : rc;
 }
@@ -159,7 +161,9 @@ int Listener::Core::onIdleTimer(sd_event_source*, uint64_t, void* userdata) {
     self->beginDrain("idle");
     return 0;
   }
-  self->armIdleTimer(std::max(self->lastActivity_, t) + limit);
+  // Idle since the last call ended: due N after it. Calls in flight end at a time nobody knows yet,
+  // so look again in a second; either way the exit comes within a second of N after the last call.
+  self->armIdleTimer(self->inFlight_.load() == 0 ? self->lastActivity_ + limit : t + toUsec(std::chrono::seconds(1)));
   return 0;
 }
 

@@ -145,6 +145,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   std::vector<std::string> names_;
   BusSlotPtr vtableSlot_;
   BusSlotPtr matchSlot_;
+  std::shared_ptr<void> serving_;  // what options_.onServing made
   sd_event_source* idleTimer_ = nullptr;  // one of sources_
   std::vector<EventSourcePtr> sources_;
   std::mutex postMutex_;
