@@ -2,6 +2,8 @@
 
 #include <sys/stat.h>
 #include <sys/uio.h>
+// Otherwise sd_journal_sendv adds CODE_FILE, CODE_LINE and CODE_FUNC of this file to the caller's.
+#define SD_JOURNAL_SUPPRESS_LOCATION
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
