@@ -1,10 +1,12 @@
 #include "service/runtime_control.h"
 
-#include <systemd/sd-daemon.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <time.h>
 
-#include <cinttypes>
 #include <cmath>
+#include <cstdlib>
+#include <cstring>
 
 #include "network/zlka_network.h"
 #include "platform/bus/listener.h"
@@ -20,8 +22,29 @@ using platform::PropertyChanges;
 namespace {
 
 // Once a second costs nothing measurable: a few atomic reads, and a datagram only when the text
-// changed (once a second while a session counts down its time to live).
+// changed (the time to live counts in minutes, so about once a minute while a session is open).
 constexpr uint64_t kTickUsec = 1000000;
+
+// Tells the service manager `message` as sd_notify does, but this runs on the bus thread, which
+// must never wait: sd_notify blocks while the manager's queue is full, so a message that does not
+// fit now is dropped instead (the next change of status sends the status again).
+void notifyWithoutWaiting(const std::string& message) {
+  const char* path = std::getenv("NOTIFY_SOCKET");
+  if (!path || (path[0] != '/' && path[0] != '@')) return;
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  const size_t length = std::strlen(path);
+  if (length >= sizeof address.sun_path) return;
+  std::memcpy(address.sun_path, path, length);
+  if (path[0] == '@') address.sun_path[0] = '\0';  // an abstract socket
+  platform::UniqueFd fd(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (!fd) return;
+  const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + length);
+  if (::sendto(fd.get(), message.data(), message.size(), MSG_NOSIGNAL | MSG_DONTWAIT,
+               reinterpret_cast<const sockaddr*>(&address), size) < 0)
+    platform::log(LogLevel::Debug, "The service manager did not take %s: %s", message,
+                  std::string(std::strerror(errno)));
+}
 
 struct SessionView {
   std::string state = "closed";  // "closed", "opening", "open"
@@ -53,7 +76,7 @@ size_t callsInFlight() { return platform::Listener::serviceListener().callsInFli
 std::string statusText() {
   SessionView session = sessionView();
   std::string text = "Serving; " + std::to_string(callsInFlight()) + " call(s) in flight; session " + session.state;
-  if (session.state == "open") text += ", " + std::to_string(session.secondsToLive) + " s to live";
+  if (session.state == "open") text += ", " + std::to_string((session.secondsToLive + 59) / 60) + " min to live";
   return text;
 }
 
@@ -174,7 +197,7 @@ void RuntimeControl::tick() {
     properties_->changed(kZLKAObjectPath, kZLKAInterfaceName, {"SessionState"});
   }
   std::string status = statusText();
-  if (options_.notify && status != status_) sd_notify(0, ("STATUS=" + status).c_str());
+  if (options_.notify && status != status_) notifyWithoutWaiting("STATUS=" + status);
   status_ = std::move(status);
 }
 
@@ -212,7 +235,7 @@ std::optional<BusError> RuntimeControl::setLogTarget(sd_bus_message* value) {
 }
 
 void RuntimeControl::reload() {
-  if (options_.notify) sd_notifyf(0, "RELOADING=1\nMONOTONIC_USEC=%" PRIu64, monotonicUsec());
+  if (options_.notify) notifyWithoutWaiting("RELOADING=1\nMONOTONIC_USEC=" + std::to_string(monotonicUsec()));
   std::string error;
   std::optional<platform::Configuration> config = platform::loadConfiguration(options_.configPath, &error);
   if (!config) {
@@ -229,5 +252,5 @@ void RuntimeControl::reload() {
   }
   if (options_.reloadManifests) options_.reloadManifests();
   status_ = statusText();
-  if (options_.notify) sd_notify(0, ("READY=1\nSTATUS=" + status_).c_str());
+  if (options_.notify) notifyWithoutWaiting("READY=1\nSTATUS=" + status_);
 }
