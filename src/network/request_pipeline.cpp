@@ -8,6 +8,7 @@
 #include "support/base64_array.h"
 #include "support/entitlements.h"
 #include "support/errors.h"
+#include "support/message_ids.h"
 
 using platform::Data;
 using platform::Error;
@@ -41,7 +42,8 @@ bool callerIsEntitled() {
 
 Error failure(int64_t code) {
   Error error = ZLKA_errorWithDomain(ZLKATokenManagerErrorDomain, code);
-  platform::log(LogLevel::Fault, "[#TokenAuth] error: %@", error);
+  platform::log(LogLevel::Fault, code == ZLKAErrorMissingEntitlement ? kMessageCallerRefused : kMessageOperationFailed,
+                "[#TokenAuth] error: %@", error);
   return error;
 }
 

@@ -7,6 +7,7 @@
 #include "platform/values/base64.h"
 #include "platform/log/log.h"
 #include "platform/dispatch/semaphore.h"
+#include "support/message_ids.h"
 
 using platform::Data;
 using platform::Error;
@@ -36,9 +37,9 @@ std::optional<Error> ZLKANetwork::_openTarvexSAPSession() {
   auto shared = std::make_shared<Rendezvous<bool>>();
   session->openWithCompletionHandler([shared](std::optional<Error> error) {
     if (error) {
-      platform::log(LogLevel::Error, "[#TokenAuth] Couldn't open Tarvex SAP session:\n%@", error);
+      platform::log(LogLevel::Error, kMessageSessionFailed, "[#TokenAuth] Couldn't open Tarvex SAP session:\n%@", error);
     } else {
-      platform::log(LogLevel::Default, "[#TokenAuth] Tarvex SAP session opened!");
+      platform::log(LogLevel::Default, kMessageSessionOpened, "[#TokenAuth] Tarvex SAP session opened!");
     }
     {
       std::lock_guard lock(shared->mutex);

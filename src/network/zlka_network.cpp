@@ -1,5 +1,7 @@
 #include "network/zlka_network.h"
 
+#include <atomic>
+
 #include "network/zlka_network_exported.h"
 #include "platform/config/configuration.h"
 #include "platform/values/exception.h"
@@ -10,7 +12,8 @@ using platform::LogLevel;
 
 namespace {
 constexpr char kClassName[] = "ZLKANetwork";
-}
+std::atomic<bool> gMade{false};
+}  // namespace
 
 ZLKANetwork::ZLKANetwork(Private) {}
 
@@ -21,8 +24,13 @@ std::shared_ptr<ZLKANetwork> ZLKANetwork::sharedInstance() {
     auto made = std::make_shared<ZLKANetwork>(Private{});
     made->_init();
     instance = std::move(made);
+    gMade.store(true);
   });
   return instance;
+}
+
+std::shared_ptr<ZLKANetwork> ZLKANetwork::existingInstance() {
+  return gMade.load() ? sharedInstance() : nullptr;
 }
 
 std::shared_ptr<ZLKANetwork> ZLKANetwork::init() {

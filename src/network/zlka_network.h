@@ -26,6 +26,9 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
                           public std::enable_shared_from_this<ZLKANetwork> {
  public:
   static std::shared_ptr<ZLKANetwork> sharedInstance();
+  // existingInstance is the shared instance once something has made it, else null (it never makes
+  // one: monitoring must not start the session's machinery).
+  static std::shared_ptr<ZLKANetwork> existingInstance();
   // Forbidden: the instance comes from sharedInstance(). Throws InternalInconsistencyException.
   [[noreturn]] static std::shared_ptr<ZLKANetwork> init();
   ~ZLKANetwork() override;

@@ -106,6 +106,8 @@ std::optional<std::string> TarvexSAPSession::stateName(uint64_t state_int) {
 
 void TarvexSAPSession::setStep(Step step) {
   step_ = step;
+  observedState_.store(state_int(), std::memory_order_relaxed);
+  observedExpiration_.store(expiration_, std::memory_order_relaxed);
   platform::log(LogLevel::Info, "[#TarvexSAPSession] self.state_int: %@", stateName(state_int()));
 }
 
@@ -369,9 +371,21 @@ double TarvexSAPSession::TTL() {
 void TarvexSAPSession::setTTL(double seconds) {
   internalQueue_->barrierSync([&] {
     expiration_ = now() + seconds;
+    observedExpiration_.store(expiration_, std::memory_order_relaxed);
     platform::log(LogLevel::Debug, "[#TarvexSAPSession] Setting TTL... (TTL: %f, self.expiration: %@)", seconds,
                   formatDate(expiration_));
   });
+}
+
+TarvexSAPSessionState TarvexSAPSession::observedState() const {
+  auto step = static_cast<Step>(observedState_.load(std::memory_order_relaxed));
+  if (step == Step::Closed) return TarvexSAPSessionStateClosed;
+  return step == Step::Open ? TarvexSAPSessionStateOpen : TarvexSAPSessionStateInitializing;
+}
+
+double TarvexSAPSession::observedTTL() const {
+  if (static_cast<Step>(observedState_.load(std::memory_order_relaxed)) != Step::Open) return 0.0;
+  return observedExpiration_.load(std::memory_order_relaxed) - now();
 }
 
 std::string TarvexSAPSession::description() {

@@ -11,6 +11,7 @@
 // it alive while an open runs, or the open never completes.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -58,6 +59,13 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   double TTL();              // seconds left while open (negative once past), else 0
   void setTTL(double seconds);
   std::string description();  // "TarvexSAPSession <state: [Open], TTL: 3599.998000s>"
+
+  // observedState and observedTTL answer at once, from any thread (the internal queue included),
+  // for monitoring: the state and seconds left as the internal queue last set them. Unlike
+  // state(), they do not close an expired session, so an open one past its time reads as open
+  // with a negative TTL until its next use closes it.
+  TarvexSAPSessionState observedState() const;
+  double observedTTL() const;
 
   const platform::UUID& UUID() const { return uuid_; }
   std::weak_ptr<TarvexSAPSessionDelegate> delegate() const { return delegate_; }
@@ -119,4 +127,7 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   double expiration_;  // seconds since 1970
   uint64_t openGeneration_ = 0;
   TarvexSAPPrimitives primitives_;
+  // Mirrors of step_ and expiration_ for observedState() and observedTTL().
+  std::atomic<uint64_t> observedState_{0};
+  std::atomic<double> observedExpiration_{0};
 };

@@ -1,9 +1,6 @@
 #include "service/daemon_setup.h"
 
 #include <CLI/CLI.hpp>
-#include <cstdio>
-#include <fstream>
-#include <sstream>
 
 #include "platform/config/configuration.h"
 #include "platform/config/device_facts.h"
@@ -11,8 +8,9 @@
 #include "platform/bus/listener.h"
 #include "platform/log/log.h"
 #include "platform/dispatch/worker_pool.h"
+#include "service/config_check.h"
+#include "service/runtime_control.h"
 #include "service/zlka_network_bus_interface.h"
-#include "tarvexsap/tarvex_sap.h"
 
 using platform::LogLevel;
 
@@ -24,6 +22,7 @@ struct CommandLine {
   std::string logBackend;
   std::string logLevel;
   unsigned exitOnIdle = 0;
+  bool checkConfig = false;
 };
 
 std::optional<int> parse(int argc, char** argv, CommandLine& cl) {
@@ -43,22 +42,27 @@ std::optional<int> parse(int argc, char** argv, CommandLine& cl) {
   app.add_option("--exit-on-idle", cl.exitOnIdle,
                  "Exit after this many seconds with no call in flight and no new call (0: never)")
       ->check(CLI::Range(0u, 86400u * 365u));
+  app.add_flag("--check-config", cl.checkConfig,
+               "Check the configuration and the files it names, then exit: 0 when zlkad could start with it, " +
+                   std::to_string(kExitConfiguration) + " when not. Touches no bus.");
   app.set_version_flag("--version", std::string("zlkad ") + ZLKA_VERSION);
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
     int status = app.exit(e);  // prints the help, the version or the mistake
-    return status == 0 ? 0 : 2;
+    return status == 0 ? 0 : kExitUsage;
   }
   return std::nullopt;
 }
 
-std::optional<std::string> readFile(const std::filesystem::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return std::nullopt;
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
+// The log as the command line asks for it; the file's level follows once the file is read.
+void configureLogFromCommandLine(const CommandLine& cl) {
+  platform::LogSettings log;
+  if (!cl.logLevel.empty()) log.minimum = *platform::logLevelFromName(cl.logLevel);
+  log.backend = cl.logBackend == "journal" ? platform::LogBackend::Journal
+                : cl.logBackend == "stderr" ? platform::LogBackend::Stderr
+                                            : platform::LogBackend::Auto;
+  platform::configureLog(log);
 }
 
 }  // namespace
@@ -66,36 +70,40 @@ std::optional<std::string> readFile(const std::filesystem::path& path) {
 std::optional<int> setUpDaemon(int argc, char** argv) {
   CommandLine cl;
   if (auto status = parse(argc, argv, cl)) return status;
+  configureLogFromCommandLine(cl);
 
+  // Fatal problems go out at error priority through the log, where `journalctl -p err` finds them.
   std::string error;
   std::optional<platform::Configuration> config = platform::loadConfiguration(cl.config, &error);
   if (!config) {
-    std::fprintf(stderr, "zlkad: %s\n", error.c_str());
-    return 1;
+    platform::log(LogLevel::Error, "%s", error);
+    return kExitConfiguration;
   }
-  platform::LogSettings log;
-  log.minimum = cl.logLevel.empty() ? config->logLevel : *platform::logLevelFromName(cl.logLevel);
+  platform::LogSettings log = platform::currentLogSettings();
+  if (cl.logLevel.empty()) log.minimum = config->logLevel;
   log.privateData = config->privateData;
-  log.backend = cl.logBackend == "journal" ? platform::LogBackend::Journal
-                : cl.logBackend == "stderr" ? platform::LogBackend::Stderr
-                                            : platform::LogBackend::Auto;
   platform::configureLog(log);
   for (const std::string& warning : config->warnings) platform::log(LogLevel::Error, "%s", warning);
-
-  std::optional<std::string> anchor = readFile(config->trustAnchor);
-  TarvexSAPConfig sap{};
-  if (anchor) sap = {reinterpret_cast<const uint8_t*>(anchor->data()), anchor->size(), nullptr};
-  if (!anchor || TarvexSAPConfigure(&sap) != 0) {
-    std::fprintf(stderr, "zlkad: %s: sap.trust_anchor: %s is not a readable PEM certificate\n", config->path.c_str(),
-                 config->trustAnchor.c_str());
-    return 1;
-  }
+  std::vector<std::string> problems = startUpProblems(*config);
+  for (const std::string& problem : problems) platform::log(LogLevel::Error, "%s", problem);
+  if (!problems.empty()) return kExitConfiguration;
 
   platform::setDeviceFacts(config->device);
   platform::WorkerPool::connections().setMaximum(config->maxWorkers);
   auto manifests = std::make_shared<platform::EntitlementManifests>(config->entitlementsDirectory);
   size_t entries = manifests->reload();
   platform::log(LogLevel::Info, "Loaded %zu entitlement manifest entr(ies) from %s", entries, config->entitlementsDirectory.string());
+  if (cl.checkConfig) {
+    // At start an unusable manifest is only ignored; a check says so, since no caller it names gets in.
+    size_t files = manifestFileCount(config->entitlementsDirectory);
+    if (entries < files) {
+      platform::log(LogLevel::Error, "%s: %zu of %zu entitlement manifest(s) ignored (see above)", config->path.string(),
+                    files - entries, files);
+      return kExitConfiguration;
+    }
+    platform::log(LogLevel::Default, "%s: the configuration is usable", config->path.string());
+    return 0;
+  }
 
   platform::ListenerOptions options;
   options.bus = cl.bus;
@@ -108,10 +116,26 @@ std::optional<int> setUpDaemon(int argc, char** argv) {
                   peer.executable.value_or("an executable that cannot be established"));
     return [manifests, peer = std::move(peer)](std::string_view key) { return manifests->valueFor(peer, key); };
   };
-  options.onReload = [manifests] {
+  RuntimeOptions runtime;
+  runtime.configPath = config->path;
+  runtime.levelFromCommandLine = !cl.logLevel.empty();
+  runtime.reloadManifests = [manifests] {
     size_t n = manifests->reload();
     platform::log(LogLevel::Default, "Reloaded %zu entitlement manifest entr(ies)", n);
   };
+  auto control = std::make_shared<std::weak_ptr<RuntimeControl>>();
+  options.onServing = [control, runtime](sd_bus* bus, sd_event* event) -> std::shared_ptr<void> {
+    std::shared_ptr<RuntimeControl> started = RuntimeControl::start(bus, event, runtime);
+    *control = started;
+    return started;
+  };
+  options.onReload = [control, reloadManifests = runtime.reloadManifests] {
+    if (auto c = control->lock())
+      c->reload();
+    else
+      reloadManifests();
+  };
+  options.drainLimit = kDrainLimit;
   if (cl.exitOnIdle > 0) options.exitOnIdle = std::chrono::seconds(cl.exitOnIdle);
   platform::setCurrentConfiguration(std::move(*config));
   platform::Listener::configure(std::move(options));

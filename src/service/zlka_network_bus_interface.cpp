@@ -8,6 +8,7 @@
 #include "platform/bus/bus_values.h"
 #include "platform/values/json.h"
 #include "platform/log/log.h"
+#include "service/answer_counts.h"
 #include "support/errors.h"
 
 using platform::BusError;
@@ -69,13 +70,27 @@ std::optional<BusError> unsendable(std::initializer_list<std::pair<const char*, 
   return std::nullopt;
 }
 
+// Every answer of the three methods goes through one of these, so that the counts see them all.
+void answer(const Reply& reply, Reply::Writer writer) {
+  answerCounts().add("");
+  reply.send(std::move(writer));
+}
+void refuse(const Reply& reply, BusError error) {
+  answerCounts().add(error.name);
+  reply.fail(std::move(error));
+}
+DecodedCall refused(BusError error) {
+  answerCounts().add(error.name);
+  return {nullptr, std::move(error)};
+}
+
 std::shared_ptr<ZLKANetworkProtocol> exported(const std::shared_ptr<void>& object) {
   return std::static_pointer_cast<ZLKANetworkProtocol>(object);
 }
 
 DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
-  if (auto error = readArguments(m, true, args)) return {nullptr, error};
+  if (auto error = readArguments(m, true, args)) return refused(*error);
   return {
       [object, args](Reply reply) {
         std::optional<platform::Locale> locale;
@@ -85,12 +100,12 @@ DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& objec
             [reply](std::optional<std::string> ppid, std::optional<platform::Locale> answered,
                     std::optional<platform::Dictionary> metadata, std::optional<platform::Error> error) {
               if (error || !ppid || !answered || !metadata)
-                return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+                return refuse(reply, error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
               std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
               std::string locale = answered->localeIdentifier();
-              if (auto refused = unsendable({{"ppid", &*ppid}, {"locale", &locale}, {"metadata", &json}}))
-                return reply.fail(*refused);
-              reply.send([ppid = *ppid, locale = std::move(locale), json = std::move(json)](sd_bus_message* r) {
+              if (auto bad = unsendable({{"ppid", &*ppid}, {"locale", &locale}, {"metadata", &json}}))
+                return refuse(reply, *bad);
+              answer(reply, [ppid = *ppid, locale = std::move(locale), json = std::move(json)](sd_bus_message* r) {
                 return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
               });
             });
@@ -100,14 +115,14 @@ DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& objec
 
 DecodedCall decodeActivation(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
-  if (auto error = readArguments(m, false, args)) return {nullptr, error};
+  if (auto error = readArguments(m, false, args)) return refused(*error);
   return {
       [object, args](Reply reply) {
         exported(object)->requestActivationForToken(
             args.token, args.uuid, [reply](std::optional<Data> newToken, std::optional<platform::Error> error) {
               if (error || !newToken)
-                return reply.fail(error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
-              reply.send([token = *newToken](sd_bus_message* r) {
+                return refuse(reply, error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+              answer(reply, [token = *newToken](sd_bus_message* r) {
                 return sd_bus_message_append_array(
                     r, 'y', token.bytes() ? token.bytes() : reinterpret_cast<const uint8_t*>(""), token.length());
               });
@@ -118,12 +133,12 @@ DecodedCall decodeActivation(sd_bus_message* m, const std::shared_ptr<void>& obj
 
 DecodedCall decodeConfirmation(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
-  if (auto error = readArguments(m, false, args)) return {nullptr, error};
+  if (auto error = readArguments(m, false, args)) return refused(*error);
   return {[object, args](Reply reply) {
             exported(object)->confirmActivationForToken(args.token, args.uuid,
                                                         [reply](std::optional<platform::Error> error) {
-                                                          if (error) return reply.fail(busErrorForError(*error));
-                                                          reply.send(nullptr);
+                                                          if (error) return refuse(reply, busErrorForError(*error));
+                                                          answer(reply, nullptr);
                                                         });
           },
           std::nullopt};

@@ -83,7 +83,7 @@ TEST(Configuration, EveryProblemNamesTheFileAndTheKey) {
   }
   std::string error;
   EXPECT_FALSE(platform::loadConfiguration(kFile.parent_path(), &error));
-  EXPECT_EQ(error, kFile.parent_path().string() + ": cannot read the configuration file (missing or not a file)");
+  EXPECT_EQ(error, kFile.parent_path().string() + ": cannot read the configuration file: is not a regular file");
 }
 
 TEST(Configuration, BaseURLsAreAbsoluteHttpsWithoutPathQueryOrUser) {

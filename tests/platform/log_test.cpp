@@ -89,6 +89,28 @@ TEST(Log, StderrLinesCarryTimeIdentifierLevelAndModuleAndStayOneLine) {
   EXPECT_TRUE(platform::Log::create("sub system", "a category"));
 }
 
+TEST(Log, JournalEntriesNameTheCallersPlaceTheirModuleAndTheirEvent) {
+  zlkatest::LogCapture capture;
+  const unsigned line = __LINE__ + 1;
+  platform::log(LogLevel::Default, platform::MessageID{"3b3c29f1b71344dbb4e0a7e61382ddca"}, "opened %d", 1);
+  const auto e = capture.entries();
+  ASSERT_EQ(e.size(), 1u);
+  // The call's place, not the log back end's.
+  EXPECT_EQ(std::tuple(e[0].file, e[0].line, e[0].messageID), std::tuple("tests/platform/log_test.cpp", line, "3b3c29f1b71344dbb4e0a7e61382ddca"));
+  EXPECT_THAT(e[0].function, testing::EndsWith("_Test::TestBody"));
+  using Fields = std::vector<std::string>;
+  platform::LogEntry entry{LogLevel::Error, "", "", "m", "src/platform/bus/listener.cpp", 7, "platform::Listener::Core::run", ""};
+  EXPECT_EQ(platform::journalFields(entry, "zlkad"),
+            (Fields{"MESSAGE=m", "PRIORITY=3", "SYSLOG_IDENTIFIER=zlkad", "ZLKA_SUBSYSTEM=com.kestro.ZLKAuthentication",
+                    "ZLKA_CATEGORY=bus", "CODE_FILE=src/platform/bus/listener.cpp", "CODE_LINE=7", "CODE_FUNC=platform::Listener::Core::run"}));
+  // A log object's own names win; the default log's category is the module of the call.
+  entry = {LogLevel::Fault, "com.example.sub", "cat", "m", "src/network/metadata_query.cpp", 1, "f", "6113ffeebbf84fa0b42d7f30bad01cc9"};
+  EXPECT_THAT(platform::journalFields(entry, "zlkad"),
+              testing::IsSupersetOf({"ZLKA_SUBSYSTEM=com.example.sub", "ZLKA_CATEGORY=cat", "MESSAGE_ID=6113ffeebbf84fa0b42d7f30bad01cc9"}));
+  entry.subsystem = "";
+  EXPECT_THAT(platform::journalFields(entry, "zlkad"), testing::Contains("ZLKA_CATEGORY=network"));
+}
+
 TEST(Log, LevelNamesAndJournalPriorities) {
   for (const auto& [level, name, priority] : {std::tuple{LogLevel::Debug, "debug", 7}, {LogLevel::Info, "info", 6},
            {LogLevel::Default, "default", 5}, {LogLevel::Error, "error", 3}, {LogLevel::Fault, "fault", 2}}) {

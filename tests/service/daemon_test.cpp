@@ -2,6 +2,7 @@
 // operation runs, the error names and reply shapes it answers with, a client that leaves, and the
 // process's start, shutdown and idle exit. What the operations do is the network tests' business.
 #include <gmock/gmock.h>
+#include <pwd.h>
 #include <signal.h>
 
 #include <fstream>
@@ -33,6 +34,23 @@ int appendToken(sd_bus_message* m, size_t size) {
   if (r >= 0) r = sd_bus_message_append_array(m, 'y', token.data(), token.size());
   for (int i = 0; i < 3 && r >= 0; ++i) r = sd_bus_message_close_container(m);
   return r;
+}
+
+// The members of `interface` in introspection XML, one line each ("arg ppid s out"), without the
+// annotations: what the file in dist/ promises, or what the daemon serves.
+std::vector<std::string> members(const std::string& xml, const std::string& interface) {
+  const size_t start = xml.find("<interface name=\"" + interface + "\"");
+  if (start == std::string::npos) return {};
+  const std::string body = xml.substr(start, xml.find("</interface>", start) - start);
+  const std::regex element(R"(<(method|property|signal|arg)\s([^>]*)>)"), attribute(R"re((\w+)="([^"]*)")re");
+  std::vector<std::string> out;
+  for (std::sregex_iterator e(body.begin(), body.end(), element), end; e != end; ++e) {
+    std::map<std::string, std::string> a;
+    const std::string attributes = (*e)[2];
+    for (std::sregex_iterator i(attributes.begin(), attributes.end(), attribute); i != end; ++i) a[(*i)[1]] = (*i)[2];
+    out.push_back((*e)[1].str() + " " + a["name"] + " " + a["type"] + " " + a["direction"] + a["access"]);
+  }
+  return out;
 }
 
 // A daemon that entitles this program, on an internal build so that its settings suite counts.
@@ -139,20 +157,113 @@ TEST_F(Daemon, SigtermAnswersEveryCallInFlight) {
   EXPECT_THAT(harness.daemon()->standardError(), HasSubstr("Shutting down (SIGTERM)"));
 }
 
-TEST(DaemonProcess, ABadStartIsRefusedNamingWhatIsWrong) {
-  Harness harness;
-  const auto config = harness.stateDirectory() / "zlkad.toml";
-  std::ofstream(harness.directory() / "anchor.toml") << std::regex_replace(readText(config), std::regex("sap-root.pem"), "zlkad.toml");
-  const std::tuple<std::string, std::string, int, const char*> rows[] = {
-      {"--config", (harness.directory() / "anchor.toml").string(), 1, "anchor.toml: sap.trust_anchor: "},  // not a certificate
-      {"--config", (harness.directory() / "absent.toml").string(), 1, "absent.toml"},
-      {"--log-level", "loud", 2, "--log-level"},  // a usage error
+TEST(DaemonProcess, ABadStartOrCheckIsRefusedNamingWhatIsWrong) {
+  Harness harness(/*anyUser=*/true);  // so that a check may run as another user
+  const auto dir = harness.directory();
+  const std::string config = (harness.stateDirectory() / "zlkad.toml").string();
+  auto variant = [&](const std::string& name, const std::string& from, const std::string& to) {
+    std::ofstream(dir / name) << std::regex_replace(readText(config), std::regex(from), to);
+    return (dir / name).string();
   };
-  for (const auto& [option, value, status, mention] : rows) {
-    auto run = zlkatest::runToEnd({ZLKAD_PATH, "--bus", harness.busAddress(), option, value}, harness.directory());
-    EXPECT_EQ(run.status, status) << run.err;
-    EXPECT_THAT(run.err, HasSubstr(mention));
+  std::filesystem::create_directory(dir / "bad-manifests");
+  std::ofstream(dir / "bad-manifests" / "nobody.json") << "{}";  // pins no user
+  std::ofstream(dir / "secret.toml") << readText(config);
+  std::filesystem::permissions(dir / "secret.toml", std::filesystem::perms::none);
+  // Root reads any file: the permission row runs as nobody then.
+  std::vector<std::string> asNobody;
+  if (const passwd* p = getpwnam("nobody"); geteuid() == 0 && p)
+    asNobody = {"/usr/bin/setpriv", "--reuid=" + std::to_string(p->pw_uid), "--regid=" + std::to_string(p->pw_gid), "--clear-groups"};
+  const std::string bus = harness.busAddress(), noBus = "unix:path=/nonexistent";  // a check never connects
+  struct Row {
+    const char* name;
+    std::vector<std::string> arguments;
+    int status;
+    std::string mention;
+  };
+  // clang-format off
+  const Row rows[] = {
+      {"anchor_not_a_certificate", {"--bus", bus, "--config", variant("anchor.toml", "sap-root.pem", "zlkad.toml")}, 78,
+       "anchor.toml: sap.trust_anchor: " + (dir / "state" / "zlkad.toml").string() + ": is not a PEM certificate"},
+      {"absent", {"--bus", bus, "--config", (dir / "absent.toml").string()}, 78, "absent.toml: cannot read the configuration file: does not exist"},
+      // Found at start, not by the first call failing with -5.
+      {"ca_file_absent", {"--bus", bus, "--config", variant("ca.toml", "ca\\.pem", "absent.pem")}, 78, "ca.toml: tls.ca_file: "},
+      {"usage", {"--bus", bus, "--log-level", "loud"}, 2, "--log-level"},
+      {"check_passes", {"--bus", noBus, "--check-config", "--config", config}, 0, "the configuration is usable"},
+      {"check_ca_file_absent", {"--bus", noBus, "--check-config", "--config", (dir / "ca.toml").string()}, 78, "absent.pem: does not exist"},
+      {"check_unreadable", {"--bus", noBus, "--check-config", "--config", (dir / "secret.toml").string()}, 78,
+       "secret.toml: cannot read the configuration file: permission denied"},
+      {"check_manifest_ignored", {"--bus", noBus, "--check-config", "--config", variant("manifests.toml", "entitlements\\.d", "../bad-manifests")},
+       78, "1 of 1 entitlement manifest(s) ignored"},
+      {"check_entitlements_dir_absent", {"--bus", noBus, "--check-config", "--config", variant("nodir.toml", "entitlements\\.d", "absent.d")},
+       78, "entitlements.dir: " + (dir / "state" / "absent.d").string() + ": does not exist"},
+  };
+  // clang-format on
+  for (const Row& row : rows) {
+    std::vector<std::string> argv = std::string(row.name) == "check_unreadable" ? asNobody : std::vector<std::string>{};
+    argv.push_back(ZLKAD_PATH);
+    argv.insert(argv.end(), row.arguments.begin(), row.arguments.end());
+    auto run = zlkatest::runToEnd(argv, harness.directory());
+    EXPECT_EQ(run.status, row.status) << row.name << ": " << run.err;
+    EXPECT_THAT(run.err, HasSubstr(row.mention)) << row.name;
+    // Fatal problems are errors in the log, so `journalctl -p err` shows them.
+    if (row.status == 78) {
+      EXPECT_THAT(run.err, HasSubstr("<error> ")) << row.name;
+    }
   }
+}
+
+TEST(DaemonProcess, PropertiesShowWhatItDoesAndRootChangesTheLogLevelAtOnce) {
+  Harness harness(/*anyUser=*/true);  // so that another user may try to change the level
+  harness.entitleSelf();
+  ASSERT_TRUE(harness.startDaemon());  // at --log-level info
+  auto busctl = [&](std::vector<std::string> arguments, std::vector<std::string> launcher = {}) {
+    launcher.insert(launcher.end(), {"/usr/bin/busctl", "--address=" + harness.busAddress()});
+    launcher.insert(launcher.end(), arguments.begin(), arguments.end());
+    return zlkatest::runToEnd(launcher, harness.directory());
+  };
+  const std::string name = "com.kestro.ZLKAuthentication.ZLKANetwork", path = "/com/kestro/ZLKAuthentication/ZLKANetwork",
+                    interface = "com.kestro.ZLKAuthentication.ZLKANetworkProtocol";
+  const std::vector<std::string> logLevel = {name, "/org/freedesktop/LogControl1", "org.freedesktop.LogControl1", "LogLevel"};
+  auto get = [&](const std::vector<std::string>& property) {
+    std::vector<std::string> arguments = {"get-property"};
+    arguments.insert(arguments.end(), property.begin(), property.end());
+    return busctl(arguments).out;
+  };
+
+  // The file in dist/ is the interface served, properties included.
+  const auto served = members(busctl({"introspect", "--xml-interface", name, path}).out, interface);
+  EXPECT_EQ(served, members(readText(std::string(DIST_DIR) + "/" + interface + ".xml"), interface));
+  EXPECT_THAT(served, testing::Contains("property Answers a{st} read"));
+
+  auto client = harness.connect();
+  ASSERT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), "ok");
+  EXPECT_EQ(outcome(client->callRaw("ConfirmActivationForToken", [](sd_bus_message* m) { return appendToken(m, 64 * 1024 + 1); })).substr(0, 24),
+            "ZLKAClientErrorDomain 4:");
+  EXPECT_EQ(get({name, path, interface, "SessionState"}), "s \"open\"\n");
+  EXPECT_THAT(get({name, path, interface, "SessionTimeToLive"}), testing::MatchesRegex("t [1-9][0-9]*\n"));
+  EXPECT_EQ(get({name, path, interface, "CallsInFlight"}), "u 0\n");
+  const std::string answers = get({name, path, interface, "Answers"});
+  EXPECT_THAT(answers, HasSubstr("\"ok\" 1 ")) << answers;
+  EXPECT_THAT(answers, HasSubstr("\"org.freedesktop.DBus.Error.InvalidArgs\" 1")) << answers;
+  EXPECT_THAT(answers, HasSubstr("\"com.kestro.ZLKAuthentication.Error.Network\" 0")) << answers;
+
+  EXPECT_EQ(get(logLevel), "s \"info\"\n");
+  std::vector<std::string> set = {"set-property"};
+  set.insert(set.end(), logLevel.begin(), logLevel.end());
+  set.insert(set.end(), {"s", "debug"});
+  // The test bus lets anyone send anything: what refuses another user here is the daemon's own check.
+  if (const passwd* p = getpwnam("nobody"); geteuid() == 0 && p) {
+    auto refused = busctl(set, {"/usr/bin/setpriv", "--reuid=" + std::to_string(p->pw_uid), "--regid=" + std::to_string(p->pw_gid), "--clear-groups"});
+    EXPECT_NE(refused.status, 0);
+    EXPECT_THAT(refused.err, HasSubstr("Access denied"));
+    EXPECT_EQ(get(logLevel), "s \"info\"\n");
+  }
+  EXPECT_THAT(harness.daemon()->standardError(), testing::Not(HasSubstr("<debug>")));
+  auto changed = busctl(set);
+  ASSERT_EQ(changed.status, 0) << changed.err;
+  EXPECT_EQ(get(logLevel), "s \"debug\"\n");
+  ASSERT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), "ok");
+  EXPECT_THAT(harness.daemon()->standardError(), HasSubstr("<debug> [#TokenAuth]"));
 }
 
 TEST(DaemonProcess, ExitsOnIdleWhenAsked) {

@@ -44,6 +44,7 @@ int Listener::Core::run() {
   vtableSlot_.reset(slot);
   if (rc < 0) return fail("cannot export " + options_.objectPath, rc);
   if ((rc = peers_.watch(bus_.get())) < 0) return fail("cannot watch peers leaving the bus", rc);
+  if (options_.onServing) serving_ = options_.onServing(bus_.get(), event_.get());
   rc = sd_bus_request_name(bus_.get(), options_.serviceName.c_str(), 0);
   if (rc < 0) return fail("cannot own the name " + options_.serviceName, rc);
   lastActivity_ = now();
@@ -51,6 +52,7 @@ int Listener::Core::run() {
   log(LogLevel::Default, "Listening as %s on %s at %s", options_.serviceName, options_.bus, options_.objectPath);
   if (options_.notifyReady) sd_notify(0, "READY=1\nSTATUS=Serving requests");
   rc = sd_event_loop(event_.get());
+  serving_.reset();
   if (options_.notifyReady) sd_notify(0, "STOPPING=1");
   // Answers handed over as the loop ended still go out, and a call left open (the loop failed) is
   // answered rather than left waiting.
@@ -115,7 +117,9 @@ int Listener::Core::onIdleTimer(sd_event_source*, uint64_t, void* userdata) {
     self->beginDrain("idle");
     return 0;
   }
-  self->armIdleTimer(std::max(self->lastActivity_, t) + limit);
+  // Idle since the last call ended: due N after it. Calls in flight end at a time nobody knows yet,
+  // so look again in a second; either way the exit comes within a second of N after the last call.
+  self->armIdleTimer(self->ledger_.open() == 0 ? self->lastActivity_ + limit : t + toUsec(std::chrono::seconds(1)));
   return 0;
 }
 

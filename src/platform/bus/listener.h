@@ -14,6 +14,8 @@
 #include <optional>
 #include <string>
 
+#include <systemd/sd-event.h>
+
 #include "platform/bus/connection.h"
 #include "platform/bus/entitlement_manifests.h"
 #include "platform/bus/messaging.h"
@@ -35,6 +37,10 @@ struct ListenerOptions {
   // take the workers, connections or memory that the others need.
   size_t maxCallsPerPeer = 8;
   bool notifyReady = true;                     // READY=1 through sd_notify once the name is owned
+  // Runs on the bus thread once the interface is exported, before the name is requested, with the
+  // loop's bus and event loop, to add objects, properties and timers of the caller's own; what it
+  // returns is kept until the loop ends.
+  std::function<std::shared_ptr<void>(sd_bus* bus, sd_event* event)> onServing = nullptr;
 };
 
 class Listener {

@@ -6,6 +6,8 @@
 #include <mutex>
 #include <toml++/toml.h>
 
+#include "platform/config/readable_file.h"
+
 namespace platform {
 
 namespace {
@@ -129,8 +131,8 @@ std::optional<Configuration> loadConfiguration(const std::filesystem::path& path
     if (error) *error = message;
     return std::nullopt;
   };
-  std::error_code ec;
-  if (!std::filesystem::is_regular_file(path, ec)) return failWith(path.string() + ": cannot read the configuration file (missing or not a file)");
+  if (std::optional<std::string> why = unreadableFileReason(path))
+    return failWith(path.string() + ": cannot read the configuration file: " + *why);
   toml::table root;
   try {
     root = toml::parse_file(path.string());

@@ -2,6 +2,8 @@
 
 #include <sys/stat.h>
 #include <sys/uio.h>
+// Otherwise sd_journal_sendv adds CODE_FILE, CODE_LINE and CODE_FUNC of this file to the caller's.
+#define SD_JOURNAL_SUPPRESS_LOCATION
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
@@ -51,91 +53,6 @@ bool hasControlCharacters(const std::string& s) {
   return false;
 }
 
-void appendNumber(std::string& out, const char* directive, const LogArg::Storage& arg) {
-  char buf[128];
-  std::string f(directive);
-  char conv = f.back();
-  // Re-emit with a length modifier that matches how the argument is held.
-  std::string base = f.substr(0, f.size() - 1);
-  while (!base.empty() && std::string_view("hljztL").find(base.back()) != std::string_view::npos) base.pop_back();
-  int n = 0;
-  if (conv == 'f' || conv == 'F' || conv == 'e' || conv == 'E' || conv == 'g' || conv == 'G') {
-    double d = 0;
-    if (auto p = std::get_if<double>(&arg))
-      d = *p;
-    else if (auto i = std::get_if<int64_t>(&arg))
-      d = static_cast<double>(*i);
-    else if (auto u = std::get_if<uint64_t>(&arg))
-      d = static_cast<double>(*u);
-    n = std::snprintf(buf, sizeof buf, (base + conv).c_str(), d);
-  } else if (conv == 'c') {
-    int c = '?';
-    if (auto i = std::get_if<int64_t>(&arg))
-      c = static_cast<int>(*i);
-    else if (auto u = std::get_if<uint64_t>(&arg))
-      c = static_cast<int>(*u);
-    n = std::snprintf(buf, sizeof buf, (base + 'c').c_str(), c);
-  } else {
-    bool isSigned = conv == 'd' || conv == 'i';
-    if (auto i = std::get_if<int64_t>(&arg)) {
-      if (isSigned)
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*i));
-      else
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*i));
-    } else if (auto u = std::get_if<uint64_t>(&arg)) {
-      if (isSigned)
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*u));
-      else
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*u));
-    } else if (auto d = std::get_if<double>(&arg)) {
-      n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*d));
-    } else if (auto p = std::get_if<LogArg::Pointer>(&arg)) {
-      n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(p->value));
-    } else {
-      out += "(null)";
-      return;
-    }
-  }
-  if (n > 0) out.append(buf, std::min<size_t>(static_cast<size_t>(n), sizeof buf - 1));
-}
-
-void appendObject(std::string& out, const LogArg::Storage& arg) {
-  if (auto s = std::get_if<std::string>(&arg))
-    out += *s;
-  else if (auto i = std::get_if<int64_t>(&arg))
-    out += std::to_string(*i);
-  else if (auto u = std::get_if<uint64_t>(&arg))
-    out += std::to_string(*u);
-  else if (auto d = std::get_if<double>(&arg)) {
-    char buf[32];
-    std::snprintf(buf, sizeof buf, "%.17g", *d);
-    out += buf;
-  } else if (auto p = std::get_if<LogArg::Pointer>(&arg)) {
-    char buf[32];
-    std::snprintf(buf, sizeof buf, "0x%" PRIxPTR, p->value);
-    out += buf;
-  } else {
-    out += "(null)";
-  }
-}
-
-void appendPointer(std::string& out, const LogArg::Storage& arg) {
-  uintptr_t v = 0;
-  if (auto p = std::get_if<LogArg::Pointer>(&arg))
-    v = p->value;
-  else if (auto u = std::get_if<uint64_t>(&arg))
-    v = static_cast<uintptr_t>(*u);
-  else if (auto i = std::get_if<int64_t>(&arg))
-    v = static_cast<uintptr_t>(*i);
-  if (v == 0) {
-    out += "0x0";
-    return;
-  }
-  char buf[32];
-  std::snprintf(buf, sizeof buf, "0x%" PRIxPTR, v);
-  out += buf;
-}
-
 std::string timestamp() {
   using namespace std::chrono;
   auto now = system_clock::now();
@@ -177,19 +94,6 @@ void appendEscaped(std::string& line, std::string_view text) {
   }
 }
 
-// One argument of an entry holds at most this much of its text: a server's body can be megabytes.
-constexpr size_t kMaximumArgumentBytes = 4096;
-
-// Cuts what `appendObject` just added after `start` down to the cap (at a UTF-8 character
-// boundary) and says how much was left out.
-void capArgument(std::string& out, size_t start) {
-  if (out.size() - start <= kMaximumArgumentBytes) return;
-  size_t cut = start + kMaximumArgumentBytes;
-  while (cut > start && (static_cast<unsigned char>(out[cut]) & 0xC0) == 0x80) --cut;
-  size_t leftOut = out.size() - cut;
-  out.resize(cut);
-  out += "... (" + std::to_string(leftOut) + " more bytes)";
-}
 
 void writeStderr(const std::string& identifier, const Log& log, LogLevel level, const std::string& message) {
   std::string line =
@@ -210,17 +114,58 @@ void writeStderr(const std::string& identifier, const Log& log, LogLevel level, 
 }
 
 // Fields go out with their lengths, so a message holding a NUL reaches the journal whole.
-int sendToJournal(const Log& log, LogLevel level, const std::string& identifier, const std::string& message) {
-  std::string fields[] = {"MESSAGE=" + message, "PRIORITY=" + std::to_string(journalPriority(level)),
-                          "SYSLOG_IDENTIFIER=" + identifier, "ZLKA_SUBSYSTEM=" + log.subsystem(),
-                          "ZLKA_CATEGORY=" + log.category()};
-  iovec vector[std::size(fields)];
-  size_t count = log.subsystem().empty() ? 3 : std::size(fields);
-  for (size_t i = 0; i < count; ++i) vector[i] = {fields[i].data(), fields[i].size()};
-  return sd_journal_sendv(vector, static_cast<int>(count));
+int sendToJournal(const LogEntry& entry, const std::string& identifier) {
+  std::vector<std::string> fields = journalFields(entry, identifier);
+  std::vector<iovec> vector(fields.size());
+  for (size_t i = 0; i < fields.size(); ++i) vector[i] = {fields[i].data(), fields[i].size()};
+  return sd_journal_sendv(vector.data(), static_cast<int>(vector.size()));
+}
+
+// The compiler names files as it was given them (absolute, or relative to the build tree under
+// ccache); the journal gets them from the source tree's root, as a reader looks them up.
+std::string_view sourcePath(std::string_view file) {
+  size_t best = std::string_view::npos;
+  for (std::string_view root : {"src/", "tools/", "tests/", "bench/", "fuzz/"})
+    for (size_t at = file.find(root); at != std::string_view::npos; at = file.find(root, at + 1))
+      if ((at == 0 || file[at - 1] == '/') && (best == std::string_view::npos || at > best)) best = at;
+  return best == std::string_view::npos ? file : file.substr(best);
+}
+
+// "void request_pipeline::failure(int64_t)" -> "request_pipeline::failure"; a lambda keeps the
+// name of the function it is in.
+std::string_view functionName(std::string_view signature) {
+  signature = signature.substr(0, signature.find('('));
+  size_t space = signature.rfind(' ');
+  return space == std::string_view::npos ? signature : signature.substr(space + 1);
+}
+
+// The module of a call: the directory under src/ (or tools/) that holds its file.
+std::string_view moduleOf(std::string_view file) {
+  for (std::string_view root : {"src/platform/", "src/", "tools/", "tests/"})
+    if (file.starts_with(root)) {
+      std::string_view rest = file.substr(root.size());
+      size_t slash = rest.find('/');
+      if (slash != std::string_view::npos) return rest.substr(0, slash);
+    }
+  return "zlkad";
 }
 
 }  // namespace
+
+std::vector<std::string> journalFields(const LogEntry& entry, const std::string& identifier) {
+  std::vector<std::string> fields = {
+      "MESSAGE=" + entry.message,
+      "PRIORITY=" + std::to_string(journalPriority(entry.level)),
+      "SYSLOG_IDENTIFIER=" + identifier,
+      "ZLKA_SUBSYSTEM=" + (entry.subsystem.empty() ? std::string(kDefaultSubsystem) : entry.subsystem),
+      "ZLKA_CATEGORY=" + (entry.subsystem.empty() ? std::string(moduleOf(entry.file)) : entry.category),
+      "CODE_FILE=" + entry.file,
+      "CODE_LINE=" + std::to_string(entry.line),
+      "CODE_FUNC=" + entry.function,
+  };
+  if (!entry.messageID.empty()) fields.push_back("MESSAGE_ID=" + entry.messageID);
+  return fields;
+}
 
 std::string_view logLevelName(LogLevel level) {
   switch (level) {
@@ -275,6 +220,12 @@ LogSettings currentLogSettings() {
   return s.settings;
 }
 
+bool logGoesToJournal() {
+  LogState& s = state();
+  std::lock_guard lock(s.mutex);
+  return s.useJournal;
+}
+
 void setLogSink(LogSink sink) {
   LogState& s = state();
   std::lock_guard lock(s.mutex);
@@ -294,81 +245,9 @@ std::shared_ptr<const Log> Log::create(std::string subsystem, std::string catego
 
 bool Log::enabled(LogLevel level) { return static_cast<int>(level) >= gMinimum.load(std::memory_order_relaxed); }
 
-std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate) {
-  std::string out;
-  out.reserve(format.size() + 32);
-  size_t next = 0;
-  for (size_t i = 0; i < format.size(); ++i) {
-    char c = format[i];
-    if (c != '%') {
-      out += c;
-      continue;
-    }
-    size_t start = i++;
-    if (i >= format.size()) {
-      out += '%';
-      break;
-    }
-    if (format[i] == '%') {
-      out += '%';
-      continue;
-    }
-    bool isPrivate = false;
-    if (format[i] == '{') {
-      size_t close = format.find('}', i);
-      if (close == std::string_view::npos) {
-        out.append(format.substr(start));
-        break;
-      }
-      std::string_view annotation = format.substr(i + 1, close - i - 1);
-      isPrivate = annotation.find("private") != std::string_view::npos;
-      i = close + 1;
-    }
-    // flags, width, precision, length modifiers
-    std::string directive = "%";
-    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos)
-      directive += format[i++];
-    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos)
-      directive += format[i++];
-    if (i >= format.size()) {
-      out.append(format.substr(start));
-      break;
-    }
-    char conv = format[i];
-    if (std::string_view("@sdiuxXocfFeEgGp").find(conv) == std::string_view::npos) {
-      out.append(format.substr(start, i - start + 1));  // unknown directive: keep it visible
-      continue;
-    }
-    if (next >= args.size()) {
-      out += "<missing>";
-      continue;
-    }
-    const LogArg::Storage& arg = args[next++].storage();
-    if (isPrivate && !showPrivate) {
-      out += "<private>";
-      continue;
-    }
-    directive += conv;
-    switch (conv) {
-      case '@':
-      case 's': {
-        size_t start = out.size();
-        appendObject(out, arg);
-        capArgument(out, start);
-        break;
-      }
-      case 'p':
-        appendPointer(out, arg);
-        break;
-      default:
-        appendNumber(out, directive.c_str(), arg);
-        break;
-    }
-  }
-  return out;
-}
 
-void writeLog(const Log& log, LogLevel level, std::string_view format, std::span<const LogArg> args) {
+void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogFormat& format,
+              std::span<const LogArg> args) {
   if (!Log::enabled(level)) return;
   std::shared_ptr<const LogSink> sink;
   bool journal;
@@ -380,13 +259,20 @@ void writeLog(const Log& log, LogLevel level, std::string_view format, std::span
     journal = s.useJournal;
     identifier = s.settings.identifier;
   }
-  std::string message = formatLogMessage(format, args, gPrivateData.load(std::memory_order_relaxed));
+  LogEntry entry{level,
+                 log.subsystem(),
+                 log.category(),
+                 formatLogMessage(format.text, args, gPrivateData.load(std::memory_order_relaxed)),
+                 std::string(sourcePath(format.where.file_name())),
+                 format.where.line(),
+                 std::string(functionName(format.where.function_name())),
+                 id ? id->hex : ""};
   if (sink) {
-    (*sink)(LogEntry{level, log.subsystem(), log.category(), std::move(message)});
+    (*sink)(entry);
     return;
   }
-  if (journal && sendToJournal(log, level, identifier, message) >= 0) return;
-  writeStderr(identifier, log, level, message);
+  if (journal && sendToJournal(entry, identifier) >= 0) return;
+  writeStderr(identifier, log, level, entry.message);
 }
 
 }  // namespace platform

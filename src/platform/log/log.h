@@ -7,17 +7,24 @@
 // %s, %d %i %u %x %X %o %c with h/hh/l/ll/z/j/t modifiers, %f %e %g, %p, %%. "{private}" or
 // "{public}" may follow the percent sign; a private argument prints as "<private>" unless the log
 // was configured with privateData. Arguments are only formatted when the level is enabled.
+//
+// Each entry carries the place of the call that wrote it (file, line, function), taken where the
+// format string is given, and may carry a MessageID that names the event for alerting:
+//
+//   platform::log(LogLevel::Default, kMessageSessionOpened, "[#TokenAuth] Tarvex SAP session opened!");
 #pragma once
 
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
+#include <source_location>
 #include <span>
 #include <string>
 #include <string_view>
 #include <type_traits>
 #include <variant>
+#include <vector>
 
 namespace platform {
 
@@ -29,6 +36,11 @@ int journalPriority(LogLevel level);  // fault 2, error 3, default 5, info 6, de
 
 enum class LogBackend { Auto, Journal, Stderr };
 
+// A 128-bit journal MESSAGE_ID as 32 lower-case hex digits (what `systemd-id128 new` prints).
+struct MessageID {
+  const char* hex;
+};
+
 struct LogSettings {
   LogLevel minimum = LogLevel::Default;  // lowest level written
   bool privateData = false;              // show %{private} arguments
@@ -37,6 +49,18 @@ struct LogSettings {
 };
 void configureLog(const LogSettings& settings);
 LogSettings currentLogSettings();
+// logGoesToJournal is true when entries go to the journal now (the backend, resolved).
+bool logGoesToJournal();
+
+// Where a log call is in the source: bound where the format string is given, so that the entry
+// names the caller's file, line and function rather than the log back end's.
+struct LogFormat {
+  template <class S>
+    requires std::is_convertible_v<const S&, std::string_view>
+  LogFormat(const S& text, std::source_location where = std::source_location::current()) : text(text), where(where) {}
+  std::string_view text;
+  std::source_location where;
+};
 
 // One formatted entry; a sink installed by tests (or tools) receives entries instead of the backend.
 struct LogEntry {
@@ -44,7 +68,18 @@ struct LogEntry {
   std::string subsystem;
   std::string category;
   std::string message;
+  std::string file;  // "src/network/request_pipeline.cpp": from the source tree's root
+  unsigned line = 0;
+  std::string function;  // "request_pipeline::failure": qualified name, no signature
+  std::string messageID;  // empty for most entries
 };
+
+// journalFields gives the fields an entry is sent to the journal with, each "NAME=value":
+// MESSAGE, PRIORITY, SYSLOG_IDENTIFIER, ZLKA_SUBSYSTEM, ZLKA_CATEGORY, CODE_FILE, CODE_LINE,
+// CODE_FUNC and MESSAGE_ID when the entry has one. The default log's entries get the subsystem
+// kDefaultSubsystem and, as category, the module (source directory) of the call.
+inline constexpr char kDefaultSubsystem[] = "com.kestro.ZLKAuthentication";
+std::vector<std::string> journalFields(const LogEntry& entry, const std::string& identifier);
 using LogSink = std::function<void(const LogEntry&)>;
 void setLogSink(LogSink sink);  // an empty function restores the backend
 
@@ -95,22 +130,35 @@ class LogArg {
 };
 
 std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate);
-void writeLog(const Log& log, LogLevel level, std::string_view format, std::span<const LogArg> args);
+// writeLog formats and writes one entry (when its level is enabled); `id` may be null.
+void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogFormat& format, std::span<const LogArg> args);
 
 template <class... A>
-void log(const Log& target, LogLevel level, std::string_view format, const A&... args) {
+void log(const Log& target, LogLevel level, LogFormat format, const A&... args) {
   if (!Log::enabled(level)) return;
   if constexpr (sizeof...(A) == 0) {
-    writeLog(target, level, format, {});
+    writeLog(target, level, nullptr, format, {});
   } else {
     const LogArg argv[] = {LogArg(args)...};
-    writeLog(target, level, format, argv);
+    writeLog(target, level, nullptr, format, argv);
   }
 }
 
 template <class... A>
-void log(LogLevel level, std::string_view format, const A&... args) {
+void log(LogLevel level, LogFormat format, const A&... args) {
   log(Log::defaultLog(), level, format, args...);
+}
+
+// The same, on the default log, for an event that operators alert on.
+template <class... A>
+void log(LogLevel level, MessageID id, LogFormat format, const A&... args) {
+  if (!Log::enabled(level)) return;
+  if constexpr (sizeof...(A) == 0) {
+    writeLog(Log::defaultLog(), level, &id, format, {});
+  } else {
+    const LogArg argv[] = {LogArg(args)...};
+    writeLog(Log::defaultLog(), level, &id, format, argv);
+  }
 }
 
 }  // namespace platform
