@@ -40,30 +40,36 @@ bool Semaphore::waitUntil(std::chrono::steady_clock::time_point deadline) { retu
 bool Semaphore::take(std::optional<std::chrono::steady_clock::time_point> deadline) {
   using Clock = std::chrono::steady_clock;
   std::unique_lock lock(mutex_);
-  if (count_ == 0 && (!deadline || *deadline > Clock::now())) {
-    lock.unlock();
-    WorkerPool::Blocking blocking(this);
-    const bool helper = blocking.helps();
-    lock.lock();
-    bool look = helper;
-    while (count_ == 0) {
-      if (helper && (look || helpWanted_)) {
-        helpWanted_ = false;
-        lock.unlock();
-        look = blocking.help();
-        lock.lock();
-        if (deadline && Clock::now() >= *deadline) break;
-      } else if (!deadline) {
-        available_.wait(lock);
-      } else if (available_.wait_until(lock, *deadline) == std::cv_status::timeout && count_ == 0 &&
-                 !(helper && helpWanted_)) {
-        break;
-      }
+  if (count_ > 0) {
+    --count_;
+    return true;
+  }
+  if (deadline && *deadline <= Clock::now()) return false;
+  lock.unlock();
+  WorkerPool::Blocking blocking(this);
+  const bool helper = blocking.helps();
+  lock.lock();
+  bool look = helper;
+  while (count_ == 0) {
+    if (helper && (look || helpWanted_)) {
+      helpWanted_ = false;
+      lock.unlock();
+      look = blocking.help();
+      lock.lock();
+      if (deadline && Clock::now() >= *deadline) break;
+    } else if (!deadline) {
+      available_.wait(lock);
+    } else if (available_.wait_until(lock, *deadline) == std::cv_status::timeout && count_ == 0 &&
+               !(helper && helpWanted_)) {
+      break;
     }
   }
-  if (count_ == 0) return false;
-  --count_;
-  return true;
+  const bool taken = count_ > 0;
+  if (taken) --count_;
+  // `blocking` ends after this and takes its pool's lock, which must never be taken under ours:
+  // the pool wakes helpers with its lock held.
+  lock.unlock();
+  return taken;
 }
 
 void Semaphore::wakeToHelp() {
