@@ -97,12 +97,12 @@ TEST(Log, JournalEntriesNameTheCallersPlaceTheirModuleAndTheirEvent) {
   ASSERT_EQ(e.size(), 1u);
   // The call's place, not the log back end's.
   EXPECT_EQ(std::tuple(e[0].file, e[0].line, e[0].messageID), std::tuple("tests/platform/log_test.cpp", line, "3b3c29f1b71344dbb4e0a7e61382ddca"));
-  EXPECT_THAT(e[0].function, testing::EndsWith("_Test::TestBody"));
+  EXPECT_EQ(e[0].function, "TestBody");
   using Fields = std::vector<std::string>;
-  platform::LogEntry entry{LogLevel::Error, "", "", "m", "src/platform/bus/listener.cpp", 7, "platform::Listener::Core::run", ""};
+  platform::LogEntry entry{LogLevel::Error, "", "", "m", "src/platform/bus/listener.cpp", 7, "run", ""};
   EXPECT_EQ(platform::journalFields(entry, "zlkad"),
             (Fields{"MESSAGE=m", "PRIORITY=3", "SYSLOG_IDENTIFIER=zlkad", "ZLKA_SUBSYSTEM=com.kestro.ZLKAuthentication",
-                    "ZLKA_CATEGORY=bus", "CODE_FILE=src/platform/bus/listener.cpp", "CODE_LINE=7", "CODE_FUNC=platform::Listener::Core::run"}));
+                    "ZLKA_CATEGORY=bus", "CODE_FILE=src/platform/bus/listener.cpp", "CODE_LINE=7", "CODE_FUNC=run"}));
   // A log object's own names win; the default log's category is the module of the call.
   entry = {LogLevel::Fault, "com.example.sub", "cat", "m", "src/network/metadata_query.cpp", 1, "f", "6113ffeebbf84fa0b42d7f30bad01cc9"};
   EXPECT_THAT(platform::journalFields(entry, "zlkad"),

@@ -131,14 +131,6 @@ std::string_view sourcePath(std::string_view file) {
   return best == std::string_view::npos ? file : file.substr(best);
 }
 
-// "void request_pipeline::failure(int64_t)" -> "request_pipeline::failure"; a lambda keeps the
-// name of the function it is in.
-std::string_view functionName(std::string_view signature) {
-  signature = signature.substr(0, signature.find('('));
-  size_t space = signature.rfind(' ');
-  return space == std::string_view::npos ? signature : signature.substr(space + 1);
-}
-
 // The module of a call: the directory under src/ (or tools/) that holds its file.
 std::string_view moduleOf(std::string_view file) {
   for (std::string_view root : {"src/platform/", "src/", "tools/", "tests/"})
@@ -263,9 +255,9 @@ void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogForm
                  log.subsystem(),
                  log.category(),
                  formatLogMessage(format.text, args, gPrivateData.load(std::memory_order_relaxed)),
-                 std::string(sourcePath(format.where.file_name())),
-                 format.where.line(),
-                 std::string(functionName(format.where.function_name())),
+                 std::string(sourcePath(format.file)),
+                 format.line,
+                 format.function,
                  id ? id->hex : ""};
   if (sink) {
     (*sink)(entry);

@@ -18,7 +18,6 @@
 #include <functional>
 #include <memory>
 #include <optional>
-#include <source_location>
 #include <span>
 #include <string>
 #include <string_view>
@@ -53,13 +52,18 @@ LogSettings currentLogSettings();
 bool logGoesToJournal();
 
 // Where a log call is in the source: bound where the format string is given, so that the entry
-// names the caller's file, line and function rather than the log back end's.
+// names the caller's file, line and function rather than the log back end's. (The builtins rather
+// than std::source_location, which the clang of Debian 12 cannot use with its libstdc++.)
 struct LogFormat {
   template <class S>
     requires std::is_convertible_v<const S&, std::string_view>
-  LogFormat(const S& text, std::source_location where = std::source_location::current()) : text(text), where(where) {}
+  LogFormat(const S& text, const char* file = __builtin_FILE(), unsigned line = __builtin_LINE(),
+            const char* function = __builtin_FUNCTION())
+      : text(text), file(file), line(line), function(function) {}
   std::string_view text;
-  std::source_location where;
+  const char* file;
+  unsigned line;
+  const char* function;
 };
 
 // One formatted entry; a sink installed by tests (or tools) receives entries instead of the backend.
@@ -70,7 +74,7 @@ struct LogEntry {
   std::string message;
   std::string file;  // "src/network/request_pipeline.cpp": from the source tree's root
   unsigned line = 0;
-  std::string function;  // "request_pipeline::failure": qualified name, no signature
+  std::string function;  // "failure": the function's own name, as __func__ gives it
   std::string messageID;  // empty for most entries
 };
 
