@@ -11,6 +11,7 @@
 #include <sstream>
 #include <stdexcept>
 
+#include "common/child_process.h"
 #include "devserver/dev_server.h"
 #include "network/zlka_network_constants.h"
 #include "platform/device_facts.h"
@@ -111,9 +112,7 @@ void ServerWorld::SetUp() {
   platform::setCurrentConfiguration(configuration_);
   platform::setDeviceFacts(configuration_.device);
 
-  std::ostringstream anchor;
-  anchor << std::ifstream(configuration_.trustAnchor, std::ios::binary).rdbuf();
-  const std::string pem = anchor.str();
+  const std::string pem = readFile(configuration_.trustAnchor);
   const TarvexSAPConfig sapConfig{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
   ASSERT_EQ(TarvexSAPConfigure(&sapConfig), kTarvexSAPOK);
 

@@ -10,7 +10,7 @@
 
 #include "client/zlka_client.h"
 #include "common/child_process.h"
-#include "common/private_bus.h"
+#include "common/child_process.h"
 #include "common/server_world.h"
 #include "devserver/dev_server.h"
 
@@ -42,7 +42,7 @@ class Harness {
 
  private:
   zlkatest::TempDir directory_;
-  client_test::PrivateBus bus_;
+  zlkatest::PrivateBus bus_;
   std::unique_ptr<devserver::DevServer> server_;
   std::unique_ptr<zlkatest::ChildProcess> daemon_;
   int notifySocket_ = -1;

@@ -18,11 +18,6 @@ namespace {
 using platform::Dictionary;
 using testing::HasSubstr;
 
-std::string readText(const std::filesystem::path& file) {
-  std::ifstream in(file);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
 // An a{sv} argument whose only key is a token of `size` zero bytes.
 int appendToken(sd_bus_message* m, size_t size) {
   const std::vector<uint8_t> token(size);
@@ -40,7 +35,7 @@ class Daemon : public testing::Test {
  protected:
   void SetUp() override {
     const auto file = harness.stateDirectory() / "zlkad.toml";
-    const std::string config = std::regex_replace(readText(file), std::regex("internal_build = false"), "internal_build = true");
+    const std::string config = std::regex_replace(zlkatest::readFile(file), std::regex("internal_build = false"), "internal_build = true");
     std::ofstream(file) << config;
     harness.entitleSelf();
     ASSERT_TRUE(harness.startDaemon()) << harness.daemon()->standardError();
@@ -142,7 +137,7 @@ TEST_F(Daemon, SigtermAnswersEveryCallInFlight) {
 TEST(DaemonProcess, ABadStartIsRefusedNamingWhatIsWrong) {
   Harness harness;
   const auto config = harness.stateDirectory() / "zlkad.toml";
-  std::ofstream(harness.directory() / "anchor.toml") << std::regex_replace(readText(config), std::regex("sap-root.pem"), "zlkad.toml");
+  std::ofstream(harness.directory() / "anchor.toml") << std::regex_replace(zlkatest::readFile(config), std::regex("sap-root.pem"), "zlkad.toml");
   const std::tuple<std::string, std::string, int, const char*> rows[] = {
       {"--config", (harness.directory() / "anchor.toml").string(), 1, "anchor.toml: sap.trust_anchor: "},  // not a certificate
       {"--config", (harness.directory() / "absent.toml").string(), 1, "absent.toml"},
