@@ -163,7 +163,7 @@ TEST_P(WaitTest, ASessionThatDoesNotAnswerInTimeIsInternal) {
   const std::string what = verifying ? "verify" : "generate";
   EXPECT_EQ(log().count(LogLevel::Error, "[#TokenAuth] Timed out waiting to " + what + " Tarvex SAP signature!"), 2)
       << log().dump();
-  EXPECT_EQ(admin().verified(), verifying ? 1u : 0u);
+  EXPECT_EQ(admin().stat("verified"), verifying ? 1u : 0u);
   EXPECT_FALSE(run({.op = Op::confirmation}).error) << log().dump();
 }
 
@@ -260,8 +260,8 @@ TEST_F(NetworkTest, TheEntitlementGateComesBeforeArgumentsAndTraffic) {
 TEST_F(NetworkTest, TheSAPSwitchReplacesEachSignature) {
   suite().set(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
   expectFailure(run(), ZLKAErrorInternal);
-  EXPECT_EQ(admin().rejected(), 1u);
-  EXPECT_EQ(admin().handshakes(), 0u);
+  EXPECT_EQ(admin().stat("rejected"), 1u);
+  EXPECT_EQ(admin().stat("handshakes"), 0u);
   expectLine(LogLevel::Debug,
              "[#TokenAuth] request.allHTTPHeaderFields: {\"Accept\": \"application/json\", \"Content-Type\": "
              "\"application/json\", \"protocol-version\": \"1.0\", \"session-identifier\": \"" +
@@ -276,7 +276,7 @@ TEST_F(NetworkTest, TheSAPSwitchReplacesEachSignature) {
   const Outcome outcome = run({.op = Op::activation});
   expectFailure(outcome, ZLKAErrorServer);
   expectLine(LogLevel::Error, kSigning, outcome.logStart);
-  EXPECT_EQ(admin().verified(), 1u) << "the request carried a real signature";
+  EXPECT_EQ(admin().stat("verified"), 1u) << "the request carried a real signature";
 }
 
 enum class Server { staticContent, sap, api };
@@ -346,7 +346,7 @@ TEST_F(NetworkTest, TheSelectedServersCarryTheTraffic) {
   suite().set("StaticContentServer", "ut");
   suite().set("Server", "custom");
   expectFailure(run({.op = Op::confirmation}), ZLKAErrorNetwork);
-  EXPECT_EQ(admin().handshakes(), 1u);
+  EXPECT_EQ(admin().stat("handshakes"), 1u);
   suite().set("CustomServer", world().baseURL());
   EXPECT_FALSE(run().error) << log().dump();
   EXPECT_EQ(admin().requests("queryProductPlan"), 1u);
@@ -359,7 +359,7 @@ TEST_F(NetworkTest, TheSessionOpensOnceWithTheServersTimeToLive) {
   expectLine(LogLevel::Debug, "[#TarvexSAPSession] Setting TTL... (TTL: 3600.000000, ");
   EXPECT_GT(network()->tarvexSAPSession()->TTL(), 3000.0);
   EXPECT_EQ(admin().requests("setup.crt"), 1u);
-  EXPECT_EQ(admin().handshakes(), 1u);
+  EXPECT_EQ(admin().stat("handshakes"), 1u);
   EXPECT_EQ(log().count(LogLevel::Default, "[#TokenAuth] Tarvex SAP session opened!"), 1);
   expectLine(LogLevel::Debug,
              "[#TokenAuth] request.allHTTPHeaderFields: {\"Accept\": \"application/json\", \"Content-Type\": "

@@ -56,7 +56,7 @@ TEST_F(NetworkTest, TheSuiteChangesNothing) {
   suite().set(ZLKAUserDefaultsKey_StaticContentServer, "it");
   for (Op op : {Op::metadata, Op::activation, Op::confirmation}) EXPECT_FALSE(run({.op = op}).error) << log().dump();
   EXPECT_EQ(log().countStartingWith("[#TokenAuth] Forcing"), 0);
-  EXPECT_EQ(admin().verified(), 3u);
+  EXPECT_EQ(admin().stat("verified"), 3u);
   for (const char* contents :
        {R"({"Server": "UT", "StaticContentServer": "custom", "TarvexSAPServer": "nowhere"})", "{ not json"}) {
     suite().writeRaw(contents);

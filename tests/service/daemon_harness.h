@@ -28,7 +28,7 @@ class Harness {
   std::filesystem::path stateDirectory() const { return directory() / "state"; }  // zlkad.toml, ca.pem, entitlements.d, defaults
   const std::string& busAddress() const { return bus_.address(); }
   devserver::DevServer& server() { return *server_; }
-  zlkatest::AdminClient admin() const { return {server_->port(), stateDirectory() / "ca.pem"}; }
+  zlkatest::AdminClient admin() const { return zlkatest::AdminClient(*server_); }
   zlkatest::ChildProcess* daemon() { return daemon_.get(); }
 
   // A manifest that gives `executable`, run by this process's user, the entitlement value.
