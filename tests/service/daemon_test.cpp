@@ -18,18 +18,6 @@ namespace {
 using platform::Dictionary;
 using testing::HasSubstr;
 
-// An a{sv} argument whose only key is a token of `size` zero bytes.
-int appendToken(sd_bus_message* m, size_t size) {
-  const std::vector<uint8_t> token(size);
-  int r = sd_bus_message_open_container(m, 'a', "{sv}");
-  if (r >= 0) r = sd_bus_message_open_container(m, 'e', "sv");
-  if (r >= 0) r = sd_bus_message_append(m, "s", "token");
-  if (r >= 0) r = sd_bus_message_open_container(m, 'v', "ay");
-  if (r >= 0) r = sd_bus_message_append_array(m, 'y', token.data(), token.size());
-  for (int i = 0; i < 3 && r >= 0; ++i) r = sd_bus_message_close_container(m);
-  return r;
-}
-
 // A daemon that entitles this program, on an internal build so that its settings suite counts.
 class Daemon : public testing::Test {
  protected:
@@ -56,24 +44,25 @@ TEST_F(Daemon, TheGateRefusesACallerNoManifestEntitles) {
 
 TEST_F(Daemon, ArgumentsAreDecodedBeforeTheOperationAndItsErrorsKeepTheirCodes) {
   const uint64_t requests = harness.admin().requests();
+  auto raw = [&](const char* method, ZLKAClient::ArgumentWriter write) { return outcome(client->callRaw(method, write)); };
   // clang-format off
-  const std::tuple<const char*, ZLKAClient::ArgumentWriter, std::string> refused[] = {
-      {"ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 2, "token", "s", "x", "uuid", "s", "U"); },
+  const std::pair<std::string, std::string> refused[] = {  // the call's outcome, the refusal's message
+      {raw("ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 2, "token", "s", "x", "uuid", "s", "U"); }),
        "Key 'token' must hold a value of type ay."},
-      {"RequestActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 1, "colour", "s", "blue"); }, "Unknown key 'colour'."},
+      {raw("RequestActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 1, "colour", "s", "blue"); }), "Unknown key 'colour'."},
       // Only the metadata request takes a locale.
-      {"RequestActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 1, "requestedLocale", "s", "en_US"); },
+      {raw("RequestActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 1, "requestedLocale", "s", "en_US"); }),
        "Unknown key 'requestedLocale'."},
-      {"ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 2, "uuid", "s", "A", "uuid", "s", "B"); },
+      {raw("ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 2, "uuid", "s", "A", "uuid", "s", "B"); }),
        "Key 'uuid' is given twice."},
       // Tokens are tens of bytes; a larger one would grow about 120-fold on its way to the server.
-      {"ConfirmActivationForToken", [](sd_bus_message* m) { return appendToken(m, 64 * 1024 + 1); }, "Key 'token' must hold at most 65536 bytes."},
-      {"ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "s", "x"); },
+      {outcome(client->confirmActivation({platform::Data(std::vector<uint8_t>(64 * 1024 + 1))})), "Key 'token' must hold at most 65536 bytes."},
+      {raw("ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "s", "x"); }),
        "Invalid arguments 's' to call com.kestro.ZLKAuthentication.ZLKANetworkProtocol.ConfirmActivationForToken(), expecting 'a{sv}'."},
   };
   // clang-format on
-  for (const auto& [method, write, message] : refused)
-    EXPECT_EQ(outcome(client->callRaw(method, write)), "ZLKAClientErrorDomain 4: The call was refused with org.freedesktop.DBus.Error.InvalidArgs: " + message);
+  for (const auto& [got, message] : refused)
+    EXPECT_EQ(got, "ZLKAClientErrorDomain 4: The call was refused with org.freedesktop.DBus.Error.InvalidArgs: " + message);
   EXPECT_EQ(harness.admin().requests(), requests);
 
   const std::string failed = "ZLKATokenManagerErrorDomain ";
