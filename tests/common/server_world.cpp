@@ -14,7 +14,6 @@
 #include "devserver/dev_server.h"
 #include "network/zlka_network_constants.h"
 #include "platform/device_facts.h"
-#include "platform/settings_store.h"
 #include "tarvexsap/tarvex_sap.h"
 
 namespace zlkatest {
@@ -48,28 +47,6 @@ uint64_t AdminClient::requests(std::string_view endpoint) const {
   for (const auto& [name, n] : all.items()) sum += n.get<uint64_t>();
   return sum;
 }
-
-void SettingsSuite::set(std::string_view key, const platform::Value& value) const {
-  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).setObject(key, value))
-      << "cannot write " << key;
-}
-
-void SettingsSuite::remove(std::string_view key) const {
-  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).removeObject(key)) << "cannot remove " << key;
-}
-
-void SettingsSuite::clear() const {
-  std::error_code ignored;
-  fs::remove(file(), ignored);
-}
-
-void SettingsSuite::writeRaw(std::string_view text) const {
-  std::ofstream out(file(), std::ios::binary | std::ios::trunc);
-  out << text;
-  ASSERT_TRUE(out.good()) << "cannot write " << file();
-}
-
-fs::path SettingsSuite::file() const { return directory_ / (std::string(ZLKAUserDefaultsDomain) + ".json"); }
 
 ServerWorld::ServerWorld(bool internalBuild) : internalBuild_(internalBuild) { gWorld = this; }
 
@@ -117,7 +94,7 @@ void ServerWorld::SetUp() {
   refusedPort_ = ntohs(address.sin_port);
 
   admin_ = std::make_unique<AdminClient>(*server_);
-  suite_ = std::make_unique<SettingsSuite>(configuration_.settingsDirectory);
+  suite_ = std::make_unique<platform::SettingsStore>(ZLKAUserDefaultsDomain, configuration_.settingsDirectory);
 }
 
 void ServerWorld::TearDown() {

@@ -18,6 +18,7 @@
 
 #include "common/child_process.h"
 #include "platform/configuration.h"
+#include "platform/settings_store.h"
 #include "platform/value.h"
 
 namespace devserver {
@@ -47,20 +48,6 @@ class AdminClient {
   const devserver::DevServer& server_;
 };
 
-// The developer settings suite of the configuration, written as the settings tool writes it.
-class SettingsSuite {
- public:
-  explicit SettingsSuite(std::filesystem::path directory) : directory_(std::move(directory)) {}
-  void set(std::string_view key, const platform::Value& value) const;
-  void remove(std::string_view key) const;
-  void clear() const;
-  void writeRaw(std::string_view text) const;  // any text, parsable or not
-  std::filesystem::path file() const;
-
- private:
-  std::filesystem::path directory_;
-};
-
 class ServerWorld : public ::testing::Environment {
  public:
   explicit ServerWorld(bool internalBuild);
@@ -76,7 +63,7 @@ class ServerWorld : public ::testing::Environment {
   std::string refusedURL() const { return "https://127.0.0.1:" + std::to_string(refusedPort_); }
   const platform::Configuration& configuration() const { return configuration_; }
   const AdminClient& admin() const { return *admin_; }
-  const SettingsSuite& suite() const { return *suite_; }
+  platform::SettingsStore& suite() const { return *suite_; }  // the developer settings suite
 
  private:
   bool internalBuild_;
@@ -84,7 +71,7 @@ class ServerWorld : public ::testing::Environment {
   std::unique_ptr<devserver::DevServer> server_;
   platform::Configuration configuration_;
   std::unique_ptr<AdminClient> admin_;
-  std::unique_ptr<SettingsSuite> suite_;
+  std::unique_ptr<platform::SettingsStore> suite_;
   int refusedSocket_ = -1;
   uint16_t refusedPort_ = 0;
 };

@@ -113,7 +113,7 @@ class CallTest : public NetworkTest, public ::testing::WithParamInterface<CallRo
 
 TEST_P(CallTest, EndsWithItsCodeAndLine) {
   const CallRow& row = GetParam();
-  for (const char* key : row.switches) suite().set(key, true);
+  for (const char* key : row.switches) suite().setObject(key, true);
   const char* endpoint = kEndpoints[static_cast<int>(row.call.op)];
   json fault = row.fault;
   const bool onTheAnswer = fault.is_object() && !fault.contains("endpoint");
@@ -255,7 +255,7 @@ TEST_F(NetworkTest, TheEntitlementGateComesBeforeArgumentsAndTraffic) {
 // the session (the server refuses it with 401), and is read again for the answer: turned on while
 // the request is signed, it fails the verification of a properly signed answer.
 TEST_F(NetworkTest, TheSAPSwitchReplacesEachSignature) {
-  suite().set(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
+  suite().setObject(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
   expectFailure(run(), ZLKAErrorInternal);
   EXPECT_EQ(admin().stat("rejected"), 1u);
   EXPECT_EQ(admin().stat("handshakes"), 0u);
@@ -263,10 +263,10 @@ TEST_F(NetworkTest, TheSAPSwitchReplacesEachSignature) {
              "[#TokenAuth] request.allHTTPHeaderFields: {\"Accept\": \"application/json\", \"Content-Type\": "
              "\"application/json\", \"protocol-version\": \"1.0\", \"session-identifier\": \"" +
                  network()->tarvexSAPSession()->UUID().UUIDString() + "\", \"signature\": \"MTIzNA==\"}");
-  suite().remove(ZLKAUserDefaultsKey_ForceTarvexSAPFailure);
+  suite().removeObject(ZLKAUserDefaultsKey_ForceTarvexSAPFailure);
   TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library();
   primitives.sign = [sign = primitives.sign](auto... a) {
-    suite().set(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
+    suite().setObject(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
     return sign(a...);
   };
   installSession(primitives);
@@ -310,7 +310,7 @@ TEST_P(SelectionTest, PicksTheNamedServer) {
     for (std::string name : {"prod", "it", "ut", "maint"})
       c.servers[name] = {"https://static." + name + ".test", "https://api." + name + ".test"};
   });
-  for (const auto& [key, value] : GetParam().settings) suite().set(key, value);
+  for (const auto& [key, value] : GetParam().settings) suite().setObject(key, value);
   const Server server = GetParam().server;
   EXPECT_EQ(server == Server::api   ? network()->_selectedAPIServer()
             : server == Server::sap ? network()->_selectedTarvexSAPServer()
@@ -336,15 +336,15 @@ TEST_F(NetworkTest, TheSelectedServersCarryTheTraffic) {
   expectFailure(run(), ZLKAErrorNetwork);
   EXPECT_EQ(admin().requests("setup.crt"), 1u);
   EXPECT_EQ(admin().requests("sapSession"), 0u);
-  suite().set("TarvexSAPServer", "it");
-  suite().set("StaticContentServer", "it");
+  suite().setObject("TarvexSAPServer", "it");
+  suite().setObject("StaticContentServer", "it");
   expectFailure(run(), ZLKAErrorNetwork);
   EXPECT_EQ(admin().requests("setup.crt"), 1u);
-  suite().set("StaticContentServer", "ut");
-  suite().set("Server", "custom");
+  suite().setObject("StaticContentServer", "ut");
+  suite().setObject("Server", "custom");
   expectFailure(run({.op = Op::confirmation}), ZLKAErrorNetwork);
   EXPECT_EQ(admin().stat("handshakes"), 1u);
-  suite().set("CustomServer", world().baseURL());
+  suite().setObject("CustomServer", world().baseURL());
   EXPECT_FALSE(run().error) << log().dump();
   EXPECT_EQ(admin().requests("queryProductPlan"), 1u);
 }

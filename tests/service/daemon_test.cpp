@@ -77,7 +77,7 @@ TEST_F(Daemon, ArgumentsAreDecodedBeforeTheOperationAndItsErrorsKeepTheirCodes) 
   EXPECT_EQ(outcome(client->requestMetadata({sampleToken(), "U", "en_US"})), failed + "-6: An internal server error has occurred.");
   EXPECT_THAT(harness.daemon()->standardError(), HasSubstr("The answer's ppid cannot be sent over D-Bus"));
   // Honoured only because the configuration declares an internal build.
-  zlkatest::SettingsSuite(harness.stateDirectory() / "defaults").set("ForceNetworkFailure", true);
+  platform::SettingsStore("com.kestro.ZLKAuthentication", harness.stateDirectory() / "defaults").setObject("ForceNetworkFailure", true);
   EXPECT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), failed + "-5: There was a problem connecting to the network.");
 }
 
