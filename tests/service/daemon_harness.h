@@ -13,6 +13,7 @@
 #include "common/child_process.h"
 #include "common/server_world.h"
 #include "devserver/dev_server.h"
+#include "platform/handles.h"
 
 namespace service_test {
 
@@ -45,7 +46,7 @@ class Harness {
   zlkatest::PrivateBus bus_;
   std::unique_ptr<devserver::DevServer> server_;
   std::unique_ptr<zlkatest::ChildProcess> daemon_;
-  int notifySocket_ = -1;
+  platform::UniqueFd notifySocket_;
 };
 
 // The token an accessory would hold: two DER items back to back.
