@@ -20,7 +20,7 @@
 #include <optional>
 
 #include "network/token_array.h"
-#include "platform/data.h"
+#include "platform/values/data.h"
 #endif
 
 namespace {

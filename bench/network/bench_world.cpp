@@ -7,9 +7,9 @@
 #include <sstream>
 #include <stdexcept>
 
-#include "platform/configuration.h"
-#include "platform/device_facts.h"
-#include "platform/log.h"
+#include "platform/config/configuration.h"
+#include "platform/config/device_facts.h"
+#include "platform/log/log.h"
 #include "tarvexsap/tarvex_sap.h"
 
 namespace netbench {

@@ -7,8 +7,8 @@
 #include <stdexcept>
 #include <vector>
 
-#include "platform/base64.h"
-#include "platform/uuid.h"
+#include "platform/values/base64.h"
+#include "platform/values/uuid.h"
 #include "sap/tarvex_sap_primitives.h"
 
 namespace netbench {

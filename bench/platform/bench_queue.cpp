@@ -5,8 +5,8 @@
 #include <atomic>
 #include <thread>
 
-#include "platform/queue.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/queue.h"
+#include "platform/dispatch/semaphore.h"
 
 namespace {
 

@@ -11,8 +11,8 @@
 #include <stdexcept>
 #include <string>
 
-#include "platform/log.h"
-#include "platform/semaphore.h"
+#include "platform/log/log.h"
+#include "platform/dispatch/semaphore.h"
 #include "sap/tarvex_sap_session.h"
 #include "tarvexsap/tarvex_sap.h"
 #include "tarvexsap/tarvex_sap_certs.h"

@@ -13,7 +13,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/error.h"
+#include "platform/values/error.h"
 
 namespace zlka_client {
 

@@ -4,7 +4,7 @@
 #include <utility>
 #include <variant>
 
-#include "platform/error.h"
+#include "platform/values/error.h"
 
 namespace zlka_client {
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/data.h"
+#include "platform/values/data.h"
 
 namespace platform {
 

@@ -14,8 +14,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/messaging.h"
-#include "platform/value.h"
+#include "platform/bus/messaging.h"
+#include "platform/values/value.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/configuration.h"
+#include "platform/config/configuration.h"
 
 #include <curl/curl.h>
 

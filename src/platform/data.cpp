@@ -1,4 +1,4 @@
-#include "platform/data.h"
+#include "platform/values/data.h"
 
 #include <cstdlib>
 #include <cstring>

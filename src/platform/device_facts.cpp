@@ -1,9 +1,9 @@
-#include "platform/device_facts.h"
+#include "platform/config/device_facts.h"
 
 #include <mutex>
 #include <toml++/toml.h>
 
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace platform {
 

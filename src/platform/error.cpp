@@ -1,4 +1,4 @@
-#include "platform/error.h"
+#include "platform/values/error.h"
 
 namespace platform {
 

@@ -7,7 +7,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/value.h"
+#include "platform/values/value.h"
 
 namespace platform {
 

@@ -8,7 +8,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/value.h"
+#include "platform/values/value.h"
 
 namespace platform {
 

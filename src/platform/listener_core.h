@@ -13,9 +13,9 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/handles.h"
-#include "platform/listener.h"
-#include "platform/log.h"
+#include "platform/bus/handles.h"
+#include "platform/bus/listener.h"
+#include "platform/log/log.h"
 
 struct signalfd_siginfo;
 

@@ -3,7 +3,7 @@
 
 #include <cstring>
 
-#include "platform/listener_core.h"
+#include "platform/bus/listener_core.h"
 
 namespace platform {
 

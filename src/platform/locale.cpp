@@ -1,4 +1,4 @@
-#include "platform/locale.h"
+#include "platform/config/locale.h"
 
 #include <unicode/uloc.h>
 

@@ -1,4 +1,4 @@
-#include "platform/process_memory.h"
+#include "support/process_memory.h"
 
 #include <cstdio>
 #include <cstring>

@@ -1,10 +1,10 @@
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
 
 #include <limits>
 #include <optional>
 #include <stdexcept>
 
-#include "platform/worker_pool.h"
+#include "platform/dispatch/worker_pool.h"
 
 namespace platform {
 

@@ -13,7 +13,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/value.h"
+#include "platform/values/value.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/uuid.h"
+#include "platform/values/uuid.h"
 
 #include <openssl/rand.h>
 

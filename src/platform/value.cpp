@@ -1,4 +1,4 @@
-#include "platform/value.h"
+#include "platform/values/value.h"
 
 #include <cmath>
 #include <cstdio>

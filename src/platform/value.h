@@ -17,7 +17,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/data.h"
+#include "platform/values/data.h"
 
 namespace platform {
 

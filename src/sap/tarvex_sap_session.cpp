@@ -8,8 +8,8 @@
 #include <ctime>
 #include <vector>
 
-#include "platform/exception.h"
-#include "platform/log.h"
+#include "platform/values/exception.h"
+#include "platform/log/log.h"
 
 using platform::Data;
 using platform::Error;

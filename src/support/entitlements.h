@@ -7,7 +7,7 @@
 
 #include <string_view>
 
-#include "platform/connection.h"
+#include "platform/bus/connection.h"
 
 namespace Entitlements {
 

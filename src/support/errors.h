@@ -9,7 +9,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/error.h"
+#include "platform/values/error.h"
 
 inline constexpr char ZLKAErrorDomain[] = "ZLKAuthenticationErrorDomain";
 inline constexpr char ZLKACertificateManagerErrorDomain[] = "ZLKACertificateManagerErrorDomain";

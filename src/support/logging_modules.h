@@ -13,7 +13,7 @@
 #include <cstdint>
 #include <memory>
 
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 struct LoggingModuleEntry_t {
   const char* subsystem;  // may be null

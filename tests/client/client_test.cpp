@@ -23,7 +23,7 @@
 #include "client/bus_names.h"
 #include "client/zlka_client.h"
 #include "common/child_process.h"
-#include "platform/json.h"
+#include "platform/values/json.h"
 #include "zlkactl/command_line.h"
 #include "zlkactl/commands.h"
 #include "zlkactl/token_input.h"

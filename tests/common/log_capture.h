@@ -12,7 +12,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace zlkatest {
 

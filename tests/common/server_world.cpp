@@ -13,7 +13,7 @@
 
 #include "devserver/dev_server.h"
 #include "network/zlka_network_constants.h"
-#include "platform/device_facts.h"
+#include "platform/config/device_facts.h"
 #include "tarvexsap/tarvex_sap.h"
 
 namespace zlkatest {

@@ -17,9 +17,9 @@
 #include <string_view>
 
 #include "common/child_process.h"
-#include "platform/configuration.h"
-#include "platform/settings_store.h"
-#include "platform/value.h"
+#include "platform/config/configuration.h"
+#include "platform/config/settings_store.h"
+#include "platform/values/value.h"
 
 namespace devserver {
 class DevServer;

@@ -4,8 +4,8 @@
 #include <cmath>
 
 #include "network_fixture.h"
-#include "platform/base64.h"
-#include "platform/http_session.h"
+#include "platform/values/base64.h"
+#include "platform/http/http_session.h"
 
 namespace nettest {
 namespace {

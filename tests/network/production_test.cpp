@@ -7,7 +7,7 @@
 #include <thread>
 
 #include "network_fixture.h"
-#include "platform/exception.h"
+#include "platform/values/exception.h"
 
 namespace nettest {
 namespace {

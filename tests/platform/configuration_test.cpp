@@ -1,4 +1,4 @@
-#include "platform/configuration.h"
+#include "platform/config/configuration.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -6,8 +6,8 @@
 #include <filesystem>
 #include <fstream>
 
-#include "platform/device_facts.h"
-#include "platform/process_memory.h"
+#include "platform/config/device_facts.h"
+#include "support/process_memory.h"
 
 namespace {
 

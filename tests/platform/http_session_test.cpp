@@ -1,6 +1,6 @@
 // The HTTP session against the reference server, for what the request pipeline's tests do not
 // already drive: https only, TLS verification, the error codes, cancelling, the time-out cap.
-#include "platform/http_session.h"
+#include "platform/http/http_session.h"
 
 #include <gtest/gtest.h>
 

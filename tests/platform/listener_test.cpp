@@ -1,5 +1,5 @@
 // The listener in-process on a private bus: working out who a peer is must never hold up anyone else.
-#include "platform/listener.h"
+#include "platform/bus/listener.h"
 
 #include <gtest/gtest.h>
 
@@ -8,8 +8,8 @@
 
 #include "common/log_capture.h"
 #include "common/child_process.h"
-#include "platform/handles.h"
-#include "platform/semaphore.h"
+#include "platform/bus/handles.h"
+#include "platform/dispatch/semaphore.h"
 
 namespace {
 

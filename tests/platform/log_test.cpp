@@ -1,11 +1,11 @@
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include "common/log_capture.h"
-#include "platform/data.h"
+#include "platform/values/data.h"
 
 using platform::LogArg;
 using platform::LogLevel;

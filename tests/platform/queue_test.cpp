@@ -1,5 +1,5 @@
 // Queues, the worker pool under them and the semaphore their work waits on.
-#include "platform/queue.h"
+#include "platform/dispatch/queue.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -14,8 +14,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/semaphore.h"
-#include "platform/worker_pool.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/dispatch/worker_pool.h"
 
 namespace {
 

@@ -6,11 +6,11 @@
 #include <cstring>
 #include <limits>
 
-#include "platform/base64.h"
-#include "platform/error.h"
-#include "platform/json.h"
-#include "platform/locale.h"
-#include "platform/uuid.h"
+#include "platform/values/base64.h"
+#include "platform/values/error.h"
+#include "platform/values/json.h"
+#include "platform/config/locale.h"
+#include "platform/values/uuid.h"
 
 using platform::Array;
 using platform::Data;

@@ -8,7 +8,7 @@
 
 #include <fstream>
 
-#include "platform/json.h"
+#include "platform/values/json.h"
 
 namespace service_test {
 

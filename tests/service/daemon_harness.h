@@ -13,7 +13,7 @@
 #include "common/child_process.h"
 #include "common/server_world.h"
 #include "devserver/dev_server.h"
-#include "platform/handles.h"
+#include "platform/bus/handles.h"
 
 namespace service_test {
 

@@ -6,7 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "platform/device_facts.h"
+#include "platform/config/device_facts.h"
 #include "support/base64_array.h"
 #include "support/hex.h"
 #include "support/json_file.h"

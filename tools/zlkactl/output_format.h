@@ -9,7 +9,7 @@
 #include <string>
 
 #include "client/reply_decoding.h"
-#include "platform/error.h"
+#include "platform/values/error.h"
 
 namespace zlkactl {
 
