@@ -13,7 +13,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/values/error.h"
+#include "platform/error.h"
 
 namespace zlka_client {
 

@@ -3,8 +3,8 @@
 #include <cstring>
 
 #include "client/client_error.h"
-#include "platform/bus/bus_values.h"
-#include "platform/values/json.h"
+#include "platform/bus_values.h"
+#include "platform/json.h"
 
 namespace zlka_client {
 

@@ -7,8 +7,8 @@
 #include <string>
 
 #include "client/result.h"
-#include "platform/values/data.h"
-#include "platform/values/value.h"
+#include "platform/data.h"
+#include "platform/value.h"
 
 namespace zlka_client {
 

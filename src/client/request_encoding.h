@@ -15,9 +15,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/bus/bus_values.h"
-#include "platform/values/data.h"
-#include "platform/values/value.h"
+#include "platform/bus_values.h"
+#include "platform/data.h"
+#include "platform/value.h"
 
 namespace zlka_client {
 

@@ -4,7 +4,7 @@
 #include <utility>
 #include <variant>
 
-#include "platform/values/error.h"
+#include "platform/error.h"
 
 namespace zlka_client {
 

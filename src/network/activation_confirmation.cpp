@@ -1,7 +1,7 @@
 // Activation confirmation: "deviceservices/ackAccessory". The answer is judged by its status alone;
 // its signature is not verified and its body not read.
 #include "network/request_pipeline.h"
-#include "platform/log/log.h"
+#include "platform/log.h"
 #include "support/errors.h"
 
 using platform::Data;

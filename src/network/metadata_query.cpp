@@ -1,6 +1,6 @@
 // The product-plan metadata query: "deviceservices/queryProductPlan".
 #include "network/request_pipeline.h"
-#include "platform/log/log.h"
+#include "platform/log.h"
 #include "support/errors.h"
 
 using platform::Data;

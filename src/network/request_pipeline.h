@@ -10,10 +10,10 @@
 #include <variant>
 
 #include "network/zlka_network.h"
-#include "platform/values/data.h"
-#include "platform/values/error.h"
-#include "platform/http/http_message.h"
-#include "platform/values/value.h"
+#include "platform/data.h"
+#include "platform/error.h"
+#include "platform/http_message.h"
+#include "platform/value.h"
 
 namespace request_pipeline {
 

@@ -4,9 +4,9 @@
 #include <mutex>
 
 #include "network/zlka_network.h"
-#include "platform/values/base64.h"
-#include "platform/log/log.h"
-#include "platform/dispatch/semaphore.h"
+#include "platform/base64.h"
+#include "platform/log.h"
+#include "platform/semaphore.h"
 
 using platform::Data;
 using platform::Error;

@@ -1,6 +1,6 @@
 // Token activation: "deviceservices/activateAccessory", answered with a replacement token.
 #include "network/request_pipeline.h"
-#include "platform/log/log.h"
+#include "platform/log.h"
 #include "support/base64_array.h"
 #include "support/errors.h"
 

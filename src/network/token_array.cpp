@@ -1,8 +1,8 @@
 #include "network/token_array.h"
 
 #include "der/der_item.h"
-#include "platform/log/log.h"
-#include "platform/values/value.h"
+#include "platform/log.h"
+#include "platform/value.h"
 #include "support/obfuscated_pointer.h"
 
 using platform::LogLevel;

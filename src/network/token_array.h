@@ -8,6 +8,6 @@
 #include <optional>
 #include <vector>
 
-#include "platform/values/data.h"
+#include "platform/data.h"
 
 std::optional<std::vector<platform::Data>> parseTokenArray(const std::optional<platform::Data>& tokenData);

@@ -1,9 +1,9 @@
 #include "network/zlka_network.h"
 
 #include "network/zlka_network_exported.h"
-#include "platform/config/configuration.h"
-#include "platform/values/exception.h"
-#include "platform/log/log.h"
+#include "platform/configuration.h"
+#include "platform/exception.h"
+#include "platform/log.h"
 #include "support/system_info.h"
 
 using platform::LogLevel;

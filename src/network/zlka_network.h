@@ -16,9 +16,9 @@
 
 #include "network/zlka_network_constants.h"
 #include "network/zlka_network_protocol.h"
-#include "platform/config/configuration.h"
-#include "platform/http/http_session.h"
-#include "platform/config/settings_store.h"
+#include "platform/configuration.h"
+#include "platform/http_session.h"
+#include "platform/settings_store.h"
 #include "sap/tarvex_sap_session.h"
 
 class ZLKANetwork final : public ZLKANetworkProtocol,

@@ -7,10 +7,10 @@
 #include <optional>
 #include <string>
 
-#include "platform/values/data.h"
-#include "platform/values/error.h"
-#include "platform/config/locale.h"
-#include "platform/values/value.h"
+#include "platform/data.h"
+#include "platform/error.h"
+#include "platform/locale.h"
+#include "platform/value.h"
 
 using ZLKAMetadataReply = std::function<void(std::optional<std::string> ppid, std::optional<platform::Locale> locale,
                                              std::optional<platform::Dictionary> metadata,

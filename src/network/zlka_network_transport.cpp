@@ -2,9 +2,9 @@
 // handshake with the secure-association server, both over the process-wide shared HTTP session.
 #include "network/zlka_network.h"
 
-#include "platform/values/base64.h"
-#include "platform/values/json.h"
-#include "platform/log/log.h"
+#include "platform/base64.h"
+#include "platform/json.h"
+#include "platform/log.h"
 
 using platform::Data;
 using platform::Error;

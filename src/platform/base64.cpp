@@ -1,4 +1,4 @@
-#include "platform/values/base64.h"
+#include "platform/base64.h"
 
 #include <openssl/evp.h>
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/values/data.h"
+#include "platform/data.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/bus/bus_values.h"
+#include "platform/bus_values.h"
 
 #include <cerrno>
 #include <cstring>

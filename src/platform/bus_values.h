@@ -14,8 +14,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/bus/messaging.h"
-#include "platform/values/value.h"
+#include "platform/messaging.h"
+#include "platform/value.h"
 
 namespace platform {
 

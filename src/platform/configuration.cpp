@@ -1,4 +1,4 @@
-#include "platform/config/configuration.h"
+#include "platform/configuration.h"
 
 #include <curl/curl.h>
 

@@ -14,8 +14,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/config/device_facts.h"
-#include "platform/log/log.h"
+#include "platform/device_facts.h"
+#include "platform/log.h"
 
 namespace platform {
 

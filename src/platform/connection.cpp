@@ -1,6 +1,6 @@
-#include "platform/bus/connection.h"
+#include "platform/connection.h"
 
-#include "platform/dispatch/worker_pool.h"
+#include "platform/worker_pool.h"
 
 namespace platform {
 

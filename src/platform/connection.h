@@ -11,9 +11,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/bus/messaging.h"
-#include "platform/dispatch/queue.h"
-#include "platform/values/value.h"
+#include "platform/messaging.h"
+#include "platform/queue.h"
+#include "platform/value.h"
 
 namespace platform {
 

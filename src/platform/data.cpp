@@ -1,4 +1,4 @@
-#include "platform/values/data.h"
+#include "platform/data.h"
 
 #include <cstdlib>
 #include <cstring>

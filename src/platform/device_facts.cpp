@@ -1,9 +1,9 @@
-#include "platform/config/device_facts.h"
+#include "platform/device_facts.h"
 
 #include <mutex>
 #include <toml++/toml.h>
 
-#include "platform/log/log.h"
+#include "platform/log.h"
 
 namespace platform {
 

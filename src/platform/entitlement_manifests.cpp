@@ -1,4 +1,4 @@
-#include "platform/bus/entitlement_manifests.h"
+#include "platform/entitlement_manifests.h"
 
 #include <fcntl.h>
 #include <poll.h>
@@ -11,8 +11,8 @@
 #include <array>
 #include <limits>
 
-#include "platform/values/json.h"
-#include "platform/log/log.h"
+#include "platform/json.h"
+#include "platform/log.h"
 
 namespace platform {
 

@@ -21,9 +21,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/bus/handles.h"
-#include "platform/values/result.h"
-#include "platform/values/value.h"
+#include "platform/handles.h"
+#include "platform/result.h"
+#include "platform/value.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/values/error.h"
+#include "platform/error.h"
 
 namespace platform {
 

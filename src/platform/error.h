@@ -7,7 +7,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/values/value.h"
+#include "platform/value.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/http/http_message.h"
+#include "platform/http_message.h"
 
 #include <strings.h>
 

@@ -8,7 +8,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/values/value.h"
+#include "platform/value.h"
 
 namespace platform {
 

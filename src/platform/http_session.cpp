@@ -1,4 +1,4 @@
-#include "platform/http/http_session.h"
+#include "platform/http_session.h"
 
 #include <curl/curl.h>
 
@@ -12,8 +12,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/config/configuration.h"
-#include "platform/dispatch/semaphore.h"
+#include "platform/configuration.h"
+#include "platform/semaphore.h"
 
 namespace platform {
 

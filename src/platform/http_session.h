@@ -19,10 +19,10 @@
 #include <optional>
 #include <string>
 
-#include "platform/values/data.h"
-#include "platform/values/error.h"
-#include "platform/http/http_message.h"
-#include "platform/dispatch/queue.h"
+#include "platform/data.h"
+#include "platform/error.h"
+#include "platform/http_message.h"
+#include "platform/queue.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/values/json.h"
+#include "platform/json.h"
 
 #include <cmath>
 #include <nlohmann/json.hpp>

@@ -10,7 +10,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/values/value.h"
+#include "platform/value.h"
 
 namespace platform::json {
 

@@ -14,9 +14,9 @@
 #include <optional>
 #include <string>
 
-#include "platform/bus/connection.h"
-#include "platform/bus/entitlement_manifests.h"
-#include "platform/bus/messaging.h"
+#include "platform/connection.h"
+#include "platform/entitlement_manifests.h"
+#include "platform/messaging.h"
 
 namespace platform {
 

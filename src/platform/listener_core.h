@@ -13,9 +13,9 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/bus/handles.h"
-#include "platform/bus/listener.h"
-#include "platform/log/log.h"
+#include "platform/handles.h"
+#include "platform/listener.h"
+#include "platform/log.h"
 
 struct signalfd_siginfo;
 

@@ -2,7 +2,7 @@
 // exactly one answer to each.
 #include <cstring>
 
-#include "platform/bus/listener_core.h"
+#include "platform/listener_core.h"
 
 namespace platform {
 

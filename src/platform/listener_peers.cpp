@@ -3,7 +3,7 @@
 
 #include <cstring>
 
-#include "platform/bus/listener_core.h"
+#include "platform/listener_core.h"
 
 namespace platform {
 

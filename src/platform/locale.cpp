@@ -1,4 +1,4 @@
-#include "platform/config/locale.h"
+#include "platform/locale.h"
 
 #include <unicode/uloc.h>
 

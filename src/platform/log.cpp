@@ -1,4 +1,4 @@
-#include "platform/log/log.h"
+#include "platform/log.h"
 
 #include <sys/stat.h>
 #include <sys/uio.h>

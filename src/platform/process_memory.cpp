@@ -1,4 +1,4 @@
-#include "support/process_memory.h"
+#include "platform/process_memory.h"
 
 #include <cstdio>
 #include <cstring>

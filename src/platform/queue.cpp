@@ -1,4 +1,4 @@
-#include "platform/dispatch/queue.h"
+#include "platform/queue.h"
 
 #include <atomic>
 #include <condition_variable>
@@ -10,8 +10,8 @@
 #include <stdexcept>
 #include <utility>
 
-#include "platform/dispatch/semaphore.h"
-#include "platform/dispatch/worker_pool.h"
+#include "platform/semaphore.h"
+#include "platform/worker_pool.h"
 
 namespace platform {
 

@@ -1,10 +1,10 @@
-#include "platform/dispatch/semaphore.h"
+#include "platform/semaphore.h"
 
 #include <limits>
 #include <optional>
 #include <stdexcept>
 
-#include "platform/dispatch/worker_pool.h"
+#include "platform/worker_pool.h"
 
 namespace platform {
 

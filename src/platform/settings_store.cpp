@@ -1,4 +1,4 @@
-#include "platform/config/settings_store.h"
+#include "platform/settings_store.h"
 
 #include <fcntl.h>
 #include <sys/file.h>
@@ -10,10 +10,10 @@
 #include <functional>
 #include <sstream>
 
-#include "platform/config/atomic_file.h"
-#include "platform/config/configuration.h"
-#include "platform/values/json.h"
-#include "platform/log/log.h"
+#include "platform/atomic_file.h"
+#include "platform/configuration.h"
+#include "platform/json.h"
+#include "platform/log.h"
 
 namespace platform {
 

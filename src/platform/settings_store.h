@@ -13,7 +13,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/values/value.h"
+#include "platform/value.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/values/uuid.h"
+#include "platform/uuid.h"
 
 #include <openssl/rand.h>
 

@@ -1,4 +1,4 @@
-#include "platform/values/value.h"
+#include "platform/value.h"
 
 #include <cmath>
 #include <cstdio>

@@ -17,7 +17,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/values/data.h"
+#include "platform/data.h"
 
 namespace platform {
 

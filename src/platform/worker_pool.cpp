@@ -1,4 +1,4 @@
-#include "platform/dispatch/worker_pool.h"
+#include "platform/worker_pool.h"
 
 #include <malloc.h>
 

@@ -8,8 +8,8 @@
 #include <ctime>
 #include <vector>
 
-#include "platform/values/exception.h"
-#include "platform/log/log.h"
+#include "platform/exception.h"
+#include "platform/log.h"
 
 using platform::Data;
 using platform::Error;

@@ -17,11 +17,11 @@
 #include <optional>
 #include <string>
 
-#include "platform/values/data.h"
-#include "platform/values/error.h"
-#include "platform/dispatch/queue.h"
-#include "platform/values/uuid.h"
-#include "platform/values/value.h"
+#include "platform/data.h"
+#include "platform/error.h"
+#include "platform/queue.h"
+#include "platform/uuid.h"
+#include "platform/value.h"
 #include "sap/tarvex_sap_primitives.h"
 #include "sap/tarvex_sap_session_delegate.h"
 #include "sap/tarvex_sap_session_error.h"

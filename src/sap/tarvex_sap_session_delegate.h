@@ -5,8 +5,8 @@
 #include <functional>
 #include <optional>
 
-#include "platform/values/data.h"
-#include "platform/values/error.h"
+#include "platform/data.h"
+#include "platform/error.h"
 
 class TarvexSAPSession;
 

@@ -6,7 +6,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/values/error.h"
+#include "platform/error.h"
 
 inline constexpr char TarvexSAPSessionErrorDomain[] = "TarvexSAPSessionErrorDomain";
 

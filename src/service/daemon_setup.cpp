@@ -5,12 +5,12 @@
 #include <fstream>
 #include <sstream>
 
-#include "platform/config/configuration.h"
-#include "platform/config/device_facts.h"
-#include "platform/bus/entitlement_manifests.h"
-#include "platform/bus/listener.h"
-#include "platform/log/log.h"
-#include "platform/dispatch/worker_pool.h"
+#include "platform/configuration.h"
+#include "platform/device_facts.h"
+#include "platform/entitlement_manifests.h"
+#include "platform/listener.h"
+#include "platform/log.h"
+#include "platform/worker_pool.h"
 #include "service/zlka_network_bus_interface.h"
 #include "tarvexsap/tarvex_sap.h"
 

@@ -1,7 +1,7 @@
 // zlkad: the process entry. Everything after start-up runs on the listener's loop and the queues.
 #include <unistd.h>
 
-#include "platform/bus/listener.h"
+#include "platform/listener.h"
 #include "service/daemon_setup.h"
 #include "service/service_delegate.h"
 

@@ -5,9 +5,9 @@
 
 #include "network/request_pipeline.h"
 #include "network/zlka_network_protocol.h"
-#include "platform/bus/bus_values.h"
-#include "platform/values/json.h"
-#include "platform/log/log.h"
+#include "platform/bus_values.h"
+#include "platform/json.h"
+#include "platform/log.h"
 #include "support/errors.h"
 
 using platform::BusError;

@@ -1,6 +1,6 @@
 #include "support/base64_array.h"
 
-#include "platform/values/base64.h"
+#include "platform/base64.h"
 
 std::vector<std::string> base64EncodeArray(const std::optional<std::vector<platform::Data>>& array) {
   std::vector<std::string> out;

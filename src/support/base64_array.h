@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/values/data.h"
+#include "platform/data.h"
 
 // Standard base64 with padding, no line breaks; no array gives an empty array.
 std::vector<std::string> base64EncodeArray(const std::optional<std::vector<platform::Data>>& array);

@@ -7,7 +7,7 @@
 
 #include <string_view>
 
-#include "platform/bus/connection.h"
+#include "platform/connection.h"
 
 namespace Entitlements {
 

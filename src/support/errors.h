@@ -9,7 +9,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/values/error.h"
+#include "platform/error.h"
 
 inline constexpr char ZLKAErrorDomain[] = "ZLKAuthenticationErrorDomain";
 inline constexpr char ZLKACertificateManagerErrorDomain[] = "ZLKACertificateManagerErrorDomain";

@@ -7,8 +7,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/values/data.h"
-#include "platform/values/value.h"
+#include "platform/data.h"
+#include "platform/value.h"
 
 // Parses floor(length / 2) pairs of hex characters into bytes (first character the high nibble).
 void ascii_to_hex(uint8_t* out, const char* in, size_t length);

@@ -3,8 +3,8 @@
 #include <fstream>
 #include <sstream>
 
-#include "platform/config/atomic_file.h"
-#include "platform/values/json.h"
+#include "platform/atomic_file.h"
+#include "platform/json.h"
 
 std::optional<platform::Value> readJSONFile(const std::optional<std::filesystem::path>& path) {
   if (!path) return std::nullopt;

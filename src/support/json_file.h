@@ -4,7 +4,7 @@
 #include <filesystem>
 #include <optional>
 
-#include "platform/values/value.h"
+#include "platform/value.h"
 
 // The parsed object or array; nullopt for no path, an unreadable file or any parse error.
 std::optional<platform::Value> readJSONFile(const std::optional<std::filesystem::path>& path);

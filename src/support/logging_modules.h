@@ -13,7 +13,7 @@
 #include <cstdint>
 #include <memory>
 
-#include "platform/log/log.h"
+#include "platform/log.h"
 
 struct LoggingModuleEntry_t {
   const char* subsystem;  // may be null

@@ -5,8 +5,8 @@
 #include <set>
 #include <string>
 
-#include "platform/bus/protocol.h"
-#include "platform/values/value.h"
+#include "platform/protocol.h"
+#include "platform/value.h"
 
 // True for no value and for the null value of parsed JSON.
 bool isNSObjectNull(const std::optional<platform::Value>& object);

@@ -4,8 +4,8 @@
 #include <cmath>
 #include <mutex>
 
-#include "platform/config/device_facts.h"
-#include "support/process_memory.h"
+#include "platform/device_facts.h"
+#include "platform/process_memory.h"
 
 bool systemInfo_isInternalBuild() {
   static std::once_flag once;

@@ -4,7 +4,7 @@
 
 #include <ostream>
 
-#include "platform/values/error.h"
+#include "platform/error.h"
 #include "zlkactl/command_line.h"
 
 namespace zlkactl {

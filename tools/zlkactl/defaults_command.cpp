@@ -1,5 +1,5 @@
-#include "platform/config/configuration.h"
-#include "platform/config/settings_store.h"
+#include "platform/configuration.h"
+#include "platform/settings_store.h"
 #include "zlkactl/commands.h"
 #include "zlkactl/output_format.h"
 #include "zlkactl/token_input.h"

@@ -2,7 +2,7 @@
 #include <iostream>
 
 #include "zlkactl/command_line.h"
-#include "platform/log/log.h"
+#include "platform/log.h"
 #include "zlkactl/commands.h"
 
 int main(int argc, char** argv) {

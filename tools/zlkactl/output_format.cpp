@@ -1,7 +1,7 @@
 #include "zlkactl/output_format.h"
 
-#include "platform/values/base64.h"
-#include "platform/values/json.h"
+#include "platform/base64.h"
+#include "platform/json.h"
 #include "zlkactl/token_input.h"
 
 namespace zlkactl {

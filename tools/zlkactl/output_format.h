@@ -9,7 +9,7 @@
 #include <string>
 
 #include "client/reply_decoding.h"
-#include "platform/values/error.h"
+#include "platform/error.h"
 
 namespace zlkactl {
 

@@ -8,8 +8,8 @@
 #include <vector>
 
 #include "client/request_encoding.h"
-#include "platform/values/base64.h"
-#include "platform/values/json.h"
+#include "platform/base64.h"
+#include "platform/json.h"
 
 namespace zlkactl {
 

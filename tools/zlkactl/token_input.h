@@ -8,8 +8,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/values/data.h"
-#include "platform/values/value.h"
+#include "platform/data.h"
+#include "platform/value.h"
 
 namespace zlkactl {
 
