@@ -25,7 +25,6 @@
 #include "client/bus_names.h"
 #include "client/zlka_client.h"
 #include "common/child_process.h"
-#include "common/private_bus.h"
 #include "platform/values/json.h"
 #include "zlka/client.h"
 #include "zlkactl/command_line.h"
@@ -42,6 +41,7 @@ using platform::Error;
 using platform::Value;
 using testing::HasSubstr;
 using zlka_client::ZLKAClient;
+using zlkatest::PrivateBus;
 
 std::string hex(const void* data, size_t length) {
   std::string out;

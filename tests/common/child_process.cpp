@@ -8,8 +8,11 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <gtest/gtest.h>
+
 #include <atomic>
 #include <fstream>
+#include <thread>
 #include <sstream>
 #include <string_view>
 
@@ -17,13 +20,11 @@ extern char** environ;
 
 namespace zlkatest {
 
-namespace {
 std::string readFile(const std::filesystem::path& path) {
   std::ostringstream text;
   text << std::ifstream(path, std::ios::binary).rdbuf();
   return text.str();
 }
-}  // namespace
 
 TempDir::TempDir() {
   char pattern[] = "/tmp/zlka-test-XXXXXX";
@@ -96,6 +97,34 @@ RunResult runToEnd(const std::vector<std::string>& argv, const std::filesystem::
   ChildProcess child(argv, outputDirectory);
   const int status = child.waitExit(std::chrono::minutes(2)).value_or(-1);
   return {status, child.standardOutput(), child.standardError()};
+}
+
+PrivateBus::PrivateBus(bool anyUser) {
+  if (anyUser) std::filesystem::permissions(directory_.path(), std::filesystem::perms(0755));
+  const std::filesystem::path config = directory_.path() / "bus.conf";
+  std::ofstream(config)
+      << "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
+         " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
+         "<busconfig><type>session</type><auth>EXTERNAL</auth><listen>unix:path="
+      << (directory_.path() / "socket").string()
+      << "</listen>\n"
+         // Room for the benchmark's thousand idle peers.
+         "<limit name=\"max_completed_connections\">4096</limit><limit name=\"max_connections_per_user\">4096</limit>\n"
+         "<policy context=\"default\">"
+      << (anyUser ? "<allow user=\"*\"/>" : "")
+      << "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/><allow own=\"*\"/></policy>\n"
+         "</busconfig>\n";
+  // The address is printed once the daemon listens.
+  daemon_ = std::make_unique<ChildProcess>(
+      std::vector<std::string>{"/usr/bin/dbus-daemon", "--config-file=" + config.string(), "--nofork", "--print-address=1"},
+      directory_.path());
+  std::string out;
+  for (int i = 0; i < 3000 && (out = daemon_->standardOutput()).find('\n') == std::string::npos &&
+                  !daemon_->waitExit(std::chrono::milliseconds(0));
+       ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  if (out.find('\n') == std::string::npos) ADD_FAILURE() << "dbus-daemon printed no address: " << daemon_->standardError();
+  else address_ = out.substr(0, out.find('\n'));
 }
 
 }  // namespace zlkatest

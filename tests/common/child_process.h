@@ -1,4 +1,4 @@
-// Programs run by the tests: the daemon, zlkactl, zlka-devserver, busctl. Standard input is
+// Programs run by the tests: the daemon, zlkactl, zlka-devserver, dbus-daemon. Standard input is
 // /dev/null and standard output and error go to files in a directory the test keeps, so that a
 // child never blocks on a full pipe and its output can be read at any time.
 #pragma once
@@ -7,6 +7,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
@@ -54,5 +55,21 @@ struct RunResult {
   std::string out, err;
 };
 RunResult runToEnd(const std::vector<std::string>& argv, const std::filesystem::path& outputDirectory);
+std::string readFile(const std::filesystem::path& path);  // "" when it cannot be read
+
+// A private dbus-daemon for one test, from a configuration that lets anyone own any name; with
+// `anyUser`, processes of every user may connect, as on the system bus. Fails the current test
+// when it does not start.
+class PrivateBus {
+ public:
+  explicit PrivateBus(bool anyUser = false);
+  bool running() const { return !address_.empty(); }
+  const std::string& address() const { return address_; }  // "unix:path=...,guid=..."
+
+ private:
+  TempDir directory_;
+  std::unique_ptr<ChildProcess> daemon_;
+  std::string address_;
+};
 
 }  // namespace zlkatest

@@ -14,7 +14,6 @@
 #include "devserver/dev_server.h"
 #include "network/zlka_network_constants.h"
 #include "platform/config/device_facts.h"
-#include "platform/config/settings_store.h"
 #include "tarvexsap/tarvex_sap.h"
 
 namespace zlkatest {
@@ -26,23 +25,20 @@ namespace {
 ServerWorld* gWorld = nullptr;
 }  // namespace
 
-std::string AdminClient::call(const std::string& method, const std::string& path, const std::string& body) const {
-  httplib::SSLClient client("127.0.0.1", port_);
-  client.set_ca_cert_path(caFile_.c_str());
+void AdminClient::call(const std::string& method, const std::string& path, const std::string& body) const {
+  httplib::SSLClient client("127.0.0.1", server_.port());
+  client.set_ca_cert_path((server_.stateDir() / "ca.pem").c_str());
   client.enable_server_certificate_verification(true);
   client.set_read_timeout(60, 0);
-  auto result = method == "GET"      ? client.Get(path)
-                : method == "DELETE" ? client.Delete(path)
-                                     : client.Post(path, body, "application/json");
-  if (result && result->status == 200) return result->body;
-  ADD_FAILURE() << method << " " << path << " " << body << ": " << (result ? result->body : "no answer");
-  return "{}";
+  auto result = method == "DELETE" ? client.Delete(path) : client.Post(path, body, "application/json");
+  if (!result || result->status != 200)
+    ADD_FAILURE() << method << " " << path << " " << body << ": " << (result ? result->body : "no answer");
 }
 
 void AdminClient::setFault(const json& rule) const { call("POST", "/_admin/faults", rule.dump()); }
 void AdminClient::clearFaults() const { call("DELETE", "/_admin/faults"); }
 void AdminClient::reset() const { call("POST", "/_admin/reset"); }
-json AdminClient::stats() const { return json::parse(call("GET", "/_admin/stats")); }
+json AdminClient::stats() const { return server_.statistics(); }
 
 uint64_t AdminClient::requests(std::string_view endpoint) const {
   const json all = stats()["requests"];
@@ -51,31 +47,6 @@ uint64_t AdminClient::requests(std::string_view endpoint) const {
   for (const auto& [name, n] : all.items()) sum += n.get<uint64_t>();
   return sum;
 }
-uint64_t AdminClient::handshakes() const { return stats().value("handshakes", uint64_t{0}); }
-uint64_t AdminClient::verified() const { return stats().value("verified", uint64_t{0}); }
-uint64_t AdminClient::rejected() const { return stats().value("rejected", uint64_t{0}); }
-
-void SettingsSuite::set(std::string_view key, const platform::Value& value) const {
-  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).setObject(key, value))
-      << "cannot write " << key;
-}
-
-void SettingsSuite::remove(std::string_view key) const {
-  ASSERT_TRUE(platform::SettingsStore(ZLKAUserDefaultsDomain, directory_).removeObject(key)) << "cannot remove " << key;
-}
-
-void SettingsSuite::clear() const {
-  std::error_code ignored;
-  fs::remove(file(), ignored);
-}
-
-void SettingsSuite::writeRaw(std::string_view text) const {
-  std::ofstream out(file(), std::ios::binary | std::ios::trunc);
-  out << text;
-  ASSERT_TRUE(out.good()) << "cannot write " << file();
-}
-
-fs::path SettingsSuite::file() const { return directory_ / (std::string(ZLKAUserDefaultsDomain) + ".json"); }
 
 ServerWorld::ServerWorld(bool internalBuild) : internalBuild_(internalBuild) { gWorld = this; }
 
@@ -94,11 +65,8 @@ std::string ServerWorld::baseURL() const { return server_->baseURL(); }
 void ServerWorld::SetUp() {
   // A connection that the server cuts must fail a write, not end the process.
   signal(SIGPIPE, SIG_IGN);
-  std::string pattern = (fs::temp_directory_path() / "zlka-server-world-XXXXXX").string();
-  ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-  tempDir_ = pattern;
   devserver::DevServerOptions options;
-  options.stateDir = tempDir_ / "state";
+  options.stateDir = tempDir_.emplace().path() / "state";
   options.admin = true;
   server_ = std::make_unique<devserver::DevServer>(options);
   if (auto error = server_->start()) FAIL() << "zlka-devserver did not start: " << *error;
@@ -111,9 +79,7 @@ void ServerWorld::SetUp() {
   platform::setCurrentConfiguration(configuration_);
   platform::setDeviceFacts(configuration_.device);
 
-  std::ostringstream anchor;
-  anchor << std::ifstream(configuration_.trustAnchor, std::ios::binary).rdbuf();
-  const std::string pem = anchor.str();
+  const std::string pem = readFile(configuration_.trustAnchor);
   const TarvexSAPConfig sapConfig{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
   ASSERT_EQ(TarvexSAPConfigure(&sapConfig), kTarvexSAPOK);
 
@@ -127,14 +93,13 @@ void ServerWorld::SetUp() {
   ASSERT_EQ(::getsockname(refusedSocket_, reinterpret_cast<sockaddr*>(&address), &length), 0);
   refusedPort_ = ntohs(address.sin_port);
 
-  admin_ = std::make_unique<AdminClient>(server_->port(), configuration_.caFile);
-  suite_ = std::make_unique<SettingsSuite>(configuration_.settingsDirectory);
+  admin_ = std::make_unique<AdminClient>(*server_);
+  suite_ = std::make_unique<platform::SettingsStore>(ZLKAUserDefaultsDomain, configuration_.settingsDirectory);
 }
 
 void ServerWorld::TearDown() {
   if (server_) server_->stop();
-  std::error_code ignored;
-  if (!tempDir_.empty()) fs::remove_all(tempDir_, ignored);
+  tempDir_.reset();
 }
 
 ScopedConfiguration::ScopedConfiguration(const std::function<void(platform::Configuration&)>& change)

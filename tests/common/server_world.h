@@ -16,7 +16,9 @@
 #include <string>
 #include <string_view>
 
+#include "common/child_process.h"
 #include "platform/config/configuration.h"
+#include "platform/config/settings_store.h"
 #include "platform/values/value.h"
 
 namespace devserver {
@@ -25,41 +27,25 @@ class DevServer;
 
 namespace zlkatest {
 
-// The server's /_admin interface: faults (rules as in devserver/fault_table.h) and statistics.
+// A server's faults (rules as in devserver/fault_table.h), set through its /_admin interface, and
+// its statistics.
 class AdminClient {
  public:
-  AdminClient(uint16_t port, std::filesystem::path caFile) : port_(port), caFile_(std::move(caFile)) {}
+  explicit AdminClient(const devserver::DevServer& server) : server_(server) {}
   void setFault(const nlohmann::json& rule) const;
   void clearFaults() const;
-  // Clears the faults and the statistics.
-  void reset() const;
-  nlohmann::json stats() const;
+  void reset() const;  // clears the faults and the statistics
   // Requests that reached one endpoint ("setup.crt", "sapSession", "queryProductPlan", ...), or
   // every endpoint when `endpoint` is empty.
   uint64_t requests(std::string_view endpoint = {}) const;
-  uint64_t handshakes() const;  // associations made
-  uint64_t verified() const;    // token requests whose signature the server accepted
-  uint64_t rejected() const;
+  // One statistic: "handshakes" (associations made), "verified" and "rejected" (token requests
+  // whose signature the server accepted or refused).
+  uint64_t stat(const std::string& name) const { return stats().value(name, uint64_t{0}); }
+  nlohmann::json stats() const;  // as GET /_admin/stats answers
 
  private:
-  // The answer's body; a failure of the current test unless it is 200.
-  std::string call(const std::string& method, const std::string& path, const std::string& body = {}) const;
-  uint16_t port_;
-  std::filesystem::path caFile_;
-};
-
-// The developer settings suite of the configuration, written as the settings tool writes it.
-class SettingsSuite {
- public:
-  explicit SettingsSuite(std::filesystem::path directory) : directory_(std::move(directory)) {}
-  void set(std::string_view key, const platform::Value& value) const;
-  void remove(std::string_view key) const;
-  void clear() const;
-  void writeRaw(std::string_view text) const;  // any text, parsable or not
-  std::filesystem::path file() const;
-
- private:
-  std::filesystem::path directory_;
+  void call(const std::string& method, const std::string& path, const std::string& body = {}) const;
+  const devserver::DevServer& server_;
 };
 
 class ServerWorld : public ::testing::Environment {
@@ -77,15 +63,15 @@ class ServerWorld : public ::testing::Environment {
   std::string refusedURL() const { return "https://127.0.0.1:" + std::to_string(refusedPort_); }
   const platform::Configuration& configuration() const { return configuration_; }
   const AdminClient& admin() const { return *admin_; }
-  const SettingsSuite& suite() const { return *suite_; }
+  platform::SettingsStore& suite() const { return *suite_; }  // the developer settings suite
 
  private:
   bool internalBuild_;
-  std::filesystem::path tempDir_;
+  std::optional<TempDir> tempDir_;
   std::unique_ptr<devserver::DevServer> server_;
   platform::Configuration configuration_;
   std::unique_ptr<AdminClient> admin_;
-  std::unique_ptr<SettingsSuite> suite_;
+  std::unique_ptr<platform::SettingsStore> suite_;
   int refusedSocket_ = -1;
   uint16_t refusedPort_ = 0;
 };

@@ -39,7 +39,7 @@ inline zlkatest::LogCapture& log() {
 [[maybe_unused]] inline const zlkatest::LogCapture& kInstalled = log();
 inline zlkatest::ServerWorld& world() { return zlkatest::ServerWorld::get(); }
 inline const zlkatest::AdminClient& admin() { return world().admin(); }
-inline const zlkatest::SettingsSuite& suite() { return world().suite(); }
+inline platform::SettingsStore& suite() { return world().suite(); }
 inline std::shared_ptr<ZLKANetwork> network() { return ZLKANetwork::sharedInstance(); }
 
 // A peer whose "com.kestro.ZLKAuthentication" entitlement has this value (nullopt: none).
@@ -157,13 +157,13 @@ class NetworkTest : public ::testing::Test {
  protected:
   void SetUp() override {
     ASSERT_NO_FATAL_FAILURE(admin().reset());
-    suite().clear();
+    std::filesystem::remove(suite().filePath());
     installSession();
     log().clear();
   }
   void TearDown() override {
     admin().clearFaults();
-    suite().clear();
+    std::filesystem::remove(suite().filePath());
   }
   // Gives the network a new closed session over these primitives.
   static void installSession(TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library()) {

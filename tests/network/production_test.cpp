@@ -1,6 +1,7 @@
 // A production device, in a process of its own because device facts are fixed once per process:
 // the shared instance's creation, which must be the first touch of it in the process, and a
 // developer settings suite that changes nothing.
+#include <fstream>
 #include <latch>
 #include <set>
 #include <thread>
@@ -50,16 +51,16 @@ TEST_F(NetworkTest, TheSuiteChangesNothing) {
   });
   for (const char* key : {ZLKAUserDefaultsKey_ForceNetworkFailure, ZLKAUserDefaultsKey_ForceTokenActivationFailure,
                           ZLKAUserDefaultsKey_ForceTokenConfirmationFailure, ZLKAUserDefaultsKey_ForceTarvexSAPFailure})
-    suite().set(key, true);
-  suite().set(ZLKAUserDefaultsKey_Server, "ut");
-  suite().set(ZLKAUserDefaultsKey_TarvexSAPServer, "maint");
-  suite().set(ZLKAUserDefaultsKey_StaticContentServer, "it");
+    suite().setObject(key, true);
+  suite().setObject(ZLKAUserDefaultsKey_Server, "ut");
+  suite().setObject(ZLKAUserDefaultsKey_TarvexSAPServer, "maint");
+  suite().setObject(ZLKAUserDefaultsKey_StaticContentServer, "it");
   for (Op op : {Op::metadata, Op::activation, Op::confirmation}) EXPECT_FALSE(run({.op = op}).error) << log().dump();
   EXPECT_EQ(log().countStartingWith("[#TokenAuth] Forcing"), 0);
-  EXPECT_EQ(admin().verified(), 3u);
+  EXPECT_EQ(admin().stat("verified"), 3u);
   for (const char* contents :
        {R"({"Server": "UT", "StaticContentServer": "custom", "TarvexSAPServer": "nowhere"})", "{ not json"}) {
-    suite().writeRaw(contents);
+    std::ofstream(suite().filePath()) << contents;
     const size_t mark = log().size();
     for (const std::string& url : {network()->_selectedAPIServer(), network()->_selectedTarvexSAPServer(),
                                    network()->_selectedStaticContentServer()})

@@ -1,7 +1,7 @@
 // parseTokenArray: a run of DER items written back to back, cut into copies of each item's whole
 // encoding. Tags are not checked; one trailing byte is ignored; anything else that does not decode
-// fails the whole blob. (That whatever parses is the input cut in order is fuzz_token_array's
-// property.)
+// fails the whole blob. That whatever parses is the input cut in order, and that no input or an
+// empty one never parses, are fuzz_token_array's property (its corpus replays as a test).
 #include "network/token_array.h"
 
 #include <gtest/gtest.h>
@@ -42,7 +42,6 @@ const Row kRows[] = {
   {"TwoTrailingBytesMustFormAnItem", sequence(4) + Bytes{0x04, 0x05}, std::nullopt},
   {"TwoTrailingBytesThatFormAnItem", sequence(4) + Bytes{0x05, 0x00}, {{6, 2}}},
   {"OneByteAlone", {0x30}, {{}}},
-  {"NoBytes", {}, std::nullopt},
   {"ItemOverrunsTheData", sequence(2) + Bytes{0x30, 0x05, 0x01, 0x02}, std::nullopt},
   {"IndefiniteLength", {0x30, 0x80, 0x00, 0x00}, std::nullopt},
   {"LongFormLengthWithoutItsByte", {0x04, 0x81}, std::nullopt},
@@ -53,17 +52,13 @@ const Row kRows[] = {
 // clang-format on
 
 TEST(ParseTokenArray, CutsTheDataIntoItsItems) {
-  EXPECT_FALSE(parseTokenArray(std::nullopt));
   for (const Row& row : kRows) {
-    std::optional<std::vector<platform::Data>> items =
-        parseTokenArray(platform::Data(row.input));  // the items outlive it
+    std::optional<std::vector<platform::Data>> items = parseTokenArray(platform::Data(row.input));
     ASSERT_EQ(items.has_value(), row.lengths.has_value()) << row.name;
     std::vector<size_t> lengths;
-    Bytes joined;
-    for (const platform::Data& item : items.value_or(std::vector<platform::Data>{})) {
-      lengths.push_back(item.length());
-      joined = joined + item.toVector();
-    }
+    Bytes joined;  // read after the input has gone: the items are copies
+    for (const platform::Data& item : items.value_or(std::vector<platform::Data>{}))
+      lengths.push_back(item.length()), joined = joined + item.toVector();
     EXPECT_EQ(lengths, row.lengths.value_or(std::vector<size_t>{})) << row.name;
     EXPECT_EQ(joined, Bytes(row.input.begin(), row.input.begin() + static_cast<long>(joined.size()))) << row.name;
   }

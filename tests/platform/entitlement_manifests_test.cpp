@@ -8,6 +8,7 @@
 
 #include <fstream>
 
+#include "common/child_process.h"
 #include "common/log_capture.h"
 
 using platform::ManifestEntry;
@@ -73,9 +74,8 @@ TEST(ManifestEntry, RefinementsOnlyNarrowTheUser) {
 }
 
 TEST(EntitlementManifests, LaterFilesWinAndIgnoredFilesAreNamedWithTheirReason) {
-  char pattern[] = "/tmp/zlka-manifests-XXXXXX";
-  ASSERT_NE(mkdtemp(pattern), nullptr);
-  const std::filesystem::path dir = pattern;
+  const zlkatest::TempDir temp;
+  const std::filesystem::path& dir = temp.path();
   const std::string me = R"({"uid": )" + std::to_string(getuid()) + R"(, "entitlements": )";
   // clang-format off
   const std::tuple<const char*, std::string, mode_t> files[] = {
@@ -102,7 +102,6 @@ TEST(EntitlementManifests, LaterFilesWinAndIgnoredFilesAreNamedWithTheirReason) 
   const auto lines = log.entries();
   ASSERT_EQ(lines.size(), 2u) << log.dump();
   for (size_t i = 0; i < 2; ++i) EXPECT_TRUE(lines[i].message.starts_with(expected[i])) << lines[i].message;
-  std::filesystem::remove_all(dir);
 }
 
 TEST(PeerIdentity, TheExecutableIsReadOnlyForTheRecordedUser) {

@@ -7,7 +7,7 @@
 #include <thread>
 
 #include "common/log_capture.h"
-#include "common/private_bus.h"
+#include "common/child_process.h"
 #include "platform/bus/handles.h"
 #include "platform/dispatch/semaphore.h"
 
@@ -27,8 +27,10 @@ std::shared_ptr<const platform::Interface> pingInterface() {
 }
 
 struct Accepting : platform::ListenerDelegate {
+  std::shared_ptr<const platform::Interface> interface;
+  explicit Accepting(std::shared_ptr<const platform::Interface> exported) : interface(std::move(exported)) {}
   bool listenerShouldAcceptNewConnection(platform::Listener&, platform::Connection& connection) override {
-    connection.setExportedInterface(pingInterface());
+    connection.setExportedInterface(interface);
     connection.resume();
     return true;
   }
@@ -48,48 +50,49 @@ bool ping(const platform::BusPtr& bus) {
   return sd_bus_call_method(bus.get(), kName, kPath, kName, "Ping", nullptr, nullptr, "") >= 0;
 }
 
-// The service listener running on a thread of its own until the scope ends.
+// The service listener on a private bus, exporting `interface` to every peer, running on a thread
+// of its own until the scope ends.
 struct RunningListener {
+  zlkatest::PrivateBus bus;
   platform::Listener& listener = platform::Listener::serviceListener();
   std::atomic<bool> ended{false};
-  std::jthread loop{[this] {
-    platform::Listener::blockSignals();
-    listener.resume();
-    ended = true;
-  }};
+  std::jthread loop;
+  RunningListener(std::shared_ptr<const platform::Interface> interface, size_t maxCallsPerPeer,
+                  std::function<platform::EntitlementLookup(const platform::PeerCredentials&)> entitlementsForPeer = {}) {
+    platform::ListenerOptions options;
+    options.bus = bus.address(), options.serviceName = kName, options.objectPath = kPath, options.notifyReady = false;
+    options.interface = interface, options.maxCallsPerPeer = maxCallsPerPeer, options.entitlementsForPeer = entitlementsForPeer;
+    platform::Listener::configure(options);
+    listener.setDelegate(std::make_shared<Accepting>(interface));
+    loop = std::jthread([this] {
+      platform::Listener::blockSignals();
+      listener.resume();
+      ended = true;
+    });
+  }
   ~RunningListener() {
     for (int i = 0; i < 3000 && !ended; ++i, std::this_thread::sleep_for(10ms))
       listener.stop();  // reaches it once started
+    loop.join();
+    listener.setDelegate(nullptr);
   }
 };
 
 }  // namespace
 
 TEST(Listener, APeerWhoseIdentityIsSlowHoldsUpNoOtherPeerAndEachPeerIsIdentifiedOnce) {
-  client_test::PrivateBus bus;
-  ASSERT_TRUE(bus.running());
   zlkatest::LogCapture log;
   platform::Semaphore release;  // bounded, so that a failing test still ends
   std::atomic<int> lookups{0};
   std::atomic<pid_t> firstPid{0};
-  platform::Listener::configure(
-      {.bus = bus.address(),
-       .serviceName = kName,
-       .objectPath = kPath,
-       .interface = pingInterface(),
-       .entitlementsForPeer = [&](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
-         if (lookups.fetch_add(1) == 0) {  // the first peer's lookup is held back until the test lets it go
-           firstPid = credentials.pid;
-           release.waitFor(30s);
-         }
-         return nullptr;
-       },
-       .onReload = {},
-       .exitOnIdle = {},
-       .notifyReady = false});
-  platform::Listener::serviceListener().setDelegate(std::make_shared<Accepting>());
-  std::optional<RunningListener> running(std::in_place);
-  platform::BusPtr slow = connect(bus.address()), quick = connect(bus.address());
+  RunningListener running(pingInterface(), 8, [&](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
+    if (lookups.fetch_add(1) == 0) {  // the first peer's lookup is held back until the test lets it go
+      firstPid = credentials.pid;
+      release.waitFor(30s);
+    }
+    return nullptr;
+  });
+  platform::BusPtr slow = connect(running.bus.address()), quick = connect(running.bus.address());
   ASSERT_TRUE(slow && quick);
   for (int i = 0;
        i < 500 && sd_bus_call_method(quick.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
@@ -113,15 +116,11 @@ TEST(Listener, APeerWhoseIdentityIsSlowHoldsUpNoOtherPeerAndEachPeerIsIdentified
   for (int i = 0; i < 500 && platform::Listener::serviceListener().connectionCount() != 1; ++i)
     std::this_thread::sleep_for(10ms);
   EXPECT_EQ(platform::Listener::serviceListener().connectionCount(), 1u);
-  running.reset();
-  platform::Listener::serviceListener().setDelegate(nullptr);
 }
 
 // A greedy peer's calls beyond the per-peer bound wait, in order, until earlier ones are answered;
 // another peer is served meanwhile, and every call is answered once.
 TEST(Listener, APeerHasAtMostItsBoundOfCallsWorkedOnAndTheRestWaitInOrder) {
-  client_test::PrivateBus bus;
-  ASSERT_TRUE(bus.running());
   std::mutex mutex;
   std::vector<platform::Reply> held;  // the calls being worked on, answered when the test says
   std::vector<int> order;
@@ -136,23 +135,8 @@ TEST(Listener, APeerHasAtMostItsBoundOfCallsWorkedOnAndTheRestWaitInOrder) {
                                  }};
   auto interface = std::make_shared<platform::Interface>(*pingInterface());
   interface->methods.push_back(hold);
-  platform::ListenerOptions options;
-  options.bus = bus.address(), options.serviceName = kName, options.objectPath = kPath, options.interface = interface;
-  options.notifyReady = false, options.maxCallsPerPeer = 3;
-  platform::Listener::configure(options);
-  struct Delegate : platform::ListenerDelegate {
-    std::shared_ptr<const platform::Interface> interface;
-    bool listenerShouldAcceptNewConnection(platform::Listener&, platform::Connection& connection) override {
-      connection.setExportedInterface(interface);
-      connection.resume();
-      return true;
-    }
-  };
-  auto delegate = std::make_shared<Delegate>();
-  delegate->interface = interface;
-  platform::Listener::serviceListener().setDelegate(delegate);
-  std::optional<RunningListener> running(std::in_place);
-  platform::BusPtr greedy = connect(bus.address()), other = connect(bus.address());
+  RunningListener running(interface, 3);
+  platform::BusPtr greedy = connect(running.bus.address()), other = connect(running.bus.address());
   ASSERT_TRUE(greedy && other);
   for (int i = 0; i < 500 && !ping(other); ++i) std::this_thread::sleep_for(10ms);
   constexpr int kCalls = 10;
@@ -186,6 +170,4 @@ TEST(Listener, APeerHasAtMostItsBoundOfCallsWorkedOnAndTheRestWaitInOrder) {
   }
   EXPECT_EQ(answered.load(), kCalls);
   EXPECT_EQ(order, (std::vector<int>{0, 1, 2, 3, 4, 5, 6, 7, 8, 9}));
-  running.reset();
-  platform::Listener::serviceListener().setDelegate(nullptr);
 }

@@ -1,11 +1,11 @@
 #include "platform/config/settings_store.h"
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <fstream>
 #include <thread>
 
+#include "common/child_process.h"
 #include "common/log_capture.h"
 
 using platform::SettingsStore;
@@ -17,10 +17,9 @@ namespace fs = std::filesystem;
 
 class SettingsStoreTest : public testing::Test {
  protected:
-  const fs::path dir = fs::temp_directory_path() / ("zlka-settings-" + std::to_string(getpid()));
+  const zlkatest::TempDir temp;
+  const fs::path dir = temp.path();
   SettingsStore store{"suite", dir};
-  void SetUp() override { fs::create_directories(dir); }
-  void TearDown() override { fs::remove_all(dir); }
 };
 
 TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {

@@ -497,15 +497,12 @@ TEST_F(SessionTest, DestructionWaitsForQueuedWorkAndMayHappenInACompletion) {
 
 TEST(SessionObjectTest, PlainInitIsForbiddenAndEachErrorCodeCarriesItsFixedDescription) {
   EXPECT_THROW(TarvexSAPSession::init(), platform::InternalInconsistencyException);
-  const std::pair<int64_t, const char*> rows[] = {{-1, "An unknown error has occurred."},
-                                                  {-2, "Tarvex is not available on this platform."},
-                                                  {-3, "An invalid parameter was provided by the caller."},
-                                                  {-4, "An internal error has occurred."},
-                                                  {-5, nullptr},
-                                                  {-6, nullptr},
-                                                  {-7, "Cannot perform this action in the current state."},
-                                                  {-8, nullptr},
-                                                  {0, nullptr}};
+  // clang-format off
+  const std::pair<int64_t, const char*> rows[] = {
+      {-1, "An unknown error has occurred."}, {-2, "Tarvex is not available on this platform."},
+      {-3, "An invalid parameter was provided by the caller."}, {-4, "An internal error has occurred."},
+      {-5, nullptr}, {-6, nullptr}, {-7, "Cannot perform this action in the current state."}, {-8, nullptr}, {0, nullptr}};
+  // clang-format on
   for (const auto& [code, text] : rows) {
     std::optional<platform::Dictionary> info;
     if (text) info = platform::Dictionary{{platform::LocalizedDescriptionKey, Value(text)}};

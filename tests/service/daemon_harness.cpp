@@ -25,7 +25,6 @@ Harness::Harness(bool anyUser) : bus_(anyUser) {
 
 Harness::~Harness() {
   if (daemon_) daemon_->signal(SIGTERM), daemon_->waitExit(std::chrono::seconds(30));  // a graceful end keeps its coverage data
-  if (notifySocket_ >= 0) ::close(notifySocket_);
 }
 
 void Harness::writeManifest(const std::string& name, const std::string& executable, const platform::Value& value) const {
@@ -36,11 +35,11 @@ void Harness::writeManifest(const std::string& name, const std::string& executab
 
 bool Harness::startDaemon(const std::vector<std::string>& extraArguments, const std::vector<std::string>& launcher) {
   auto socketPath = directory() / "notify.sock";
-  notifySocket_ = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  notifySocket_.reset(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   std::snprintf(address.sun_path, sizeof address.sun_path, "%s", socketPath.c_str());
-  if (::bind(notifySocket_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return false;
+  if (::bind(notifySocket_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return false;
   std::filesystem::permissions(socketPath, std::filesystem::perms(0666));  // a daemon of any user may notify
   std::vector<std::string> argv = launcher;
   argv.insert(argv.end(), {ZLKAD_PATH, "--config", (stateDirectory() / "zlkad.toml").string(), "--bus", busAddress(), "--log",
@@ -48,9 +47,9 @@ bool Harness::startDaemon(const std::vector<std::string>& extraArguments, const 
   argv.insert(argv.end(), extraArguments.begin(), extraArguments.end());
   daemon_ = std::make_unique<zlkatest::ChildProcess>(argv, directory(), std::vector<std::string>{"NOTIFY_SOCKET=" + socketPath.string()});
   // READY=1 comes once the daemon owns its name; a daemon that dies first never sends it.
-  pollfd p{notifySocket_, POLLIN, 0};
+  pollfd p{notifySocket_.get(), POLLIN, 0};
   char buffer[512];
-  for (ssize_t n; ::poll(&p, 1, 30000) > 0 && (n = ::recv(notifySocket_, buffer, sizeof buffer, 0)) > 0;)
+  for (ssize_t n; ::poll(&p, 1, 30000) > 0 && (n = ::recv(notifySocket_.get(), buffer, sizeof buffer, 0)) > 0;)
     if (std::string_view(buffer, static_cast<size_t>(n)).find("READY=1") != std::string_view::npos) return true;
   return false;
 }

@@ -10,9 +10,10 @@
 
 #include "client/zlka_client.h"
 #include "common/child_process.h"
-#include "common/private_bus.h"
+#include "common/child_process.h"
 #include "common/server_world.h"
 #include "devserver/dev_server.h"
+#include "platform/bus/handles.h"
 
 namespace service_test {
 
@@ -28,7 +29,7 @@ class Harness {
   std::filesystem::path stateDirectory() const { return directory() / "state"; }  // zlkad.toml, ca.pem, entitlements.d, defaults
   const std::string& busAddress() const { return bus_.address(); }
   devserver::DevServer& server() { return *server_; }
-  zlkatest::AdminClient admin() const { return {server_->port(), stateDirectory() / "ca.pem"}; }
+  zlkatest::AdminClient admin() const { return zlkatest::AdminClient(*server_); }
   zlkatest::ChildProcess* daemon() { return daemon_.get(); }
 
   // A manifest that gives `executable`, run by this process's user, the entitlement value.
@@ -42,10 +43,10 @@ class Harness {
 
  private:
   zlkatest::TempDir directory_;
-  client_test::PrivateBus bus_;
+  zlkatest::PrivateBus bus_;
   std::unique_ptr<devserver::DevServer> server_;
   std::unique_ptr<zlkatest::ChildProcess> daemon_;
-  int notifySocket_ = -1;
+  platform::UniqueFd notifySocket_;
 };
 
 // The token an accessory would hold: two DER items back to back.

@@ -76,10 +76,8 @@ TEST(StateDirectory, IsMadePrivateOnceAndThenReused) {
   const fs::path dir = parent.path() / "nested" / "state";
   auto contents = [&dir] {
     std::string all;
-    for (const char* name : {"ca.pem", "ca.key", "server.pem", "server.key", "sap-root.pem", "sap-root.key", "setup.crt", "setup.key"}) {
-      std::ifstream in(dir / name, std::ios::binary);
-      all += "|" + std::string(std::istreambuf_iterator<char>(in), {});
-    }
+    for (const char* name : {"ca.pem", "ca.key", "server.pem", "server.key", "sap-root.pem", "sap-root.key", "setup.crt", "setup.key"})
+      all += "|" + zlkatest::readFile(dir / name);
     return all;
   };
   auto mode = [](const fs::path& p) { struct stat s{}; return ::stat(p.c_str(), &s) == 0 ? s.st_mode & 07777 : 0; };
@@ -139,8 +137,7 @@ TEST(DevServer, TheProgramServesUntilSIGTERMAndRefusesBadArguments) {
   client.enable_server_certificate_verification(true);
   auto certificate = client.Get("/deviceservices/setup.crt");
   ASSERT_TRUE(certificate);
-  std::ifstream in(state / "setup.crt", std::ios::binary);
-  EXPECT_EQ(certificate->body, std::string(std::istreambuf_iterator<char>(in), {}));
+  EXPECT_EQ(certificate->body, zlkatest::readFile(state / "setup.crt"));
   program.signal(SIGTERM);
   EXPECT_EQ(program.waitExit(std::chrono::seconds(30)), 0);
   EXPECT_TRUE(std::regex_search(program.standardError(), std::regex("GET /deviceservices/setup.crt 200 [0-9.]+ ms\n")));
