@@ -86,9 +86,12 @@ const Bytes& buffer(Buffer which) {
   static const Bytes large = fewLargeItems();
   static const Bytes token = tokenBlob();
   switch (which) {
-    case Buffer::kManySmall: return small;
-    case Buffer::kFewLarge: return large;
-    case Buffer::kTokenBlob: return token;
+    case Buffer::kManySmall:
+      return small;
+    case Buffer::kFewLarge:
+      return large;
+    case Buffer::kTokenBlob:
+      return token;
   }
   return token;
 }
@@ -221,22 +224,20 @@ const DERFieldSpec kTokenRecordFields[] = {
     {offsetof(TokenRecord, payload), DER_TAG_OCTET_STRING, 0},
     {offsetof(TokenRecord, signature), DER_TAG_BIT_STRING, 0},
 };
-constexpr std::uint16_t kTokenRecordFieldCount =
-    sizeof kTokenRecordFields / sizeof kTokenRecordFields[0];
+constexpr std::uint16_t kTokenRecordFieldCount = sizeof kTokenRecordFields / sizeof kTokenRecordFields[0];
 
 // Fills a record from the first SEQUENCE of the token blob by a template.
 void BM_ParseSequenceTemplate(benchmark::State& state) {
   const Bytes& in = buffer(Buffer::kTokenBlob);
   const DERSlice input{in.data(), in.size()};
   TokenRecord record;
-  if (DERParseSequence(input, kTokenRecordFieldCount, kTokenRecordFields, &record,
-                       sizeof record) != DER_STATUS_OK) {
+  if (DERParseSequence(input, kTokenRecordFieldCount, kTokenRecordFields, &record, sizeof record) != DER_STATUS_OK) {
     state.SkipWithError("template does not fit the record");
     return;
   }
   for (auto _ : state) {
-    benchmark::DoNotOptimize(DERParseSequence(input, kTokenRecordFieldCount, kTokenRecordFields,
-                                              &record, sizeof record));
+    benchmark::DoNotOptimize(
+        DERParseSequence(input, kTokenRecordFieldCount, kTokenRecordFields, &record, sizeof record));
     benchmark::DoNotOptimize(record);
   }
 }

@@ -11,8 +11,8 @@
 #include <stdexcept>
 #include <string>
 
-#include "platform/log/log.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/log/log.h"
 #include "sap/tarvex_sap_session.h"
 #include "tarvexsap/tarvex_sap.h"
 #include "tarvexsap/tarvex_sap_certs.h"
@@ -122,7 +122,8 @@ void BM_RoundTripBarePrimitives(benchmark::State& state) {
   auto info = f.server->handshake(kSessionId, {out, outLength}, std::chrono::hours(1));
   std::free(out);
   out = nullptr;
-  if (TarvexSAPExchange(200, &hw, context, info.sessionInfo.data(), info.sessionInfo.size(), &out, &outLength, &rc) != 0)
+  if (TarvexSAPExchange(200, &hw, context, info.sessionInfo.data(), info.sessionInfo.size(), &out, &outLength, &rc) !=
+      0)
     throw std::runtime_error("session info");
   std::free(out);
 

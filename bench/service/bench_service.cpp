@@ -22,8 +22,8 @@
 
 #include "../network/curl_device.h"
 #include "client/zlka_client.h"
-#include "platform/values/base64.h"
 #include "platform/bus/handles.h"
+#include "platform/values/base64.h"
 #include "service/daemon_harness.h"
 #include "tarvexsap/tarvex_sap.h"
 

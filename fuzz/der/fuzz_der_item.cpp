@@ -41,8 +41,7 @@ std::size_t significantBytes(std::uint64_t value) {
   return n;
 }
 
-void checkHeader(const std::uint8_t* data, std::size_t size, const DERDecodedItem& item,
-                 std::uint64_t declared) {
+void checkHeader(const std::uint8_t* data, std::size_t size, const DERDecodedItem& item, std::uint64_t declared) {
   const std::uint8_t* contentStart = item.content.data;
   FUZZ_CHECK(contentStart >= data + 2 && contentStart <= data + size);
   const auto headerLength = static_cast<std::size_t>(contentStart - data);
@@ -99,8 +98,7 @@ void checkItem(const std::uint8_t* data, std::size_t size) {
 
   FUZZ_CHECK(same(clipped, strict));
   // The item needs every one of its bytes and nothing after them.
-  const auto itemLength =
-      static_cast<std::uint64_t>(strict.content.data + strict.content.length - data);
+  const auto itemLength = static_cast<std::uint64_t>(strict.content.data + strict.content.length - data);
   FUZZ_CHECK(DERDecodeItem(DERSlice{data, itemLength}, &other) == DER_STATUS_OK);
   FUZZ_CHECK(same(other, strict));
   FUZZ_CHECK(DERDecodeItem(DERSlice{data, itemLength - 1}, &other) == DER_STATUS_DECODE_ERROR);

@@ -32,8 +32,7 @@ void checkPrimitives(DERSlice content) {
 
   std::uint64_t wide = 0;
   const DERStatus status64 = DERParseInteger64(content, &wide);
-  FUZZ_CHECK(status64 == DER_STATUS_OK || status64 == DER_STATUS_DECODE_ERROR ||
-             status64 == DER_STATUS_OVERFLOW);
+  FUZZ_CHECK(status64 == DER_STATUS_OK || status64 == DER_STATUS_DECODE_ERROR || status64 == DER_STATUS_OVERFLOW);
   if (status64 == DER_STATUS_OK) {
     // The content must be the minimal unsigned encoding of the value.
     std::uint8_t encoding[9];
@@ -61,12 +60,12 @@ void checkPrimitives(DERSlice content) {
   std::uint8_t unused = 0;
   FUZZ_CHECK(DERParseBitString(content, &bits, &unused) == DER_STATUS_OK);
   if (content.length > 1) {
-    FUZZ_CHECK(unused == content.data[0] && bits.data == content.data + 1 &&
-               bits.length == content.length - 1);
+    FUZZ_CHECK(unused == content.data[0] && bits.data == content.data + 1 && bits.length == content.length - 1);
   } else {
     FUZZ_CHECK(unused == 0 && bits.data == nullptr && bits.length == 0);
   }
-}}  // namespace
+}
+}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   checkPrimitives(DERSlice{data, size});

@@ -56,8 +56,7 @@ DERStatus expectedStatus(const Walk& w, std::size_t fieldCount, const DERFieldSp
   std::size_t field = 0;
   for (std::size_t i = 0; i < w.items.size(); ++i) {
     const DERTag tag = w.items[i].item.tag;
-    while (field < fieldCount && (fields[field].options & DER_FIELD_SKIP_TAG_CHECK) == 0 &&
-           fields[field].tag != tag) {
+    while (field < fieldCount && (fields[field].options & DER_FIELD_SKIP_TAG_CHECK) == 0 && fields[field].tag != tag) {
       if ((fields[field].options & DER_FIELD_OPTIONAL) == 0) return DER_STATUS_UNEXPECTED_TAG;
       ++field;
     }
@@ -75,12 +74,10 @@ DERStatus expectedStatus(const Walk& w, std::size_t fieldCount, const DERFieldSp
   return DER_STATUS_OK;
 }
 
-bool equal(const DERSlice& a, const DERSlice& b) {
-  return a.data == b.data && a.length == b.length;
-}
+bool equal(const DERSlice& a, const DERSlice& b) { return a.data == b.data && a.length == b.length; }
 
-void checkTemplate(DERSlice content, std::size_t fieldCount, const DERFieldSpec* fields,
-                   const DERSlice* record, DERStatus status) {
+void checkTemplate(DERSlice content, std::size_t fieldCount, const DERFieldSpec* fields, const DERSlice* record,
+                   DERStatus status) {
   if (fieldCount == 0) {
     FUZZ_CHECK(status == (content.length == 0 ? DER_STATUS_OK : DER_STATUS_DECODE_ERROR));
     return;
@@ -108,8 +105,7 @@ void checkTemplate(DERSlice content, std::size_t fieldCount, const DERFieldSpec*
 // A fixed template that uses every option: [0] kept whole, an optional BOOLEAN, anything
 // (not written), an optional INTEGER that is not written, an optional OCTET STRING kept whole.
 const DERFieldSpec kFixedFields[] = {
-    {0 * sizeof(DERSlice), DER_TAG_CLASS_CONTEXT_SPECIFIC | DER_TAG_CONSTRUCTED | 0,
-     DER_FIELD_KEEP_HEADER},
+    {0 * sizeof(DERSlice), DER_TAG_CLASS_CONTEXT_SPECIFIC | DER_TAG_CONSTRUCTED | 0, DER_FIELD_KEEP_HEADER},
     {1 * sizeof(DERSlice), DER_TAG_BOOLEAN, DER_FIELD_OPTIONAL},
     {2 * sizeof(DERSlice), 0, DER_FIELD_SKIP_TAG_CHECK | DER_FIELD_SKIP_WRITE},
     {3 * sizeof(DERSlice), DER_TAG_INTEGER, DER_FIELD_OPTIONAL | DER_FIELD_SKIP_WRITE},

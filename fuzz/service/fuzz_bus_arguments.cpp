@@ -94,21 +94,29 @@ Value appendBasic(sd_bus_message* m, char type, FuzzedDataProvider& in) {
     return Value(v);
   };
   switch (type) {
-    case 'y': return put(in.ConsumeIntegral<uint8_t>());
-    case 'n': return put(in.ConsumeIntegral<int16_t>());
-    case 'q': return put(in.ConsumeIntegral<uint16_t>());
-    case 'i': return put(in.ConsumeIntegral<int32_t>());
-    case 'u': return put(in.ConsumeIntegral<uint32_t>());
-    case 'x': return put(in.ConsumeIntegral<int64_t>());
-    case 't': return put(in.ConsumeIntegral<uint64_t>());
-    case 'd': return put(static_cast<double>(in.ConsumeIntegral<int32_t>()) / 8);
+    case 'y':
+      return put(in.ConsumeIntegral<uint8_t>());
+    case 'n':
+      return put(in.ConsumeIntegral<int16_t>());
+    case 'q':
+      return put(in.ConsumeIntegral<uint16_t>());
+    case 'i':
+      return put(in.ConsumeIntegral<int32_t>());
+    case 'u':
+      return put(in.ConsumeIntegral<uint32_t>());
+    case 'x':
+      return put(in.ConsumeIntegral<int64_t>());
+    case 't':
+      return put(in.ConsumeIntegral<uint64_t>());
+    case 'd':
+      return put(static_cast<double>(in.ConsumeIntegral<int32_t>()) / 8);
     case 'b': {
       int b = in.ConsumeBool();
       CHECK(sd_bus_message_append_basic(m, 'b', &b) >= 0);
       return Value(b != 0);
     }
     default: {
-      std::string s = type == 'o' ? "/p" + std::to_string(in.ConsumeIntegral<uint8_t>())
+      std::string s = type == 'o'   ? "/p" + std::to_string(in.ConsumeIntegral<uint8_t>())
                       : type == 'g' ? signature(in, kMaximumDepth - 1)
                                     : busString(in);
       CHECK(sd_bus_message_append_basic(m, type, s.c_str()) >= 0);
@@ -207,12 +215,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   bool acceptable = true;
   std::set<std::string> keys;
   for (size_t n = in.ConsumeIntegralInRange(0, 5); n > 0; --n) {
-    std::string key = in.ConsumeBool() ? busString(in)
-                                       : in.PickValueInArray({"token", "uuid", "requestedLocale", "requestInfo"});
+    std::string key =
+        in.ConsumeBool() ? busString(in) : in.PickValueInArray({"token", "uuid", "requestedLocale", "requestInfo"});
     auto wanted = takes.find(key);
     std::string sig = wanted != takes.end() && in.ConsumeBool() ? wanted->second : signature(in, 0);
     acceptable = acceptable && wanted != takes.end() && wanted->second == sig && keys.insert(key).second;
-    CHECK(sd_bus_message_open_container(raw, 'e', "sv") >= 0 && sd_bus_message_append_basic(raw, 's', key.c_str()) >= 0 &&
+    CHECK(sd_bus_message_open_container(raw, 'e', "sv") >= 0 &&
+          sd_bus_message_append_basic(raw, 's', key.c_str()) >= 0 &&
           sd_bus_message_open_container(raw, 'v', sig.c_str()) >= 0);
     if (key == "token" && sig == "ay" && in.ConsumeBool()) {
       // A token at and past its bound, in place of a short one.

@@ -17,7 +17,9 @@ platform::Error cancelled() {
 
 int openBus(const std::string& where, platform::BusPtr& bus) {
   sd_bus* made = nullptr;
-  int r = where == "system" ? sd_bus_open_system(&made) : where == "session" ? sd_bus_open_user(&made) : sd_bus_new(&made);
+  int r = where == "system"    ? sd_bus_open_system(&made)
+          : where == "session" ? sd_bus_open_user(&made)
+                               : sd_bus_new(&made);
   bus.reset(made);
   if (r < 0 || where == "system" || where == "session") return r;
   if ((r = sd_bus_set_address(made, where.c_str())) < 0) return r;
@@ -44,13 +46,15 @@ Result<std::shared_ptr<BusCaller>> BusCaller::open(const std::string& where, std
   if (r >= 0) r = sd_bus_get_unique_name(bus.get(), &unique);
   if (r < 0) {
     // sd-bus says "No medium found" when it has no address for the session bus at all.
-    std::string reason = where == "session" && r == -ENOMEDIUM ? "no session bus (DBUS_SESSION_BUS_ADDRESS and XDG_RUNTIME_DIR are unset)"
-                                                              : std::strerror(-r);
+    std::string reason = where == "session" && r == -ENOMEDIUM
+                             ? "no session bus (DBUS_SESSION_BUS_ADDRESS and XDG_RUNTIME_DIR are unset)"
+                             : std::strerror(-r);
     return clientError(ClientErrorCode::ConnectionFailed, "Cannot connect to " + busLabel(where) + ": " + reason + ".");
   }
   std::shared_ptr<BusCaller> caller(new BusCaller(std::move(bus), callTimeout));
   if ((r = caller->start()) < 0)
-    return clientError(ClientErrorCode::ConnectionFailed, std::string("Cannot start the client's event loop: ") + std::strerror(-r) + ".");
+    return clientError(ClientErrorCode::ConnectionFailed,
+                       std::string("Cannot start the client's event loop: ") + std::strerror(-r) + ".");
   caller->thread_ = std::thread([self = caller] { self->run(); });
   caller->threadId_ = caller->thread_.get_id();
   return caller;
@@ -167,7 +171,8 @@ void BusCaller::sendAndWait(const std::string& method, const ArgumentWriter& wri
   platform::BusMessagePtr reply(answer);
   if (r < 0) {
     const sd_bus_error& e = busError.error;
-    platform::Error error = sd_bus_error_is_set(&e) ? errorFromBusError(e.name, e.message ? e.message : "") : errorFromSendFailure(r);
+    platform::Error error =
+        sd_bus_error_is_set(&e) ? errorFromBusError(e.name, e.message ? e.message : "") : errorFromSendFailure(r);
     return handler(nullptr, &error);
   }
   handler(reply.get(), nullptr);
@@ -211,8 +216,10 @@ void BusCaller::finish() {
 
 void BusCaller::close() {
   if (!mailbox_.close() || !thread_.joinable()) return;
-  if (onEventThread()) thread_.detach();
-  else thread_.join();
+  if (onEventThread())
+    thread_.detach();
+  else
+    thread_.join();
 }
 
 }  // namespace zlka_client

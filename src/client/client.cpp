@@ -23,7 +23,9 @@ std::optional<platform::Data> toData(const std::optional<Bytes>& bytes) {
   return platform::Data(bytes->data(), bytes->size());
 }
 
-zlka_client::TokenArguments toInternal(const TokenArguments& arguments) { return {toData(arguments.token), arguments.uuid}; }
+zlka_client::TokenArguments toInternal(const TokenArguments& arguments) {
+  return {toData(arguments.token), arguments.uuid};
+}
 
 // The request info travels as a{sv}: its JSON text is read here so that a mistake in it is an
 // InvalidRequest before anything reaches the bus.
@@ -34,7 +36,8 @@ zlka_client::Result<zlka_client::MetadataArguments> toInternal(const MetadataArg
   std::optional<platform::Value> info = platform::json::parse(*arguments.requestInfoJSON, &problem);
   if (!info || !info->dictionary()) {
     std::string reason = info ? "an array" : "not JSON (" + problem + ")";
-    return zlka_client::clientError(ClientErrorCode::InvalidRequest, "Cannot send the call: requestInfo is " + reason + ", not a JSON object.");
+    return zlka_client::clientError(ClientErrorCode::InvalidRequest,
+                                    "Cannot send the call: requestInfo is " + reason + ", not a JSON object.");
   }
   out.requestInfo = *info->dictionary();
   return out;
@@ -43,7 +46,8 @@ zlka_client::Result<zlka_client::MetadataArguments> toInternal(const MetadataArg
 Result<Metadata> toPublic(const zlka_client::Result<zlka_client::MetadataReply>& reply) {
   if (!reply) return toPublic(reply.error());
   // The decoder accepted it as JSON, so it serialises again.
-  return Metadata{reply.value().ppid, reply.value().locale, platform::json::serialize(reply.value().metadata).value_or("{}")};
+  return Metadata{reply.value().ppid, reply.value().locale,
+                  platform::json::serialize(reply.value().metadata).value_or("{}")};
 }
 
 Result<Bytes> toPublic(const zlka_client::Result<platform::Data>& reply) {
@@ -104,7 +108,8 @@ Result<Confirmation> Client::confirmActivation(const TokenArguments& arguments) 
 }
 
 void Client::confirmActivationAsync(const TokenArguments& arguments, Callback<Confirmation> callback) {
-  impl_->client->confirmActivationAsync(toInternal(arguments), translated<Confirmation, zlka_client::Confirmation>(std::move(callback)));
+  impl_->client->confirmActivationAsync(toInternal(arguments),
+                                        translated<Confirmation, zlka_client::Confirmation>(std::move(callback)));
 }
 
 }  // namespace zlka

@@ -23,8 +23,8 @@ bool meansUnreachable(std::string_view name) {
 }
 
 int64_t operationCode(std::string_view name) {
-  static constexpr std::string_view names[] = {"Unknown", "MissingEntitlement", "InvalidParameter",
-                                               "Internal", "Network", "Server"};
+  static constexpr std::string_view names[] = {
+      "Unknown", "MissingEntitlement", "InvalidParameter", "Internal", "Network", "Server"};
   for (int64_t i = 0; i < 6; ++i)
     if (name == names[i]) return -(i + 1);
   return 0;
@@ -49,13 +49,15 @@ platform::Error errorFromBusError(std::string_view name, std::string_view messag
   }
   bool unreachable = meansUnreachable(name);
   std::string detail = std::string(name) + (message.empty() ? "" : ": " + std::string(message));
-  std::string description = unreachable ? "The service " + std::string(kServiceName) + " cannot be reached (" + detail + ")."
-                                        : "The call was refused with " + detail;
-  return platform::Error(kClientErrorDomain,
-                         static_cast<int64_t>(unreachable ? ClientErrorCode::ServiceUnavailable : ClientErrorCode::Refused),
-                         platform::Dictionary{{platform::LocalizedDescriptionKey, std::move(description)},
-                                              {kBusErrorNameKey, std::string(name)},
-                                              {kBusErrorMessageKey, std::string(message)}});
+  std::string description = unreachable
+                                ? "The service " + std::string(kServiceName) + " cannot be reached (" + detail + ")."
+                                : "The call was refused with " + detail;
+  return platform::Error(
+      kClientErrorDomain,
+      static_cast<int64_t>(unreachable ? ClientErrorCode::ServiceUnavailable : ClientErrorCode::Refused),
+      platform::Dictionary{{platform::LocalizedDescriptionKey, std::move(description)},
+                           {kBusErrorNameKey, std::string(name)},
+                           {kBusErrorMessageKey, std::string(message)}});
 }
 
 platform::Error errorFromSendFailure(int negativeErrno) {
@@ -73,8 +75,9 @@ platform::Error errorFromSendFailure(int negativeErrno) {
 }
 
 bool isServiceUnreachable(const platform::Error& error) {
-  return error.domain() == kClientErrorDomain && (error.code() == static_cast<int64_t>(ClientErrorCode::ConnectionFailed) ||
-                                                  error.code() == static_cast<int64_t>(ClientErrorCode::ServiceUnavailable));
+  return error.domain() == kClientErrorDomain &&
+         (error.code() == static_cast<int64_t>(ClientErrorCode::ConnectionFailed) ||
+          error.code() == static_cast<int64_t>(ClientErrorCode::ServiceUnavailable));
 }
 
 }  // namespace zlka_client

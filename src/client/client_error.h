@@ -19,9 +19,9 @@
 namespace zlka_client {
 
 // One definition with the public header, which states them to applications.
+using zlka::ClientErrorCode;
 using zlka::kClientErrorDomain;
 using zlka::kOperationErrorDomain;
-using zlka::ClientErrorCode;
 
 // User-info keys of client errors made from a D-Bus error.
 inline constexpr char kBusErrorNameKey[] = "DBusErrorName";

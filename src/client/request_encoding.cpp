@@ -62,7 +62,8 @@ int appendStringEntry(sd_bus_message* m, const char* key, const std::optional<st
   return r < 0 ? r : closeEntry(m);
 }
 
-int appendCommon(sd_bus_message* m, const std::optional<platform::Data>& token, const std::optional<std::string>& uuid) {
+int appendCommon(sd_bus_message* m, const std::optional<platform::Data>& token,
+                 const std::optional<std::string>& uuid) {
   int r = 0;
   if (token) {
     r = openEntry(m, "token", "ay");
@@ -86,7 +87,9 @@ std::optional<std::string> unsendableReason(const platform::Value& value, const 
   return checkValue(value, path, 1);
 }
 
-std::optional<std::string> unsendableReason(const TokenArguments& arguments) { return checkString(arguments.uuid, "uuid"); }
+std::optional<std::string> unsendableReason(const TokenArguments& arguments) {
+  return checkString(arguments.uuid, "uuid");
+}
 
 std::optional<std::string> unsendableReason(const MetadataArguments& arguments) {
   if (auto reason = checkString(arguments.uuid, "uuid")) return reason;

@@ -13,11 +13,14 @@ template <class T>
 using Decoder = Result<T> (*)(sd_bus_message*);
 
 template <class T>
-Result<T> callAndWait(BusCaller& caller, const std::string& method, const BusCaller::ArgumentWriter& write, Decoder<T> decode) {
+Result<T> callAndWait(BusCaller& caller, const std::string& method, const BusCaller::ArgumentWriter& write,
+                      Decoder<T> decode) {
   std::optional<Result<T>> answer;
   caller.callAndWait(method, write, [&](sd_bus_message* reply, const platform::Error* error) {
-    if (error) answer.emplace(*error);
-    else answer.emplace(decode(reply));
+    if (error)
+      answer.emplace(*error);
+    else
+      answer.emplace(decode(reply));
   });
   return std::move(*answer);
 }
@@ -27,8 +30,10 @@ Result<T> callAndWait(BusCaller& caller, const std::string& method, const BusCal
 template <class T>
 BusCaller::ReplyHandler handlerFor(std::function<void(Result<T>)> callback, Decoder<T> decode) {
   return [callback = std::move(callback), decode](sd_bus_message* reply, const platform::Error* error) {
-    if (error) callback(Result<T>(*error));
-    else callback(decode(reply));
+    if (error)
+      callback(Result<T>(*error));
+    else
+      callback(decode(reply));
   };
 }
 
@@ -39,7 +44,8 @@ BusCaller::ArgumentWriter writerFor(const Arguments& arguments) {
 
 template <class Arguments>
 std::optional<platform::Error> refusal(const Arguments& arguments) {
-  if (auto reason = unsendableReason(arguments)) return clientError(ClientErrorCode::InvalidRequest, "Cannot send the call: " + *reason + ".");
+  if (auto reason = unsendableReason(arguments))
+    return clientError(ClientErrorCode::InvalidRequest, "Cannot send the call: " + *reason + ".");
   return std::nullopt;
 }
 

@@ -13,8 +13,7 @@ constexpr std::uint8_t kHighTagNumber = 0x1F;
 constexpr std::uint64_t kTopSevenBits = 0xFE00000000000000ULL;
 constexpr std::uint64_t kClassAndConstructedBits = 0xE000000000000000ULL;
 
-DERStatus decodeItem(DERSlice input, DERDecodedItem* item, LengthMode mode,
-                     std::uint64_t* declaredLength) {
+DERStatus decodeItem(DERSlice input, DERDecodedItem* item, LengthMode mode, std::uint64_t* declaredLength) {
   if (input.length < 2) return DER_STATUS_DECODE_ERROR;
   // `remaining` always counts the input bytes from `p` on, so every read is checked against it.
   const std::uint8_t* p = input.data;
@@ -57,9 +56,13 @@ DERStatus decodeItem(DERSlice input, DERDecodedItem* item, LengthMode mode,
   std::uint64_t contentLength = length;
   if (length > remaining) {
     switch (mode) {
-      case LengthMode::kStrict: return DER_STATUS_DECODE_ERROR;
-      case LengthMode::kClip: contentLength = remaining; break;
-      case LengthMode::kUnclip: break;
+      case LengthMode::kStrict:
+        return DER_STATUS_DECODE_ERROR;
+      case LengthMode::kClip:
+        contentLength = remaining;
+        break;
+      case LengthMode::kUnclip:
+        break;
     }
   }
   item->tag = tag;
@@ -74,8 +77,7 @@ DERStatus DERDecodeItem(DERSlice input, DERDecodedItem* item) {
   return decodeItem(input, item, LengthMode::kStrict, nullptr);
 }
 
-DERStatus DERDecodeItemPartialBufferGetLength(DERSlice input, DERDecodedItem* item,
-                                              std::uint64_t* declaredLength) {
+DERStatus DERDecodeItemPartialBufferGetLength(DERSlice input, DERDecodedItem* item, std::uint64_t* declaredLength) {
   const LengthMode mode = declaredLength != nullptr ? LengthMode::kClip : LengthMode::kStrict;
   return decodeItem(input, item, mode, declaredLength);
 }

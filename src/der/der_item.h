@@ -17,8 +17,7 @@ DERStatus DERDecodeItem(DERSlice input, DERDecodedItem* item);
 // As DERDecodeItem when `declaredLength` is null. When it is given, an item whose content runs
 // past the input is accepted: the content is clipped to the bytes available and
 // *declaredLength receives the length the item declares.
-DERStatus DERDecodeItemPartialBufferGetLength(DERSlice input, DERDecodedItem* item,
-                                              std::uint64_t* declaredLength);
+DERStatus DERDecodeItemPartialBufferGetLength(DERSlice input, DERDecodedItem* item, std::uint64_t* declaredLength);
 
 // As DERDecodeItem when `allowPartial` is false. When it is true, an item whose content runs
 // past the input is accepted and its content reported with the declared, unclipped length: the

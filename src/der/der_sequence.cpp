@@ -52,8 +52,8 @@ DERStatus DERDecodeSeqNext(DERSeqCursor* cursor, DERDecodedItem* item) {
   return DER_STATUS_OK;
 }
 
-DERStatus DERParseSequence(DERSlice input, std::uint16_t fieldCount, const DERFieldSpec* fields,
-                           void* dest, std::uint64_t destSize) {
+DERStatus DERParseSequence(DERSlice input, std::uint16_t fieldCount, const DERFieldSpec* fields, void* dest,
+                           std::uint64_t destSize) {
   DERDecodedItem sequence;
   if (const DERStatus status = DERDecodeItem(input, &sequence); status != DER_STATUS_OK) {
     return status;
@@ -62,8 +62,8 @@ DERStatus DERParseSequence(DERSlice input, std::uint16_t fieldCount, const DERFi
   return DERParseSequenceContent(sequence.content, fieldCount, fields, dest, destSize);
 }
 
-DERStatus DERParseSequenceContent(DERSlice content, std::uint16_t fieldCount,
-                                  const DERFieldSpec* fields, void* dest, std::uint64_t destSize) {
+DERStatus DERParseSequenceContent(DERSlice content, std::uint16_t fieldCount, const DERFieldSpec* fields, void* dest,
+                                  std::uint64_t destSize) {
   if (destSize != 0) {
     std::memset(dest, 0, destSize);
     if (!rowsFit(fieldCount, fields, destSize)) return DER_STATUS_DECODE_ERROR;

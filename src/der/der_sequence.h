@@ -22,8 +22,8 @@ DERStatus DERDecodeSeqNext(DERSeqCursor* cursor, DERDecodedItem* item);
 // Decodes one item that must be exactly a constructed SEQUENCE (a SET is refused with
 // DER_STATUS_UNEXPECTED_TAG) and parses its content by DERParseSequenceContent. Bytes after the
 // sequence are ignored; `dest` is untouched when the sequence itself does not decode.
-DERStatus DERParseSequence(DERSlice input, std::uint16_t fieldCount, const DERFieldSpec* fields,
-                           void* dest, std::uint64_t destSize);
+DERStatus DERParseSequence(DERSlice input, std::uint16_t fieldCount, const DERFieldSpec* fields, void* dest,
+                           std::uint64_t destSize);
 
 // Parses the items of a sequence's content against `fieldCount` template rows, writing a
 // DERSlice (the item's content, or with DER_FIELD_KEEP_HEADER the whole item) at each matched
@@ -36,5 +36,5 @@ DERStatus DERParseSequence(DERSlice input, std::uint16_t fieldCount, const DERFi
 // - Every item must match a row (else DER_STATUS_UNEXPECTED_TAG), no bytes may follow the item
 //   that matches the last row (else DER_STATUS_DECODE_ERROR), and the content may end only where
 //   all remaining rows are optional (else DER_STATUS_INCOMPLETE_SEQUENCE).
-DERStatus DERParseSequenceContent(DERSlice content, std::uint16_t fieldCount,
-                                  const DERFieldSpec* fields, void* dest, std::uint64_t destSize);
+DERStatus DERParseSequenceContent(DERSlice content, std::uint16_t fieldCount, const DERFieldSpec* fields, void* dest,
+                                  std::uint64_t destSize);

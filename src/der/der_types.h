@@ -8,11 +8,11 @@
 // Result of every decoder function. 4 and 6 are reserved and never returned.
 enum DERStatus : std::uint32_t {
   DER_STATUS_OK = 0,
-  DER_STATUS_END_OF_SEQUENCE = 1,     // no more items (DERDecodeSeqNext only)
-  DER_STATUS_UNEXPECTED_TAG = 2,      // an item's tag is not one the caller allowed
-  DER_STATUS_DECODE_ERROR = 3,        // malformed, longer than the buffer, or bytes left over
-  DER_STATUS_INCOMPLETE_SEQUENCE = 5, // a sequence ended before a required template field
-  DER_STATUS_OVERFLOW = 7,            // an integer does not fit the requested width
+  DER_STATUS_END_OF_SEQUENCE = 1,      // no more items (DERDecodeSeqNext only)
+  DER_STATUS_UNEXPECTED_TAG = 2,       // an item's tag is not one the caller allowed
+  DER_STATUS_DECODE_ERROR = 3,         // malformed, longer than the buffer, or bytes left over
+  DER_STATUS_INCOMPLETE_SEQUENCE = 5,  // a sequence ended before a required template field
+  DER_STATUS_OVERFLOW = 7,             // an integer does not fit the requested width
 };
 
 // A borrowed byte range.

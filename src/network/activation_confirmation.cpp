@@ -9,7 +9,8 @@ using platform::LogLevel;
 
 void ZLKANetwork::confirmActivationForToken(const std::optional<Data>& token, const std::optional<std::string>& uuid,
                                             ZLKAConfirmationReply reply) {
-  platform::log(LogLevel::Default, "[#TokenAuth] Confirming activation for token: %{private}@ (token.length: %lu, uuid: %{private}@)",
+  platform::log(LogLevel::Default,
+                "[#TokenAuth] Confirming activation for token: %{private}@ (token.length: %lu, uuid: %{private}@)",
                 token, token ? token->length() : 0, uuid);
   auto fail = [reply](int64_t code) { reply(request_pipeline::failure(code)); };
 

@@ -9,13 +9,17 @@ using platform::Value;
 
 void ZLKANetwork::requestMetadataForToken(const std::optional<Data>& token, const std::optional<std::string>& uuid,
                                           const std::optional<platform::Locale>& requestedLocale,
-                                          const std::optional<platform::Dictionary>& requestInfo, ZLKAMetadataReply reply) {
+                                          const std::optional<platform::Dictionary>& requestInfo,
+                                          ZLKAMetadataReply reply) {
   std::optional<std::string> localeIdentifier;
   if (requestedLocale) localeIdentifier = requestedLocale->localeIdentifier();
   platform::log(LogLevel::Default,
-                "[#TokenAuth] Requesting PPID metadata for token: %{private}@ (token.length: %lu, uuid: %{private}@, requestedLocale: %@)",
+                "[#TokenAuth] Requesting PPID metadata for token: %{private}@ (token.length: %lu, uuid: %{private}@, "
+                "requestedLocale: %@)",
                 token, token ? token->length() : 0, uuid, localeIdentifier);
-  auto fail = [reply](int64_t code) { reply(std::nullopt, std::nullopt, std::nullopt, request_pipeline::failure(code)); };
+  auto fail = [reply](int64_t code) {
+    reply(std::nullopt, std::nullopt, std::nullopt, request_pipeline::failure(code));
+  };
 
   if (!request_pipeline::callerIsEntitled()) return fail(ZLKAErrorMissingEntitlement);
   if (!token || !uuid || !requestedLocale) return fail(ZLKAErrorInvalidParameter);
@@ -29,12 +33,12 @@ void ZLKANetwork::requestMetadataForToken(const std::optional<Data>& token, cons
     return fail(ZLKAErrorNetwork);
   }
 
-  request_pipeline::RequestPlan plan{"deviceservices/queryProductPlan", [&](platform::Array tokens) {
-                                       platform::Dictionary dict{
-                                           {"tokens", std::move(tokens)}, {"uuid", *uuid}, {"locale", *localeIdentifier}};
-                                       if (requestInfo) dict.emplace("request_info", *requestInfo);
-                                       return dict;
-                                     }};
+  request_pipeline::RequestPlan plan{
+      "deviceservices/queryProductPlan", [&](platform::Array tokens) {
+        platform::Dictionary dict{{"tokens", std::move(tokens)}, {"uuid", *uuid}, {"locale", *localeIdentifier}};
+        if (requestInfo) dict.emplace("request_info", *requestInfo);
+        return dict;
+      }};
   auto self = shared_from_this();
   auto handler = [self, fail, reply](std::optional<Data> body, std::optional<platform::HTTPResponse> response,
                                      std::optional<platform::Error> taskError) {

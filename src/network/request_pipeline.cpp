@@ -1,10 +1,10 @@
 #include "network/request_pipeline.h"
 
 #include "network/token_array.h"
-#include "platform/values/base64.h"
 #include "platform/bus/connection.h"
-#include "platform/values/json.h"
 #include "platform/log/log.h"
+#include "platform/values/base64.h"
+#include "platform/values/json.h"
 #include "support/base64_array.h"
 #include "support/entitlements.h"
 #include "support/errors.h"
@@ -104,7 +104,8 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
   platform::HTTPRequest request = network._generateTokenAuthURLRequestForEndpoint(plan.endpoint, sessionID, signature);
   platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request);
   if (platform::Log::enabled(LogLevel::Debug))
-    platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@", Value(request.allHTTPHeaderFields()));
+    platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@",
+                  Value(request.allHTTPHeaderFields()));
   platform::log(LogLevel::Debug, "[#TokenAuth] requestDict: %{private}@", requestDict);
   platform::log(LogLevel::Debug, "[#TokenAuth] requestData.length: %lu", body.length());
   platform::log(LogLevel::Debug, "[#TokenAuth] requestData (string): %{private}@", *text);

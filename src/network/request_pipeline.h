@@ -10,15 +10,16 @@
 #include <variant>
 
 #include "network/zlka_network.h"
+#include "platform/http/http_message.h"
 #include "platform/values/data.h"
 #include "platform/values/error.h"
-#include "platform/http/http_message.h"
 #include "platform/values/value.h"
 
 namespace request_pipeline {
 
-using ResponseHandler = std::function<void(std::optional<platform::Data> body, std::optional<platform::HTTPResponse> response,
-                                           std::optional<platform::Error> taskError)>;
+using ResponseHandler =
+    std::function<void(std::optional<platform::Data> body, std::optional<platform::HTTPResponse> response,
+                       std::optional<platform::Error> taskError)>;
 
 struct RequestPlan {
   const char* endpoint;

@@ -4,9 +4,9 @@
 #include <mutex>
 
 #include "network/zlka_network.h"
-#include "platform/values/base64.h"
-#include "platform/log/log.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/log/log.h"
+#include "platform/values/base64.h"
 #include "support/message_ids.h"
 
 using platform::Data;
@@ -37,7 +37,8 @@ std::optional<Error> ZLKANetwork::_openTarvexSAPSession() {
   auto shared = std::make_shared<Rendezvous<bool>>();
   session->openWithCompletionHandler([shared](std::optional<Error> error) {
     if (error) {
-      platform::log(LogLevel::Error, kMessageSessionFailed, "[#TokenAuth] Couldn't open Tarvex SAP session:\n%@", error);
+      platform::log(LogLevel::Error, kMessageSessionFailed, "[#TokenAuth] Couldn't open Tarvex SAP session:\n%@",
+                    error);
     } else {
       platform::log(LogLevel::Default, kMessageSessionOpened, "[#TokenAuth] Tarvex SAP session opened!");
     }
@@ -52,7 +53,8 @@ std::optional<Error> ZLKANetwork::_openTarvexSAPSession() {
   return shared->error;
 }
 
-std::optional<Data> ZLKANetwork::_tarvexSignatureForDataSync(const Data& data, bool* timedOut, std::optional<Error>* error) {
+std::optional<Data> ZLKANetwork::_tarvexSignatureForDataSync(const Data& data, bool* timedOut,
+                                                             std::optional<Error>* error) {
   if (timedOut) *timedOut = false;
   if (error) *error = std::nullopt;
   if (std::optional<Error> openError = _openTarvexSAPSession()) {

@@ -12,19 +12,23 @@ namespace {
 
 // The replacement token arrives as two base64 pieces; it is their plain concatenation. A piece
 // that does not decode is dropped without a word, as the pieces' decoder does everywhere.
-void replyWithNewToken(const Value& answer, const std::function<void(int64_t)>& fail, const ZLKAActivationReply& reply) {
+void replyWithNewToken(const Value& answer, const std::function<void(int64_t)>& fail,
+                       const ZLKAActivationReply& reply) {
   const Value* tokens = answer.find("tokens");
   if (!tokens || !tokens->array()) {
     platform::log(LogLevel::Error,
-                  "[#TokenAuth] Invalid response dictionary received from server! (responseDict.count: %lu, responseDict: %{private}@)",
+                  "[#TokenAuth] Invalid response dictionary received from server! (responseDict.count: %lu, "
+                  "responseDict: %{private}@)",
                   answer.count(), answer);
     return fail(ZLKAErrorServer);
   }
   const platform::Array& pieces = *tokens->array();
   bool allStrings = std::all_of(pieces.begin(), pieces.end(), [](const Value& v) { return v.isString(); });
   if (pieces.size() != 2 || !allStrings) {
-    platform::log(LogLevel::Error, "[#TokenAuth] Invalid token array received from server - newTokenArray: %{private}@, newTokenArray.count: %lu!",
-                  *tokens, pieces.size());
+    platform::log(
+        LogLevel::Error,
+        "[#TokenAuth] Invalid token array received from server - newTokenArray: %{private}@, newTokenArray.count: %lu!",
+        *tokens, pieces.size());
     return fail(ZLKAErrorServer);
   }
   platform::log(LogLevel::Debug, "[#TokenAuth] newTokenArray: %{private}@", *tokens);
@@ -32,7 +36,8 @@ void replyWithNewToken(const Value& answer, const std::function<void(int64_t)>& 
   for (const Value& v : pieces) strings.push_back(*v.string());
   std::vector<Data> decoded = base64DecodeArray(strings);
   if (platform::Log::enabled(LogLevel::Debug))  // the array copies every piece
-    platform::log(LogLevel::Debug, "[#TokenAuth] decodedNewTokenArray: %{private}@", Value(platform::Array(decoded.begin(), decoded.end())));
+    platform::log(LogLevel::Debug, "[#TokenAuth] decodedNewTokenArray: %{private}@",
+                  Value(platform::Array(decoded.begin(), decoded.end())));
   std::vector<uint8_t> newToken;
   for (const Data& piece : decoded) newToken.insert(newToken.end(), piece.bytes(), piece.bytes() + piece.length());
   Data result(std::move(newToken));
@@ -44,7 +49,8 @@ void replyWithNewToken(const Value& answer, const std::function<void(int64_t)>& 
 
 void ZLKANetwork::requestActivationForToken(const std::optional<Data>& token, const std::optional<std::string>& uuid,
                                             ZLKAActivationReply reply) {
-  platform::log(LogLevel::Default, "[#TokenAuth] Requesting activation for token: %{private}@ (token.length: %lu, uuid: %{private}@)",
+  platform::log(LogLevel::Default,
+                "[#TokenAuth] Requesting activation for token: %{private}@ (token.length: %lu, uuid: %{private}@)",
                 token, token ? token->length() : 0, uuid);
   std::function<void(int64_t)> fail = [reply](int64_t code) { reply(std::nullopt, request_pipeline::failure(code)); };
 

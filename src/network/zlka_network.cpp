@@ -4,8 +4,8 @@
 
 #include "network/zlka_network_exported.h"
 #include "platform/config/configuration.h"
-#include "platform/values/exception.h"
 #include "platform/log/log.h"
+#include "platform/values/exception.h"
 #include "support/system_info.h"
 
 using platform::LogLevel;
@@ -29,13 +29,11 @@ std::shared_ptr<ZLKANetwork> ZLKANetwork::sharedInstance() {
   return instance;
 }
 
-std::shared_ptr<ZLKANetwork> ZLKANetwork::existingInstance() {
-  return gMade.load() ? sharedInstance() : nullptr;
-}
+std::shared_ptr<ZLKANetwork> ZLKANetwork::existingInstance() { return gMade.load() ? sharedInstance() : nullptr; }
 
 std::shared_ptr<ZLKANetwork> ZLKANetwork::init() {
-  throw platform::InternalInconsistencyException(std::string("Use +[") + kClassName + " sharedInstance] instead of +[" + kClassName +
-                                                 " init].");
+  throw platform::InternalInconsistencyException(std::string("Use +[") + kClassName + " sharedInstance] instead of +[" +
+                                                 kClassName + " init].");
 }
 
 void ZLKANetwork::_init() {
@@ -43,7 +41,8 @@ void ZLKANetwork::_init() {
   exportedObject_ = std::make_shared<ZLKANetworkExported>();
   isInternalBuild_ = systemInfo_isInternalBuild();
   userDefaults_ = platform::SettingsStore::openSuite(ZLKAUserDefaultsDomain);
-  urlSession_ = platform::HTTPSession::sessionWithConfiguration(platform::HTTPSessionConfiguration::ephemeralSessionConfiguration());
+  urlSession_ = platform::HTTPSession::sessionWithConfiguration(
+      platform::HTTPSessionConfiguration::ephemeralSessionConfiguration());
   tarvexSAPSession_ = TarvexSAPSession::sessionWithDelegate(weak_from_this());
   platform::log(LogLevel::Debug, "[#TokenAuth] Initialized Tarvex SAP Session: %@", tarvexSAPSession_->description());
 }
@@ -85,7 +84,8 @@ void ZLKANetwork::setForceTarvexSAPFailure(bool value) {
   forceTarvexSAPFailure_ = value;
 }
 
-std::string ZLKANetwork::selectServer(const char* key, bool offerCustom, std::string (*pick)(const platform::ServerEnvironment&)) {
+std::string ZLKANetwork::selectServer(const char* key, bool offerCustom,
+                                      std::string (*pick)(const platform::ServerEnvironment&)) {
   auto configuration = platform::currentConfiguration();
   auto prod = configuration->servers.find("prod");
   std::string production = prod != configuration->servers.end() ? pick(prod->second) : std::string();
@@ -97,16 +97,19 @@ std::string ZLKANetwork::selectServer(const char* key, bool offerCustom, std::st
   if (offerCustom && *name == "custom") return defaults->stringForKey(ZLKAUserDefaultsKey_CustomServer).value_or("");
   auto it = configuration->servers.find(*name);
   if (it != configuration->servers.end()) return pick(it->second);
-  platform::log(LogLevel::Error, "[#TokenAuth] Unknown server selected: '%@'. Falling back to production server...", *name);
+  platform::log(LogLevel::Error, "[#TokenAuth] Unknown server selected: '%@'. Falling back to production server...",
+                *name);
   return production;
 }
 
 std::string ZLKANetwork::_selectedStaticContentServer() {
-  return selectServer(ZLKAUserDefaultsKey_StaticContentServer, false, [](const platform::ServerEnvironment& e) { return e.staticContent; });
+  return selectServer(ZLKAUserDefaultsKey_StaticContentServer, false,
+                      [](const platform::ServerEnvironment& e) { return e.staticContent; });
 }
 
 std::string ZLKANetwork::_selectedTarvexSAPServer() {
-  return selectServer(ZLKAUserDefaultsKey_TarvexSAPServer, false, [](const platform::ServerEnvironment& e) { return e.api; });
+  return selectServer(ZLKAUserDefaultsKey_TarvexSAPServer, false,
+                      [](const platform::ServerEnvironment& e) { return e.api; });
 }
 
 std::string ZLKANetwork::_selectedAPIServer() {

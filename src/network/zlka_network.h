@@ -17,8 +17,8 @@
 #include "network/zlka_network_constants.h"
 #include "network/zlka_network_protocol.h"
 #include "platform/config/configuration.h"
-#include "platform/http/http_session.h"
 #include "platform/config/settings_store.h"
+#include "platform/http/http_session.h"
 #include "sap/tarvex_sap_session.h"
 
 class ZLKANetwork final : public ZLKANetworkProtocol,
@@ -36,14 +36,16 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
   // The token operations.
   void requestMetadataForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
                                const std::optional<platform::Locale>& requestedLocale,
-                               const std::optional<platform::Dictionary>& requestInfo, ZLKAMetadataReply reply) override;
+                               const std::optional<platform::Dictionary>& requestInfo,
+                               ZLKAMetadataReply reply) override;
   void requestActivationForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
                                  ZLKAActivationReply reply) override;
   void confirmActivationForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
                                  ZLKAConfirmationReply reply) override;
 
   // The session's certificate and handshake transport.
-  void sessionRequestCertificateWithCompletionHandler(TarvexSAPSession& session, TarvexSAPDataCompletion completion) override;
+  void sessionRequestCertificateWithCompletionHandler(TarvexSAPSession& session,
+                                                      TarvexSAPDataCompletion completion) override;
   void sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSession& session,
                                                           const std::optional<platform::Data>& handshakeData,
                                                           TarvexSAPDataCompletion completion) override;
@@ -77,8 +79,8 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
   std::optional<platform::Error> _openTarvexSAPSession();
   std::optional<platform::Data> _tarvexSignatureForDataSync(const platform::Data& data, bool* timedOut,
                                                             std::optional<platform::Error>* error);
-  bool _verifyTarvexSignatureSync(const std::optional<platform::Data>& signature, const platform::Data& data, bool* timedOut,
-                                  std::optional<platform::Error>* error);
+  bool _verifyTarvexSignatureSync(const std::optional<platform::Data>& signature, const platform::Data& data,
+                                  bool* timedOut, std::optional<platform::Error>* error);
   platform::HTTPRequest _generateTokenAuthURLRequestForEndpoint(const std::string& endpoint,
                                                                 const std::optional<std::string>& sessionID,
                                                                 const std::optional<platform::Data>& signature);

@@ -8,7 +8,8 @@ class ZLKANetworkExported final : public ZLKANetworkProtocol {
  public:
   void requestMetadataForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
                                const std::optional<platform::Locale>& requestedLocale,
-                               const std::optional<platform::Dictionary>& requestInfo, ZLKAMetadataReply reply) override;
+                               const std::optional<platform::Dictionary>& requestInfo,
+                               ZLKAMetadataReply reply) override;
   void requestActivationForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,
                                  ZLKAActivationReply reply) override;
   void confirmActivationForToken(const std::optional<platform::Data>& token, const std::optional<std::string>& uuid,

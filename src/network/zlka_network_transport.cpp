@@ -1,10 +1,9 @@
 // The session's two network legs: the setup certificate from the static-content server and the
 // handshake with the secure-association server, both over the process-wide shared HTTP session.
 #include "network/zlka_network.h"
-
+#include "platform/log/log.h"
 #include "platform/values/base64.h"
 #include "platform/values/json.h"
-#include "platform/log/log.h"
 
 using platform::Data;
 using platform::Error;
@@ -41,7 +40,8 @@ std::optional<Error> checkAnswer(const std::optional<Data>& data, const std::opt
   if (showBody && data && !data->empty())
     platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", data->view());
   if (response->statusCode != 200) {
-    platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!", response->statusCode);
+    platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!",
+                  response->statusCode);
     return sessionError(TarvexSAPSessionErrorBadResponse);
   }
   if (!data || data->empty()) {
@@ -53,7 +53,8 @@ std::optional<Error> checkAnswer(const std::optional<Data>& data, const std::opt
 
 }  // namespace
 
-void ZLKANetwork::sessionRequestCertificateWithCompletionHandler(TarvexSAPSession&, TarvexSAPDataCompletion completion) {
+void ZLKANetwork::sessionRequestCertificateWithCompletionHandler(TarvexSAPSession&,
+                                                                 TarvexSAPDataCompletion completion) {
   platform::log(LogLevel::Default, "[#TokenAuth] Requesting certificate for Tarvex SAP session...");
   if (!completion) return;
   std::string server = _selectedStaticContentServer();
@@ -65,7 +66,8 @@ void ZLKANetwork::sessionRequestCertificateWithCompletionHandler(TarvexSAPSessio
   auto task = platform::HTTPSession::sharedSession()->dataTaskWithRequest(
       std::move(request), [completion](std::optional<Data> data, std::optional<platform::HTTPResponse> response,
                                        std::optional<Error> taskError) {
-        if (auto error = checkAnswer(data, response, taskError, false)) return completion(std::nullopt, std::move(error));
+        if (auto error = checkAnswer(data, response, taskError, false))
+          return completion(std::nullopt, std::move(error));
         completion(std::move(data), std::nullopt);
       });
   task->resume();
@@ -113,7 +115,8 @@ void ZLKANetwork::sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSe
       std::move(request), Data::fromString(*body),
       [weakSelf, completion](std::optional<Data> data, std::optional<platform::HTTPResponse> response,
                              std::optional<Error> taskError) {
-        if (auto error = checkAnswer(data, response, taskError, true)) return completion(std::nullopt, std::move(error));
+        if (auto error = checkAnswer(data, response, taskError, true))
+          return completion(std::nullopt, std::move(error));
         std::string parseError;
         std::optional<Value> responseDict = platform::json::parse(data->view(), &parseError);
         if (!responseDict) {
@@ -127,7 +130,8 @@ void ZLKANetwork::sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSe
         const Value* validity = responseDict->find("session-validity");
         if (!info || !info->string() || !validity || !validity->isNumber()) {
           platform::log(LogLevel::Error,
-                        "[#TokenAuth] Invalid response dictionary received from server! (responseDict.count: %lu, responseDict: %{private}@)",
+                        "[#TokenAuth] Invalid response dictionary received from server! (responseDict.count: %lu, "
+                        "responseDict: %{private}@)",
                         responseDict->count(), responseDict);
           completion(std::nullopt, sessionError(TarvexSAPSessionErrorBadResponse));
           return;

@@ -2,14 +2,14 @@
 
 #include <algorithm>
 #include <atomic>
-#include <cmath>
 #include <chrono>
+#include <cmath>
 #include <cstdlib>
 #include <ctime>
 #include <vector>
 
-#include "platform/values/exception.h"
 #include "platform/log/log.h"
+#include "platform/values/exception.h"
 
 using platform::Data;
 using platform::Error;
@@ -21,9 +21,7 @@ namespace {
 constexpr char kClassName[] = "TarvexSAPSession";
 constexpr double kDistantFuture = 64092211200.0;  // 4001-01-01, far beyond any time-to-live
 
-double now() {
-  return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
-}
+double now() { return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count(); }
 
 std::string formatDate(double secondsSince1970) {
   // The TTL comes from the server: a huge one must not overflow the conversion to time_t.
@@ -68,17 +66,18 @@ std::string className(const std::optional<Value>& v) { return v ? v->typeName() 
 
 }  // namespace
 
-std::shared_ptr<TarvexSAPSession> TarvexSAPSession::sessionWithDelegate(std::weak_ptr<TarvexSAPSessionDelegate> delegate,
-                                                                        TarvexSAPPrimitives primitives) {
+std::shared_ptr<TarvexSAPSession> TarvexSAPSession::sessionWithDelegate(
+    std::weak_ptr<TarvexSAPSessionDelegate> delegate, TarvexSAPPrimitives primitives) {
   return std::make_shared<TarvexSAPSession>(Private{}, std::move(delegate), std::move(primitives));
 }
 
 std::shared_ptr<TarvexSAPSession> TarvexSAPSession::init() {
-  throw platform::InternalInconsistencyException(std::string("Must use +[") + kClassName + " initWithDelegate:] instead of +[" +
-                                                 kClassName + " init]!");
+  throw platform::InternalInconsistencyException(std::string("Must use +[") + kClassName +
+                                                 " initWithDelegate:] instead of +[" + kClassName + " init]!");
 }
 
-TarvexSAPSession::TarvexSAPSession(Private, std::weak_ptr<TarvexSAPSessionDelegate> delegate, TarvexSAPPrimitives primitives)
+TarvexSAPSession::TarvexSAPSession(Private, std::weak_ptr<TarvexSAPSessionDelegate> delegate,
+                                   TarvexSAPPrimitives primitives)
     : delegate_(std::move(delegate)),
       completionQueue_(platform::Queue::concurrent(queueLabel(this, "completionQueue"))),
       internalQueue_(platform::Queue::serial(queueLabel(this, "internalQueue"))),
@@ -143,13 +142,15 @@ void TarvexSAPSession::_failOpen(const OpenCompletion& completion, Error error) 
 }
 
 void TarvexSAPSession::openWithCompletionHandler(OpenCompletion completion) {
-  internalQueue_->async([self = shared_from_this(), completion = once(std::move(completion))] { self->_open(completion); });
+  internalQueue_->async(
+      [self = shared_from_this(), completion = once(std::move(completion))] { self->_open(completion); });
 }
 
 void TarvexSAPSession::_open(OpenCompletion completion) {
   _checkExpiration();
   if (step_ != Step::Closed) {
-    _complete(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session is already open or initializing."));
+    _complete(completion,
+              QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session is already open or initializing."));
     return;
   }
   platform::log(LogLevel::Info, "[#TarvexSAPSession] Opening session...");
@@ -172,16 +173,18 @@ void TarvexSAPSession::_open(OpenCompletion completion) {
 
 // One leg of the handshake: the delegate is asked on its queue, and its first answer continues the
 // open on the internal queue.
-void TarvexSAPSession::_askDelegate(uint64_t generation, OpenCompletion completion, DelegateLeg leg, Continuation next) {
+void TarvexSAPSession::_askDelegate(uint64_t generation, OpenCompletion completion, DelegateLeg leg,
+                                    Continuation next) {
   delegateQueue_->async([self = shared_from_this(), generation, completion, leg = std::move(leg), next] {
     auto delegate = self->delegate_.lock();
     if (!delegate) return;
-    leg(*delegate, *self, firstAnswerOnly([self, generation, completion, next](std::optional<Data> answer, std::optional<Error> error) {
-      self->internalQueue_->async(
-          [self, generation, completion, next, answer = std::move(answer), error = std::move(error)]() mutable {
-            ((*self).*next)(generation, std::move(answer), std::move(error), completion);
-          });
-    }));
+    leg(*delegate, *self,
+        firstAnswerOnly([self, generation, completion, next](std::optional<Data> answer, std::optional<Error> error) {
+          self->internalQueue_->async(
+              [self, generation, completion, next, answer = std::move(answer), error = std::move(error)]() mutable {
+                ((*self).*next)(generation, std::move(answer), std::move(error), completion);
+              });
+        }));
   });
 }
 
@@ -225,7 +228,8 @@ void TarvexSAPSession::_receivedCertificate(uint64_t generation, std::optional<D
 
   Exchanged request = _exchange(*certificate);
   if (request.status != 0 || request.returnCode != 1 || !request.out || request.outLength == 0) {
-    platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not generate handshake request data! (status: %d, returnCode: %d)",
+    platform::log(LogLevel::Error,
+                  "[#TarvexSAPSession] Could not generate handshake request data! (status: %d, returnCode: %d)",
                   request.status, request.returnCode);
     return _failOpen(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
   }
@@ -261,8 +265,9 @@ void TarvexSAPSession::_receivedHandshake(uint64_t generation, std::optional<Dat
     _complete(completion, std::nullopt);
     return;
   }
-  platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not process handshake response! (status: %d, returnCode: %d)",
-                done.status, done.returnCode);
+  platform::log(LogLevel::Error,
+                "[#TarvexSAPSession] Could not process handshake response! (status: %d, returnCode: %d)", done.status,
+                done.returnCode);
   _failOpen(completion, QVSAPS_errorWithCode(TarvexSAPSessionErrorInternal));
 }
 
@@ -278,25 +283,27 @@ void TarvexSAPSession::signatureForData(const std::optional<Value>& data, SignCo
   if (!completion) return;
   internalQueue_->async([self = shared_from_this(), data, completion = std::move(completion)] {
     auto reply = [&](std::optional<Data> signature, std::optional<Error> error) {
-      self->completionQueue_->async([completion, signature = std::move(signature), error = std::move(error)] {
-        completion(signature, error);
-      });
+      self->completionQueue_->async(
+          [completion, signature = std::move(signature), error = std::move(error)] { completion(signature, error); });
     };
     platform::log(LogLevel::Info, "[#TarvexSAPSession] Generating signature...");
     self->_checkExpiration();
     if (!data || !data->isData()) {
-      platform::log(LogLevel::Info, "[#TarvexSAPSession] Invalid parameter! (data.class: %@, data: %@)", className(data), data);
+      platform::log(LogLevel::Info, "[#TarvexSAPSession] Invalid parameter! (data.class: %@, data: %@)",
+                    className(data), data);
       reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
       return;
     }
     if (self->step_ != Step::Open) {
-      reply(std::nullopt, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to generate signature."));
+      reply(std::nullopt,
+            QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to generate signature."));
       return;
     }
     const Data& bytes = *data->data();
     uint8_t* raw = nullptr;
     uint32_t signatureLength = 0;
-    int32_t status = self->primitives_.sign(self->sessionContext_, bytes.bytes(), bytes.length(), &raw, &signatureLength);
+    int32_t status =
+        self->primitives_.sign(self->sessionContext_, bytes.bytes(), bytes.length(), &raw, &signatureLength);
     std::unique_ptr<uint8_t, FreeBytes> signature(raw);
     if (status != 0) {
       platform::log(LogLevel::Error, "[#TarvexSAPSession] Could not generate signature! (status: %d)", status);
@@ -323,20 +330,23 @@ void TarvexSAPSession::verifySignature(const std::optional<Value>& signature, co
     };
     platform::log(LogLevel::Info, "[#TarvexSAPSession] Verifying signature...");
     if (!signature || !signature->isData() || !data || !data->isData()) {
-      platform::log(LogLevel::Info,
-                    "[#TarvexSAPSession] Invalid parameter! (signature.class: %@, data.class: %@, signature: %@, data: %@)",
-                    className(signature), className(data), signature, data);
+      platform::log(
+          LogLevel::Info,
+          "[#TarvexSAPSession] Invalid parameter! (signature.class: %@, data.class: %@, signature: %@, data: %@)",
+          className(signature), className(data), signature, data);
       reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidParameter));
       return;
     }
     if (self->step_ != Step::Open) {
-      reply(false, QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to verify signature."));
+      reply(false,
+            QVSAPS_errorWithCode(TarvexSAPSessionErrorInvalidState, "Session must be open to verify signature."));
       return;
     }
     const Data& sig = *signature->data();
     // The primitive may write into the data; it gets a private copy.
     std::vector<uint8_t> copy = data->data()->toVector();
-    int32_t status = self->primitives_.verify(self->sessionContext_, sig.bytes(), sig.length(), copy.data(), copy.size());
+    int32_t status =
+        self->primitives_.verify(self->sessionContext_, sig.bytes(), sig.length(), copy.data(), copy.size());
     self->_checkExpiration();
     if (status != 0) {
       platform::log(LogLevel::Default, "[#TarvexSAPSession] Signature verification failed! (status: %d)", status);

@@ -18,9 +18,9 @@
 #include <optional>
 #include <string>
 
+#include "platform/dispatch/queue.h"
 #include "platform/values/data.h"
 #include "platform/values/error.h"
-#include "platform/dispatch/queue.h"
 #include "platform/values/uuid.h"
 #include "platform/values/value.h"
 #include "sap/tarvex_sap_primitives.h"
@@ -39,8 +39,9 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   using SignCompletion = std::function<void(std::optional<platform::Data>, std::optional<platform::Error>)>;
   using VerifyCompletion = std::function<void(bool, std::optional<platform::Error>)>;
 
-  static std::shared_ptr<TarvexSAPSession> sessionWithDelegate(std::weak_ptr<TarvexSAPSessionDelegate> delegate,
-                                                               TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library());
+  static std::shared_ptr<TarvexSAPSession> sessionWithDelegate(
+      std::weak_ptr<TarvexSAPSessionDelegate> delegate,
+      TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library());
   // Forbidden: sessions are made with sessionWithDelegate. Throws InternalInconsistencyException.
   [[noreturn]] static std::shared_ptr<TarvexSAPSession> init();
   ~TarvexSAPSession();
@@ -56,7 +57,7 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
                        VerifyCompletion completion);
 
   TarvexSAPSessionState state();
-  double TTL();              // seconds left while open (negative once past), else 0
+  double TTL();  // seconds left while open (negative once past), else 0
   void setTTL(double seconds);
   std::string description();  // "TarvexSAPSession <state: [Open], TTL: 3599.998000s>"
 

@@ -15,8 +15,8 @@ enum TarvexSAPSessionErrorCode : int64_t {
   TarvexSAPSessionErrorNotAvailable = -2,
   TarvexSAPSessionErrorInvalidParameter = -3,
   TarvexSAPSessionErrorInternal = -4,
-  TarvexSAPSessionErrorTransport = -5,     // no description of its own
-  TarvexSAPSessionErrorBadResponse = -6,   // no description of its own
+  TarvexSAPSessionErrorTransport = -5,    // no description of its own
+  TarvexSAPSessionErrorBadResponse = -6,  // no description of its own
   TarvexSAPSessionErrorInvalidState = -7,
 };
 

@@ -2,12 +2,12 @@
 
 #include <CLI/CLI.hpp>
 
-#include "platform/config/configuration.h"
-#include "platform/config/device_facts.h"
 #include "platform/bus/entitlement_manifests.h"
 #include "platform/bus/listener.h"
-#include "platform/log/log.h"
+#include "platform/config/configuration.h"
+#include "platform/config/device_facts.h"
 #include "platform/dispatch/worker_pool.h"
+#include "platform/log/log.h"
 #include "service/config_check.h"
 #include "service/runtime_control.h"
 #include "service/zlka_network_bus_interface.h"
@@ -59,7 +59,7 @@ std::optional<int> parse(int argc, char** argv, CommandLine& cl) {
 void configureLogFromCommandLine(const CommandLine& cl) {
   platform::LogSettings log;
   if (!cl.logLevel.empty()) log.minimum = *platform::logLevelFromName(cl.logLevel);
-  log.backend = cl.logBackend == "journal" ? platform::LogBackend::Journal
+  log.backend = cl.logBackend == "journal"  ? platform::LogBackend::Journal
                 : cl.logBackend == "stderr" ? platform::LogBackend::Stderr
                                             : platform::LogBackend::Auto;
   platform::configureLog(log);
@@ -92,13 +92,14 @@ std::optional<int> setUpDaemon(int argc, char** argv) {
   platform::WorkerPool::connections().setMaximum(config->maxWorkers);
   auto manifests = std::make_shared<platform::EntitlementManifests>(config->entitlementsDirectory);
   size_t entries = manifests->reload();
-  platform::log(LogLevel::Info, "Loaded %zu entitlement manifest entr(ies) from %s", entries, config->entitlementsDirectory.string());
+  platform::log(LogLevel::Info, "Loaded %zu entitlement manifest entr(ies) from %s", entries,
+                config->entitlementsDirectory.string());
   if (cl.checkConfig) {
     // At start an unusable manifest is only ignored; a check says so, since no caller it names gets in.
     size_t files = manifestFileCount(config->entitlementsDirectory);
     if (entries < files) {
-      platform::log(LogLevel::Error, "%s: %zu of %zu entitlement manifest(s) ignored (see above)", config->path.string(),
-                    files - entries, files);
+      platform::log(LogLevel::Error, "%s: %zu of %zu entitlement manifest(s) ignored (see above)",
+                    config->path.string(), files - entries, files);
       return kExitConfiguration;
     }
     platform::log(LogLevel::Default, "%s: the configuration is usable", config->path.string());
@@ -110,7 +111,8 @@ std::optional<int> setUpDaemon(int argc, char** argv) {
   options.serviceName = kZLKAServiceName;
   options.objectPath = kZLKAObjectPath;
   options.interface = ZLKANetworkProtocolInterface();
-  options.entitlementsForPeer = [manifests](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
+  options.entitlementsForPeer =
+      [manifests](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
     platform::PeerIdentity peer = platform::peerIdentity(credentials);
     platform::log(LogLevel::Info, "Peer pid %d uid %u label %@ runs %s", peer.pid, peer.uid, peer.label,
                   peer.executable.value_or("an executable that cannot be established"));

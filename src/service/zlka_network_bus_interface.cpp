@@ -6,8 +6,8 @@
 #include "network/request_pipeline.h"
 #include "network/zlka_network_protocol.h"
 #include "platform/bus/bus_values.h"
-#include "platform/values/json.h"
 #include "platform/log/log.h"
+#include "platform/values/json.h"
 #include "service/answer_counts.h"
 #include "support/errors.h"
 
@@ -91,44 +91,44 @@ std::shared_ptr<ZLKANetworkProtocol> exported(const std::shared_ptr<void>& objec
 DecodedCall decodeMetadata(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
   if (auto error = readArguments(m, true, args)) return refused(*error);
-  return {
-      [object, args](Reply reply) {
-        std::optional<platform::Locale> locale;
-        if (args.requestedLocale) locale = platform::Locale(*args.requestedLocale);
-        exported(object)->requestMetadataForToken(
-            args.token, args.uuid, locale, args.requestInfo,
-            [reply](std::optional<std::string> ppid, std::optional<platform::Locale> answered,
-                    std::optional<platform::Dictionary> metadata, std::optional<platform::Error> error) {
-              if (error || !ppid || !answered || !metadata)
-                return refuse(reply, error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
-              std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
-              std::string locale = answered->localeIdentifier();
-              if (auto bad = unsendable({{"ppid", &*ppid}, {"locale", &locale}, {"metadata", &json}}))
-                return refuse(reply, *bad);
-              answer(reply, [ppid = *ppid, locale = std::move(locale), json = std::move(json)](sd_bus_message* r) {
-                return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
-              });
-            });
-      },
-      std::nullopt};
+  return {[object, args](Reply reply) {
+            std::optional<platform::Locale> locale;
+            if (args.requestedLocale) locale = platform::Locale(*args.requestedLocale);
+            exported(object)->requestMetadataForToken(
+                args.token, args.uuid, locale, args.requestInfo,
+                [reply](std::optional<std::string> ppid, std::optional<platform::Locale> answered,
+                        std::optional<platform::Dictionary> metadata, std::optional<platform::Error> error) {
+                  if (error || !ppid || !answered || !metadata)
+                    return refuse(reply,
+                                  error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+                  std::string json = platform::json::serialize(Value(*metadata)).value_or("{}");
+                  std::string locale = answered->localeIdentifier();
+                  if (auto bad = unsendable({{"ppid", &*ppid}, {"locale", &locale}, {"metadata", &json}}))
+                    return refuse(reply, *bad);
+                  answer(reply, [ppid = *ppid, locale = std::move(locale), json = std::move(json)](sd_bus_message* r) {
+                    return sd_bus_message_append(r, "sss", ppid.c_str(), locale.c_str(), json.c_str());
+                  });
+                });
+          },
+          std::nullopt};
 }
 
 DecodedCall decodeActivation(sd_bus_message* m, const std::shared_ptr<void>& object) {
   TokenArguments args;
   if (auto error = readArguments(m, false, args)) return refused(*error);
-  return {
-      [object, args](Reply reply) {
-        exported(object)->requestActivationForToken(
-            args.token, args.uuid, [reply](std::optional<Data> newToken, std::optional<platform::Error> error) {
-              if (error || !newToken)
-                return refuse(reply, error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
-              answer(reply, [token = *newToken](sd_bus_message* r) {
-                return sd_bus_message_append_array(
-                    r, 'y', token.bytes() ? token.bytes() : reinterpret_cast<const uint8_t*>(""), token.length());
-              });
-            });
-      },
-      std::nullopt};
+  return {[object, args](Reply reply) {
+            exported(object)->requestActivationForToken(
+                args.token, args.uuid, [reply](std::optional<Data> newToken, std::optional<platform::Error> error) {
+                  if (error || !newToken)
+                    return refuse(reply,
+                                  error ? busErrorForError(*error) : BusError{platform::kBusErrorFailed, "No answer."});
+                  answer(reply, [token = *newToken](sd_bus_message* r) {
+                    return sd_bus_message_append_array(
+                        r, 'y', token.bytes() ? token.bytes() : reinterpret_cast<const uint8_t*>(""), token.length());
+                  });
+                });
+          },
+          std::nullopt};
 }
 
 DecodedCall decodeConfirmation(sd_bus_message* m, const std::shared_ptr<void>& object) {

@@ -8,8 +8,8 @@
 #include <memory>
 #include <string>
 
-#include "platform/values/error.h"
 #include "platform/bus/messaging.h"
+#include "platform/values/error.h"
 
 inline constexpr char kZLKAServiceName[] = "com.kestro.ZLKAuthentication.ZLKANetwork";
 inline constexpr char kZLKAObjectPath[] = "/com/kestro/ZLKAuthentication/ZLKANetwork";

@@ -29,4 +29,5 @@ std::optional<std::string> errorDescription(std::string_view domain, int64_t cod
 // An error whose description is errorDescription(domain, code).
 platform::Error ZLKA_errorWithDomain(const std::string& domain, int64_t code);
 // A description of nullopt gives an error with no user-info at all.
-platform::Error ZLKA_errorWithDomain(const std::string& domain, int64_t code, const std::optional<std::string>& description);
+platform::Error ZLKA_errorWithDomain(const std::string& domain, int64_t code,
+                                     const std::optional<std::string>& description);

@@ -12,9 +12,7 @@ uint8_t nibble(char c) {
   return 0;
 }
 
-bool isHexDigit(char c) {
-  return (c >= '0' && c <= '9') || (c >= 'A' && c <= 'F') || (c >= 'a' && c <= 'f');
-}
+bool isHexDigit(char c) { return (c >= '0' && c <= '9') || (c >= 'A' && c <= 'F') || (c >= 'a' && c <= 'f'); }
 }  // namespace
 
 void ascii_to_hex(uint8_t* out, const char* in, size_t length) {

@@ -18,7 +18,8 @@ std::optional<platform::Value> readJSONFile(const std::optional<std::filesystem:
 
 bool writeJSONFile(const std::optional<platform::Value>& object, const std::optional<std::filesystem::path>& path) {
   if (!path) return false;
-  std::optional<std::string> text = platform::json::serialize(object ? *object : platform::Value(platform::Dictionary{}), true);
+  std::optional<std::string> text =
+      platform::json::serialize(object ? *object : platform::Value(platform::Dictionary{}), true);
   if (!text) return false;
   return platform::writeFileAtomically(*path, *text);
 }

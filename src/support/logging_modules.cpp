@@ -20,11 +20,13 @@ void loggingModules_setup(const LoggingModuleEntry_t* table, uint8_t count, Logg
       const char* subsystem = table[n].subsystem;
       const char* category = table[n].category;
       if (!subsystem) {
-        platform::log(LogLevel::Error, "Subsystem missing for logging module %d!\n(Check LoggingModuleEntry_t table)", n);
+        platform::log(LogLevel::Error, "Subsystem missing for logging module %d!\n(Check LoggingModuleEntry_t table)",
+                      n);
         subsystem = kUndefined;
       }
       if (!category) {
-        platform::log(LogLevel::Error, "Category missing for logging module %d!\n(Check LoggingModuleEntry_t table)", n);
+        platform::log(LogLevel::Error, "Category missing for logging module %d!\n(Check LoggingModuleEntry_t table)",
+                      n);
         category = kUndefined;
       }
       out[n] = platform::Log::create(subsystem, category);

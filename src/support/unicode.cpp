@@ -3,8 +3,9 @@
 namespace {
 // U+202A..U+202D encode as E2 80 AA..AD.
 bool isTrimmedControl(std::string_view s, size_t at) {
-  return at + 3 <= s.size() && static_cast<unsigned char>(s[at]) == 0xE2 && static_cast<unsigned char>(s[at + 1]) == 0x80 &&
-         static_cast<unsigned char>(s[at + 2]) >= 0xAA && static_cast<unsigned char>(s[at + 2]) <= 0xAD;
+  return at + 3 <= s.size() && static_cast<unsigned char>(s[at]) == 0xE2 &&
+         static_cast<unsigned char>(s[at + 1]) == 0x80 && static_cast<unsigned char>(s[at + 2]) >= 0xAA &&
+         static_cast<unsigned char>(s[at + 2]) <= 0xAD;
 }
 }  // namespace
 

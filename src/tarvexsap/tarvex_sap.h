@@ -22,17 +22,17 @@
 #include <cstddef>
 #include <cstdint>
 
-struct QVSAPContextOpaque_; // never defined: handles are opaque tokens
+struct QVSAPContextOpaque_;  // never defined: handles are opaque tokens
 
 struct TarvexHWInfo_ {
-    uint32_t IDLength;
-    uint8_t ID[20];
+  uint32_t IDLength;
+  uint8_t ID[20];
 };
 
 struct TarvexSAPConfig {
-    const uint8_t *trustAnchorPEM; // one or more PEM certificates
-    size_t trustAnchorPEMLength;
-    const char *machineIDPath; // null: /etc/machine-id
+  const uint8_t* trustAnchorPEM;  // one or more PEM certificates
+  size_t trustAnchorPEMLength;
+  const char* machineIDPath;  // null: /etc/machine-id
 };
 
 inline constexpr int32_t kTarvexSAPOK = 0;
@@ -46,14 +46,14 @@ inline constexpr int32_t kTarvexSAPErrorCryptoFailure = -7;        // the crypto
 inline constexpr int32_t kTarvexSAPErrorNotConfigured = -8;        // no trust anchor configured
 
 // Short constant name of a status, for logs ("unknown" for values not listed above).
-const char *TarvexSAPStatusName(int32_t status);
+const char* TarvexSAPStatusName(int32_t status);
 
-int32_t TarvexSAPConfigure(const TarvexSAPConfig *config);
-int32_t TarvexSAPInit(QVSAPContextOpaque_ **context, TarvexHWInfo_ *hwInfo);
-int32_t TarvexSAPExchange(int32_t selector, TarvexHWInfo_ *hwInfo, QVSAPContextOpaque_ *context, const uint8_t *in,
-                          size_t inLen, uint8_t **out, uint32_t *outLen, uint8_t *returnCode);
-int32_t TarvexSAPSign(QVSAPContextOpaque_ *context, const uint8_t *data, size_t len, uint8_t **signature,
-                      uint32_t *signatureLen);
-int32_t TarvexSAPVerify(QVSAPContextOpaque_ *context, const uint8_t *signature, size_t signatureLen, uint8_t *data,
+int32_t TarvexSAPConfigure(const TarvexSAPConfig* config);
+int32_t TarvexSAPInit(QVSAPContextOpaque_** context, TarvexHWInfo_* hwInfo);
+int32_t TarvexSAPExchange(int32_t selector, TarvexHWInfo_* hwInfo, QVSAPContextOpaque_* context, const uint8_t* in,
+                          size_t inLen, uint8_t** out, uint32_t* outLen, uint8_t* returnCode);
+int32_t TarvexSAPSign(QVSAPContextOpaque_* context, const uint8_t* data, size_t len, uint8_t** signature,
+                      uint32_t* signatureLen);
+int32_t TarvexSAPVerify(QVSAPContextOpaque_* context, const uint8_t* signature, size_t signatureLen, uint8_t* data,
                         size_t len);
-int32_t TarvexSAPTeardown(QVSAPContextOpaque_ *context);
+int32_t TarvexSAPTeardown(QVSAPContextOpaque_* context);

@@ -20,23 +20,23 @@
 #include <vector>
 
 struct TarvexSAPKeyFree {
-    void operator()(EVP_PKEY *key) const { EVP_PKEY_free(key); }
+  void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
 };
 struct TarvexSAPCertFree {
-    void operator()(X509 *cert) const { X509_free(cert); }
+  void operator()(X509* cert) const { X509_free(cert); }
 };
 using TarvexSAPKey = std::unique_ptr<EVP_PKEY, TarvexSAPKeyFree>;
 using TarvexSAPCert = std::unique_ptr<X509, TarvexSAPCertFree>;
 
 struct TarvexSAPValidity {
-    std::chrono::seconds notBefore{-3600};                         // from now
-    std::chrono::seconds notAfter{std::chrono::hours(24 * 365 * 10)}; // from now
+  std::chrono::seconds notBefore{-3600};                             // from now
+  std::chrono::seconds notAfter{std::chrono::hours(24 * 365 * 10)};  // from now
 };
 
 // A certificate with its private key (null when the subject key was supplied as public only).
 struct TarvexSAPCredential {
-    TarvexSAPCert certificate;
-    TarvexSAPKey key;
+  TarvexSAPCert certificate;
+  TarvexSAPKey key;
 };
 
 TarvexSAPKey TarvexSAPGenerateEd25519Key();
@@ -44,21 +44,21 @@ TarvexSAPKey TarvexSAPGenerateEd25519Key();
 TarvexSAPKey TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed);
 
 // `key` null: a fresh Ed25519 key; otherwise the root takes a reference to it.
-TarvexSAPCredential TarvexSAPMakeRoot(std::string_view commonName, const TarvexSAPValidity &validity = {},
-                                      EVP_PKEY *key = nullptr);
+TarvexSAPCredential TarvexSAPMakeRoot(std::string_view commonName, const TarvexSAPValidity& validity = {},
+                                      EVP_PKEY* key = nullptr);
 // `subjectKey` null: a fresh Ed25519 key; otherwise its public half is certified and the
 // credential takes a reference to it.
-TarvexSAPCredential TarvexSAPIssueSetupCertificate(const TarvexSAPCredential &root, std::string_view commonName,
-                                                   const TarvexSAPValidity &validity = {},
-                                                   EVP_PKEY *subjectKey = nullptr);
+TarvexSAPCredential TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root, std::string_view commonName,
+                                                   const TarvexSAPValidity& validity = {},
+                                                   EVP_PKEY* subjectKey = nullptr);
 
-std::string TarvexSAPCertToPEM(const X509 *cert);
-std::vector<uint8_t> TarvexSAPCertToDER(const X509 *cert);
+std::string TarvexSAPCertToPEM(const X509* cert);
+std::vector<uint8_t> TarvexSAPCertToDER(const X509* cert);
 TarvexSAPCert TarvexSAPCertFromPEM(std::string_view pem);
 TarvexSAPCert TarvexSAPCertFromDER(std::span<const uint8_t> der);
 
 // PKCS#8, unencrypted.
-std::string TarvexSAPKeyToPEM(const EVP_PKEY *key);
-std::vector<uint8_t> TarvexSAPKeyToDER(const EVP_PKEY *key);
+std::string TarvexSAPKeyToPEM(const EVP_PKEY* key);
+std::vector<uint8_t> TarvexSAPKeyToDER(const EVP_PKEY* key);
 TarvexSAPKey TarvexSAPKeyFromPEM(std::string_view pem);
 TarvexSAPKey TarvexSAPKeyFromDER(std::span<const uint8_t> der);

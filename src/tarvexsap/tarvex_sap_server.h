@@ -29,72 +29,71 @@
 #include <vector>
 
 enum class TarvexSAPServerStatus {
-    ok,
-    malformed,      // handshake request or session identifier unacceptable
-    unknownSession, // no association under the identifier
-    expired,        // association past its time-to-live
-    badSignature,   // wrong length or MAC mismatch
-    replay,         // seq 0, already seen, or below the window
-    cryptoFailure,  // the crypto library failed
+  ok,
+  malformed,       // handshake request or session identifier unacceptable
+  unknownSession,  // no association under the identifier
+  expired,         // association past its time-to-live
+  badSignature,    // wrong length or MAC mismatch
+  replay,          // seq 0, already seen, or below the window
+  cryptoFailure,   // the crypto library failed
 };
 
-const char *TarvexSAPServerStatusName(TarvexSAPServerStatus status);
+const char* TarvexSAPServerStatusName(TarvexSAPServerStatus status);
 
 class TarvexSAPServer {
-public:
-    using Clock = std::function<std::chrono::steady_clock::time_point()>;
+ public:
+  using Clock = std::function<std::chrono::steady_clock::time_point()>;
 
-    struct HandshakeResult {
-        TarvexSAPServerStatus status = TarvexSAPServerStatus::cryptoFailure;
-        std::array<uint8_t, 129> sessionInfo{};
-    };
-    struct VerifyResult {
-        TarvexSAPServerStatus status = TarvexSAPServerStatus::cryptoFailure;
-        uint64_t seq = 0; // the accepted seq, to echo in the response signature
-    };
-    struct SignResult {
-        TarvexSAPServerStatus status = TarvexSAPServerStatus::cryptoFailure;
-        std::array<uint8_t, 40> signature{};
-    };
+  struct HandshakeResult {
+    TarvexSAPServerStatus status = TarvexSAPServerStatus::cryptoFailure;
+    std::array<uint8_t, 129> sessionInfo{};
+  };
+  struct VerifyResult {
+    TarvexSAPServerStatus status = TarvexSAPServerStatus::cryptoFailure;
+    uint64_t seq = 0;  // the accepted seq, to echo in the response signature
+  };
+  struct SignResult {
+    TarvexSAPServerStatus status = TarvexSAPServerStatus::cryptoFailure;
+    std::array<uint8_t, 40> signature{};
+  };
 
-    // Throws std::invalid_argument unless the certificate parses, the key is Ed25519 and it is
-    // the certificate's key. A null clock means std::chrono::steady_clock::now.
-    TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, EVP_PKEY *setupKey, Clock clock = nullptr);
-    TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, std::string_view setupKeyPEM,
-                    Clock clock = nullptr);
-    ~TarvexSAPServer();
-    TarvexSAPServer(const TarvexSAPServer &) = delete;
-    TarvexSAPServer &operator=(const TarvexSAPServer &) = delete;
+  // Throws std::invalid_argument unless the certificate parses, the key is Ed25519 and it is
+  // the certificate's key. A null clock means std::chrono::steady_clock::now.
+  TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, EVP_PKEY* setupKey, Clock clock = nullptr);
+  TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, std::string_view setupKeyPEM, Clock clock = nullptr);
+  ~TarvexSAPServer();
+  TarvexSAPServer(const TarvexSAPServer&) = delete;
+  TarvexSAPServer& operator=(const TarvexSAPServer&) = delete;
 
-    // The certificate to serve to devices.
-    const std::vector<uint8_t> &setupCertificateDER() const { return certificate_; }
+  // The certificate to serve to devices.
+  const std::vector<uint8_t>& setupCertificateDER() const { return certificate_; }
 
-    HandshakeResult handshake(std::string_view sessionIdentifier, std::span<const uint8_t> request,
-                              std::chrono::seconds ttl);
-    VerifyResult verifyRequest(std::string_view sessionIdentifier, std::span<const uint8_t> signature,
-                               std::span<const uint8_t> body);
-    SignResult signResponse(std::string_view sessionIdentifier, uint64_t seq, std::span<const uint8_t> body);
+  HandshakeResult handshake(std::string_view sessionIdentifier, std::span<const uint8_t> request,
+                            std::chrono::seconds ttl);
+  VerifyResult verifyRequest(std::string_view sessionIdentifier, std::span<const uint8_t> signature,
+                             std::span<const uint8_t> body);
+  SignResult signResponse(std::string_view sessionIdentifier, uint64_t seq, std::span<const uint8_t> body);
 
-    // Returns how many associations were removed.
-    std::size_t dropExpired();
-    std::size_t associationCount() const;
+  // Returns how many associations were removed.
+  std::size_t dropExpired();
+  std::size_t associationCount() const;
 
-    // Identifiers longer than this are refused as malformed.
-    static constexpr std::size_t kMaxSessionIdentifierLength = 256;
+  // Identifiers longer than this are refused as malformed.
+  static constexpr std::size_t kMaxSessionIdentifierLength = 256;
 
-private:
-    struct Association;
-    struct KeyFree {
-        void operator()(EVP_PKEY *key) const { EVP_PKEY_free(key); }
-    };
+ private:
+  struct Association;
+  struct KeyFree {
+    void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
+  };
 
-    std::shared_ptr<Association> find(std::string_view sessionIdentifier, TarvexSAPServerStatus &status) const;
+  std::shared_ptr<Association> find(std::string_view sessionIdentifier, TarvexSAPServerStatus& status) const;
 
-    std::vector<uint8_t> certificate_;
-    std::unique_ptr<EVP_PKEY, KeyFree> key_;
-    Clock clock_;
-    mutable std::shared_mutex mutex_;
-    std::unordered_map<std::string, std::shared_ptr<Association>> associations_; // guarded by mutex_
-    static constexpr std::size_t kMinPruneThreshold = 1024;
-    std::size_t pruneThreshold_ = kMinPruneThreshold; // guarded by mutex_
+  std::vector<uint8_t> certificate_;
+  std::unique_ptr<EVP_PKEY, KeyFree> key_;
+  Clock clock_;
+  mutable std::shared_mutex mutex_;
+  std::unordered_map<std::string, std::shared_ptr<Association>> associations_;  // guarded by mutex_
+  static constexpr std::size_t kMinPruneThreshold = 1024;
+  std::size_t pruneThreshold_ = kMinPruneThreshold;  // guarded by mutex_
 };

@@ -9,6 +9,6 @@
 namespace tsap {
 
 // On success returns kTarvexSAPOK and the certificate's public key.
-int32_t acceptSetupCertificate(const DeviceConfig &config, Bytes certificate, PKeyPtr &publicKey);
+int32_t acceptSetupCertificate(const DeviceConfig& config, Bytes certificate, PKeyPtr& publicKey);
 
-} // namespace tsap
+}  // namespace tsap

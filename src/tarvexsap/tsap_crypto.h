@@ -3,8 +3,6 @@
 // failure by returning false (or null); none throws. Internal to the library.
 #pragma once
 
-#include "tarvexsap/tsap_secret.h"
-
 #include <openssl/evp.h>
 #include <openssl/x509.h>
 
@@ -14,13 +12,15 @@
 #include <memory>
 #include <span>
 
+#include "tarvexsap/tsap_secret.h"
+
 namespace tsap {
 
 struct PKeyFree {
-    void operator()(EVP_PKEY *key) const { EVP_PKEY_free(key); }
+  void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
 };
 struct X509Free {
-    void operator()(X509 *cert) const { X509_free(cert); }
+  void operator()(X509* cert) const { X509_free(cert); }
 };
 using PKeyPtr = std::unique_ptr<EVP_PKEY, PKeyFree>;
 using X509Ptr = std::unique_ptr<X509, X509Free>;
@@ -29,24 +29,22 @@ using Bytes = std::span<const uint8_t>;
 using Digest = std::array<uint8_t, 32>;
 
 bool randomBytes(std::span<uint8_t> out);
-bool sha256(std::initializer_list<Bytes> parts, Digest &out);
-bool hmacSha256(Bytes key, std::initializer_list<Bytes> parts, Digest &out);
+bool sha256(std::initializer_list<Bytes> parts, Digest& out);
+bool hmacSha256(Bytes key, std::initializer_list<Bytes> parts, Digest& out);
 bool hkdfSha256(Bytes ikm, Bytes salt, Bytes info, std::span<uint8_t> out);
 
 // Generates an X25519 key pair and writes its raw public key.
 PKeyPtr x25519Generate(std::span<uint8_t, 32> publicKey);
 // Shared secret with a raw peer public key; false when derivation fails or the result is all
 // zero (a low-order peer point).
-bool x25519Derive(EVP_PKEY *privateKey, std::span<const uint8_t, 32> peerPublic, Secret<32> &shared);
+bool x25519Derive(EVP_PKEY* privateKey, std::span<const uint8_t, 32> peerPublic, Secret<32>& shared);
 
-bool ed25519Sign(EVP_PKEY *privateKey, Bytes message, std::span<uint8_t, 64> signature);
-bool ed25519Verify(EVP_PKEY *publicKey, Bytes message, std::span<const uint8_t, 64> signature);
+bool ed25519Sign(EVP_PKEY* privateKey, Bytes message, std::span<uint8_t, 64> signature);
+bool ed25519Verify(EVP_PKEY* publicKey, Bytes message, std::span<const uint8_t, 64> signature);
 
 bool equalConstantTime(Bytes a, Bytes b);
 
 // Wraps caller bytes that may be a null pointer when the length is zero.
-inline Bytes bytesOf(const uint8_t *data, std::size_t len) {
-    return len == 0 ? Bytes() : Bytes(data, len);
-}
+inline Bytes bytesOf(const uint8_t* data, std::size_t len) { return len == 0 ? Bytes() : Bytes(data, len); }
 
-} // namespace tsap
+}  // namespace tsap

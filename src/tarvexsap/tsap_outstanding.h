@@ -2,26 +2,26 @@
 // the lowest (oldest) is dropped, so an unanswered request cannot pin memory for ever.
 #pragma once
 
-#include "tarvexsap/tsap_wire.h"
-
 #include <cstdint>
 #include <set>
+
+#include "tarvexsap/tsap_wire.h"
 
 namespace tsap {
 
 class OutstandingSeqs {
-public:
-    explicit OutstandingSeqs(std::size_t capacity = kMaxOutstanding) : capacity_(capacity) {}
-    void add(uint64_t seq);
-    // Removes seq and answers whether it was outstanding.
-    bool take(uint64_t seq);
-    bool contains(uint64_t seq) const { return seqs_.count(seq) != 0; }
-    std::size_t size() const { return seqs_.size(); }
-    void clear() { seqs_.clear(); }
+ public:
+  explicit OutstandingSeqs(std::size_t capacity = kMaxOutstanding) : capacity_(capacity) {}
+  void add(uint64_t seq);
+  // Removes seq and answers whether it was outstanding.
+  bool take(uint64_t seq);
+  bool contains(uint64_t seq) const { return seqs_.count(seq) != 0; }
+  std::size_t size() const { return seqs_.size(); }
+  void clear() { seqs_.clear(); }
 
-private:
-    std::size_t capacity_;
-    std::set<uint64_t> seqs_;
+ private:
+  std::size_t capacity_;
+  std::set<uint64_t> seqs_;
 };
 
-} // namespace tsap
+}  // namespace tsap

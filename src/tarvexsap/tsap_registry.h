@@ -3,17 +3,17 @@
 // Thread-safe. Internal to the library.
 #pragma once
 
-#include "tarvexsap/tsap_device_context.h"
-
 #include <memory>
+
+#include "tarvexsap/tsap_device_context.h"
 
 namespace tsap {
 
-QVSAPContextOpaque_ *registerContext(std::shared_ptr<DeviceContext> context);
+QVSAPContextOpaque_* registerContext(std::shared_ptr<DeviceContext> context);
 // Null when the handle is not live.
-std::shared_ptr<DeviceContext> findContext(const QVSAPContextOpaque_ *handle);
+std::shared_ptr<DeviceContext> findContext(const QVSAPContextOpaque_* handle);
 // Removes the handle; null when it was not live.
-std::shared_ptr<DeviceContext> unregisterContext(const QVSAPContextOpaque_ *handle);
+std::shared_ptr<DeviceContext> unregisterContext(const QVSAPContextOpaque_* handle);
 std::size_t liveContextCount();
 
-} // namespace tsap
+}  // namespace tsap

@@ -3,22 +3,22 @@
 // Below: refused. Zero: never valid. Not thread-safe; the owner locks.
 #pragma once
 
-#include "tarvexsap/tsap_wire.h"
-
 #include <bitset>
 #include <cstdint>
+
+#include "tarvexsap/tsap_wire.h"
 
 namespace tsap {
 
 class ReplayWindow {
-public:
-    // Records seq and answers true if it had not been seen and is not below the window.
-    bool accept(uint64_t seq);
-    uint64_t highest() const { return highest_; }
+ public:
+  // Records seq and answers true if it had not been seen and is not below the window.
+  bool accept(uint64_t seq);
+  uint64_t highest() const { return highest_; }
 
-private:
-    uint64_t highest_ = 0;
-    std::bitset<kReplayWindow> seen_; // bit seq % kReplayWindow, for seqs inside the window
+ private:
+  uint64_t highest_ = 0;
+  std::bitset<kReplayWindow> seen_;  // bit seq % kReplayWindow, for seqs inside the window
 };
 
-} // namespace tsap
+}  // namespace tsap

@@ -13,21 +13,21 @@ namespace tsap {
 
 template <std::size_t N>
 class Secret {
-public:
-    Secret() { bytes_.fill(0); }
-    ~Secret() { clear(); }
-    Secret(const Secret &) = delete;
-    Secret &operator=(const Secret &) = delete;
+ public:
+  Secret() { bytes_.fill(0); }
+  ~Secret() { clear(); }
+  Secret(const Secret&) = delete;
+  Secret& operator=(const Secret&) = delete;
 
-    void clear() { OPENSSL_cleanse(bytes_.data(), bytes_.size()); }
-    uint8_t *data() { return bytes_.data(); }
-    const uint8_t *data() const { return bytes_.data(); }
-    static constexpr std::size_t size() { return N; }
-    std::span<uint8_t, N> span() { return std::span<uint8_t, N>(bytes_); }
-    std::span<const uint8_t, N> span() const { return std::span<const uint8_t, N>(bytes_); }
+  void clear() { OPENSSL_cleanse(bytes_.data(), bytes_.size()); }
+  uint8_t* data() { return bytes_.data(); }
+  const uint8_t* data() const { return bytes_.data(); }
+  static constexpr std::size_t size() { return N; }
+  std::span<uint8_t, N> span() { return std::span<uint8_t, N>(bytes_); }
+  std::span<const uint8_t, N> span() const { return std::span<const uint8_t, N>(bytes_); }
 
-private:
-    std::array<uint8_t, N> bytes_;
+ private:
+  std::array<uint8_t, N> bytes_;
 };
 
-} // namespace tsap
+}  // namespace tsap

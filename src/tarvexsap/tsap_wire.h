@@ -24,7 +24,7 @@ inline constexpr std::size_t kMacSize = 32;
 
 inline constexpr std::size_t kRequestSize = 90;
 inline constexpr std::size_t kSessionInfoSize = 129;
-inline constexpr std::size_t kSessionInfoSignedPrefix = 65; // version, server key, server nonce
+inline constexpr std::size_t kSessionInfoSignedPrefix = 65;  // version, server key, server nonce
 inline constexpr std::size_t kSignatureSize = kSeqSize + kMacSize;
 
 // Unanswered device signatures kept, and width of the server's replay window.
@@ -42,32 +42,32 @@ using SessionInfoBytes = std::array<uint8_t, kSessionInfoSize>;
 using SignatureBytes = std::array<uint8_t, kSignatureSize>;
 
 struct HandshakeRequest {
-    uint8_t idLength = 0;
-    std::array<uint8_t, kHardwareIDMax> id{};
-    std::array<uint8_t, kKeySize> clientPublic{};
-    std::array<uint8_t, kNonceSize> clientNonce{};
+  uint8_t idLength = 0;
+  std::array<uint8_t, kHardwareIDMax> id{};
+  std::array<uint8_t, kKeySize> clientPublic{};
+  std::array<uint8_t, kNonceSize> clientNonce{};
 };
 
 struct SessionInfo {
-    std::array<uint8_t, kKeySize> serverPublic{};
-    std::array<uint8_t, kNonceSize> serverNonce{};
-    std::array<uint8_t, kEd25519SignatureSize> signature{};
+  std::array<uint8_t, kKeySize> serverPublic{};
+  std::array<uint8_t, kNonceSize> serverNonce{};
+  std::array<uint8_t, kEd25519SignatureSize> signature{};
 };
 
 // Bytes after idLength in `id` are written as zero whatever they hold.
-RequestBytes encodeRequest(const HandshakeRequest &request);
+RequestBytes encodeRequest(const HandshakeRequest& request);
 // False unless: exactly 90 bytes, magic, version 1, n <= 20 and zero padding after n.
-bool parseRequest(std::span<const uint8_t> bytes, HandshakeRequest &request);
+bool parseRequest(std::span<const uint8_t> bytes, HandshakeRequest& request);
 
-SessionInfoBytes encodeSessionInfo(const SessionInfo &info);
+SessionInfoBytes encodeSessionInfo(const SessionInfo& info);
 // False unless exactly 129 bytes with version 1.
-bool parseSessionInfo(std::span<const uint8_t> bytes, SessionInfo &info);
+bool parseSessionInfo(std::span<const uint8_t> bytes, SessionInfo& info);
 
 void putSeq(uint64_t seq, std::span<uint8_t, kSeqSize> out);
 uint64_t getSeq(std::span<const uint8_t, kSeqSize> in);
 
 inline std::span<const uint8_t> labelBytes(std::string_view label) {
-    return {reinterpret_cast<const uint8_t *>(label.data()), label.size()};
+  return {reinterpret_cast<const uint8_t*>(label.data()), label.size()};
 }
 
-} // namespace tsap
+}  // namespace tsap

@@ -4,6 +4,8 @@
 // callbacks run, the installed interface's own types; and what zlkactl adds: required options,
 // options turned into exactly the arguments given, answers and errors printed (as JSON with
 // --json), one exit status per class of failure, and the settings suite.
+#include "zlka/client.h"
+
 #include <gmock/gmock.h>
 #include <systemd/sd-bus.h>
 
@@ -13,10 +15,10 @@
 #include <cstring>
 #include <fstream>
 #include <functional>
+#include <future>
 #include <limits>
 #include <map>
 #include <memory>
-#include <future>
 #include <mutex>
 #include <set>
 #include <sstream>
@@ -26,7 +28,6 @@
 #include "client/zlka_client.h"
 #include "common/child_process.h"
 #include "platform/values/json.h"
-#include "zlka/client.h"
 #include "zlkactl/command_line.h"
 #include "zlkactl/commands.h"
 #include "zlkactl/token_input.h"
@@ -45,7 +46,8 @@ using zlkatest::PrivateBus;
 
 std::string hex(const void* data, size_t length) {
   std::string out;
-  for (const uint8_t* b = static_cast<const uint8_t*>(data); length-- > 0; ++b) out += {"0123456789abcdef"[*b >> 4], "0123456789abcdef"[*b & 15]};
+  for (const uint8_t* b = static_cast<const uint8_t*>(data); length-- > 0; ++b)
+    out += {"0123456789abcdef"[*b >> 4], "0123456789abcdef"[*b & 15]};
   return out;
 }
 
@@ -66,15 +68,26 @@ std::string wireValue(sd_bus_message* m) {
     sd_bus_message_exit_container(m);
     return type == 'a' ? "a" + std::string(contents) + "[" + inner + "]" : type == 'v' ? "<" + inner + ">" : inner;
   }
-  union { int b; int64_t x; uint64_t t; double d; const char* s; } v{};
+  union {
+    int b;
+    int64_t x;
+    uint64_t t;
+    double d;
+    const char* s;
+  } v{};
   if (!std::strchr("bxtds", type) || sd_bus_message_read_basic(m, type, &v) <= 0) return "?";
   std::ostringstream text;
   text << type << ':';
-  if (type == 'b') text << (v.b ? "true" : "false");
-  else if (type == 'x') text << v.x;
-  else if (type == 't') text << v.t;
-  else if (type == 'd') text << v.d;
-  else text << '"' << v.s << '"';
+  if (type == 'b')
+    text << (v.b ? "true" : "false");
+  else if (type == 'x')
+    text << v.x;
+  else if (type == 't')
+    text << v.t;
+  else if (type == 'd')
+    text << v.d;
+  else
+    text << '"' << v.s << '"';
   return text.str();
 }
 
@@ -97,7 +110,8 @@ class EchoService {
     std::string member = sd_bus_message_get_member(m);
     if (member == zlka_client::kMetadataMethod)
       return sd_bus_reply_method_return(m, "sss", "ppid-1", "en_US", R"({"plan":"basic","seats":2})") >= 0;
-    if (member == zlka_client::kActivationMethod) return sd_bus_reply_method_return(m, "ay", 4, 0xde, 0xad, 0xbe, 0xef) >= 0;
+    if (member == zlka_client::kActivationMethod)
+      return sd_bus_reply_method_return(m, "ay", 4, 0xde, 0xad, 0xbe, 0xef) >= 0;
     return sd_bus_reply_method_return(m, "") >= 0;
   }
   static bool hold(sd_bus_message*) { return false; }
@@ -160,8 +174,12 @@ class EchoService {
 };
 
 // A result as text: the answer, or "domain code: description".
-std::string shown(const platform::Error& e) { return e.domain() + " " + std::to_string(e.code()) + ": " + e.localizedDescription(); }
-std::string shown(const zlka_client::MetadataReply& r) { return r.ppid + " " + r.locale + " " + *platform::json::serialize(r.metadata); }
+std::string shown(const platform::Error& e) {
+  return e.domain() + " " + std::to_string(e.code()) + ": " + e.localizedDescription();
+}
+std::string shown(const zlka_client::MetadataReply& r) {
+  return r.ppid + " " + r.locale + " " + *platform::json::serialize(r.metadata);
+}
 std::string shown(const platform::Data& data) { return hex(data.bytes(), data.length()); }
 std::string shown(const zlka_client::Confirmation&) { return "confirmed"; }
 std::string shown(const platform::Array& values) {
@@ -214,7 +232,8 @@ class ClientTest : public testing::Test {
   // The calls the service received since this was last asked, one a line.
   std::string newCalls() {
     std::string out;
-    for (const auto& calls = service->calls(); seen < calls.size(); ++seen) out += (out.empty() ? "" : "\n") + calls[seen];
+    for (const auto& calls = service->calls(); seen < calls.size(); ++seen)
+      out += (out.empty() ? "" : "\n") + calls[seen];
     return out;
   }
 
@@ -236,21 +255,35 @@ Dictionary nested(int levels) {
 
 TEST(ClientErrors, BusErrorsMapBackToDomainAndCode) {
   const std::string op = "com.kestro.ZLKAuthentication.Error.", bus = "org.freedesktop.DBus.Error.";
-  const char* const operationErrors[] = {"Unknown", "MissingEntitlement", "InvalidParameter", "Internal", "Network", "Server"};
+  const char* const operationErrors[] = {"Unknown", "MissingEntitlement", "InvalidParameter", "Internal", "Network",
+                                         "Server"};
   for (int64_t code = -1; code >= -6; --code)  // exactly the daemon's error, nothing added
     EXPECT_EQ(zlka_client::errorFromBusError(op + operationErrors[-code - 1], "m"),
               Error(kOperation, code, Dictionary{{platform::LocalizedDescriptionKey, "m"}}));
-  EXPECT_EQ(zlka_client::errorFromBusError(op + "Server", ""), Error(kOperation, -6));  // the description is the error's own
+  EXPECT_EQ(zlka_client::errorFromBusError(op + "Server", ""),
+            Error(kOperation, -6));  // the description is the error's own
   // Any other name stays in the client domain with its name and message: a refusal (4) or, where
   // nothing answered, the service unreachable (2).
-  const std::pair<std::string, int64_t> otherErrors[] = {
-      {op + "Bogus", 4}, {op, 4}, {bus + "InvalidArgs", 4}, {bus + "AccessDenied", 4}, {bus + "ServiceUnknown", 2},
-      {bus + "NameHasNoOwner", 2}, {bus + "NoReply", 2}, {bus + "Timeout", 2}, {bus + "TimedOut", 2},
-      {bus + "Disconnected", 2}, {bus + "NoServer", 2}, {bus + "NoNetwork", 2}, {bus + "Spawn.ExecFailed", 2}};
+  const std::pair<std::string, int64_t> otherErrors[] = {{op + "Bogus", 4},
+                                                         {op, 4},
+                                                         {bus + "InvalidArgs", 4},
+                                                         {bus + "AccessDenied", 4},
+                                                         {bus + "ServiceUnknown", 2},
+                                                         {bus + "NameHasNoOwner", 2},
+                                                         {bus + "NoReply", 2},
+                                                         {bus + "Timeout", 2},
+                                                         {bus + "TimedOut", 2},
+                                                         {bus + "Disconnected", 2},
+                                                         {bus + "NoServer", 2},
+                                                         {bus + "NoNetwork", 2},
+                                                         {bus + "Spawn.ExecFailed", 2}};
   for (const auto& [name, code] : otherErrors) {
     Error e = zlka_client::errorFromBusError(name, "m");
-    EXPECT_THAT(shown(e), testing::AllOf(testing::StartsWith(kClient + (" " + std::to_string(code))), HasSubstr(name + ": m"))) << name;
-    EXPECT_EQ(*e.userInfo()->at(zlka_client::kBusErrorNameKey).string() + " " + *e.userInfo()->at(zlka_client::kBusErrorMessageKey).string(),
+    EXPECT_THAT(shown(e),
+                testing::AllOf(testing::StartsWith(kClient + (" " + std::to_string(code))), HasSubstr(name + ": m")))
+        << name;
+    EXPECT_EQ(*e.userInfo()->at(zlka_client::kBusErrorNameKey).string() + " " +
+                  *e.userInfo()->at(zlka_client::kBusErrorMessageKey).string(),
               name + " m");
   }
   // Failures to send: arguments that cannot be encoded (3), or no one to send them to (2).
@@ -264,26 +297,45 @@ TEST(ClientErrors, BusStringsAreWellFormedUTF8WithoutNUL) {
                            "\xef\xbf\xbf", "\xf0\x90\x80\x80", "\xf1\x80\x80\x80", "\xf4\x8f\xbf\xbf", "caf\xc3\xa9"})
     EXPECT_TRUE(zlka_client::isBusString(good)) << testing::PrintToString(std::string(good));
   using namespace std::string_literals;
-  for (const std::string& bad : {"a\0b"s, "\xc0\x80"s, "\xc1\xbf"s, "\xe0\x9f\xbf"s, "\xf0\x8f\xbf\xbf"s,  // NUL, overlong
-                                "\xed\xa0\x80"s, "\xed\xbf\xbf"s, "\xf4\x90\x80\x80"s, "\xf5\x80\x80\x80"s,  // surrogates, past U+10FFFF
-                                "\xc3"s, "\xf0\x9f\x98"s, "\xc3\x28"s, "\x80"s, "\xff"s})  // cut short, no lead byte
+  for (const std::string& bad :
+       {"a\0b"s, "\xc0\x80"s, "\xc1\xbf"s, "\xe0\x9f\xbf"s, "\xf0\x8f\xbf\xbf"s,     // NUL, overlong
+        "\xed\xa0\x80"s, "\xed\xbf\xbf"s, "\xf4\x90\x80\x80"s, "\xf5\x80\x80\x80"s,  // surrogates, past U+10FFFF
+        "\xc3"s, "\xf0\x9f\x98"s, "\xc3\x28"s, "\x80"s, "\xff"s})                    // cut short, no lead byte
     EXPECT_FALSE(zlka_client::isBusString(bad)) << testing::PrintToString(bad);
 }
 
 TEST_F(ClientTest, CallsSendExactlyTheirArgumentsAndDecodeTheAnswer) {
   const uint64_t int64Max = std::numeric_limits<int64_t>::max();
-  const Dictionary info{{"flag", true}, {"name", "x"}, {"count", int64_t{-3}}, {"small", uint64_t{5}}, {"int64max", int64Max},
-                        {"above", int64Max + 1}, {"ratio", 1.5}, {"blob", Data::fromString("\x01\x02")},
-                        {"list", Array{Value(1), Value("a")}}, {"nested", Dictionary{{"n", Array{}}}}};
+  const Dictionary info{{"flag", true},
+                        {"name", "x"},
+                        {"count", int64_t{-3}},
+                        {"small", uint64_t{5}},
+                        {"int64max", int64Max},
+                        {"above", int64Max + 1},
+                        {"ratio", 1.5},
+                        {"blob", Data::fromString("\x01\x02")},
+                        {"list", Array{Value(1), Value("a")}},
+                        {"nested", Dictionary{{"n", Array{}}}}};
   std::string deepest = "s:\"leaf\"=<b:true>", tooDeep = "requestInfo";
   for (int i = 0; i < zlka_client::kMaxRequestInfoDepth; ++i) tooDeep += ".in";
   for (int i = 1; i < zlka_client::kMaxRequestInfoDepth; ++i) deepest = "s:\"in\"=<a{sv}[" + deepest + "]>";
-  auto metadata = [](zlka_client::MetadataArguments a) { return [a](ZLKAClient& c) { return shown(c.requestMetadata(a)); }; };
-  auto activation = [](zlka_client::TokenArguments a) { return [a](ZLKAClient& c) { return shown(c.requestActivation(a)); }; };
-  auto confirmation = [](zlka_client::TokenArguments a) { return [a](ZLKAClient& c) { return shown(c.confirmActivation(a)); }; };
-  auto raw = [](const char* method, ZLKAClient::ArgumentWriter w) { return [=](ZLKAClient& c) { return shown(c.callRaw(method, w)); }; };
-  auto reply = [](auto... arguments) { return [=](sd_bus_message* m) { return sd_bus_reply_method_return(m, arguments...) >= 0; }; };
-  const std::string refused = "ZLKAClientErrorDomain 3: Cannot send the call: ", malformed = "ZLKAClientErrorDomain 5: The service's answer is malformed: ";
+  auto metadata = [](zlka_client::MetadataArguments a) {
+    return [a](ZLKAClient& c) { return shown(c.requestMetadata(a)); };
+  };
+  auto activation = [](zlka_client::TokenArguments a) {
+    return [a](ZLKAClient& c) { return shown(c.requestActivation(a)); };
+  };
+  auto confirmation = [](zlka_client::TokenArguments a) {
+    return [a](ZLKAClient& c) { return shown(c.confirmActivation(a)); };
+  };
+  auto raw = [](const char* method, ZLKAClient::ArgumentWriter w) {
+    return [=](ZLKAClient& c) { return shown(c.callRaw(method, w)); };
+  };
+  auto reply = [](auto... arguments) {
+    return [=](sd_bus_message* m) { return sd_bus_reply_method_return(m, arguments...) >= 0; };
+  };
+  const std::string refused = "ZLKAClientErrorDomain 3: Cannot send the call: ",
+                    malformed = "ZLKAClientErrorDomain 5: The service's answer is malformed: ";
   // clang-format off
   const struct { const char* what; EchoService::Answer answer; std::function<std::string(ZLKAClient&)> call; std::string sent, result; } rows[] = {
       {"every kind of argument", nullptr, metadata({Data::fromString("\x0a\xff"), "U-1", "en_US", info}),
@@ -332,8 +384,9 @@ TEST_F(ClientTest, CallsSendExactlyTheirArgumentsAndDecodeTheAnswer) {
 }
 
 TEST_F(ClientTest, CallsThatCanGetNoAnswerEndAsUnreachable) {
-  const std::string noReply = "ZLKAClientErrorDomain 2: The service com.kestro.ZLKAuthentication.ZLKANetwork cannot be reached "
-                              "(org.freedesktop.DBus.Error.NoReply";
+  const std::string noReply =
+      "ZLKAClientErrorDomain 2: The service com.kestro.ZLKAuthentication.ZLKANetwork cannot be reached "
+      "(org.freedesktop.DBus.Error.NoReply";
   service->answerWith(EchoService::hold);
   auto impatient = connect(std::chrono::milliseconds(20));
   EXPECT_THAT(shown(impatient->confirmActivation({})), HasSubstr(noReply));
@@ -362,13 +415,15 @@ TEST(ClientConnect, ABusThatCannotBeReachedFailsTheConnection) {
   EXPECT_THAT(shown(client.value()->confirmActivation({})), HasSubstr("(org.freedesktop.DBus.Error.ServiceUnknown"));
   auto missing = ZLKAClient::connect({.bus = "unix:path=/nonexistent/zlka"});
   EXPECT_EQ(missing.ok() ? "connected" : shown(missing.error()),
-            "ZLKAClientErrorDomain 1: Cannot connect to the bus at \"unix:path=/nonexistent/zlka\": No such file or directory.");
+            "ZLKAClientErrorDomain 1: Cannot connect to the bus at \"unix:path=/nonexistent/zlka\": No such file or "
+            "directory.");
   std::map<std::string, std::string> saved;  // the session bus is found through these
   for (const char* name : {"DBUS_SESSION_BUS_ADDRESS", "XDG_RUNTIME_DIR"})
     if (const char* value = std::getenv(name)) saved[name] = value, unsetenv(name);
   auto session = ZLKAClient::connect({.bus = "session"});
-  EXPECT_EQ(session.ok() ? "connected" : shown(session.error()), "ZLKAClientErrorDomain 1: Cannot connect to the session bus: "
-                                                                  "no session bus (DBUS_SESSION_BUS_ADDRESS and XDG_RUNTIME_DIR are unset).");
+  EXPECT_EQ(session.ok() ? "connected" : shown(session.error()),
+            "ZLKAClientErrorDomain 1: Cannot connect to the session bus: "
+            "no session bus (DBUS_SESSION_BUS_ADDRESS and XDG_RUNTIME_DIR are unset).");
   for (const auto& [name, value] : saved) setenv(name.c_str(), value.c_str(), 1);
 }
 
@@ -379,12 +434,16 @@ TEST_F(ClientTest, AsyncCallbacksRunOnceEachOnTheClientsOwnThread) {
     client->requestActivationAsync({}, inbox.callback<Data>());
     client->confirmActivationAsync({}, inbox.callback<zlka_client::Confirmation>());
   }
-  client->requestMetadataAsync({.requestInfo = Dictionary{{"gone", Value()}}}, inbox.callback<zlka_client::MetadataReply>());
+  client->requestMetadataAsync({.requestInfo = Dictionary{{"gone", Value()}}},
+                               inbox.callback<zlka_client::MetadataReply>());
   std::vector<std::string> answers = inbox.wait(61);
   std::map<std::string, int> counts;
   for (const std::string& answer : answers) ++counts[answer.substr(0, 24)];
-  EXPECT_EQ(counts, (std::map<std::string, int>{{"ppid-1 en_US {\"plan\":\"ba", 20}, {"deadbeef", 20}, {"confirmed", 20},
-                                                 {"ZLKAClientErrorDomain 3:", 1}}));  // the last one refused, still called back
+  EXPECT_EQ(counts,
+            (std::map<std::string, int>{{"ppid-1 en_US {\"plan\":\"ba", 20},
+                                        {"deadbeef", 20},
+                                        {"confirmed", 20},
+                                        {"ZLKAClientErrorDomain 3:", 1}}));  // the last one refused, still called back
   EXPECT_EQ(answers.size(), 61u);
   EXPECT_EQ(inbox.threads().size(), 1u);
   EXPECT_FALSE(inbox.threads().count(std::this_thread::get_id()));
@@ -402,7 +461,8 @@ TEST_F(ClientTest, BlockingCallsAreAnsweredFromAnyThreadAndFromCallbacks) {
   EXPECT_EQ(answered, 8 * 12);
   // The event thread itself waits here, so the inner answer cannot come through its own loop.
   Inbox inner;
-  client->confirmActivationAsync({}, [&, callback = inner.callback<Data>()](auto) { callback(client->requestActivation({})); });
+  client->confirmActivationAsync(
+      {}, [&, callback = inner.callback<Data>()](auto) { callback(client->requestActivation({})); });
   EXPECT_EQ(inner.wait(1), std::vector<std::string>{"deadbeef"});
 }
 
@@ -435,7 +495,9 @@ TEST_F(ClientTest, ThePublicInterfaceSpeaksOnlyItsOwnTypes) {
   auto made = zlka::Client::connect({.bus = bus->address()});
   ASSERT_TRUE(made.ok());
   zlka::Client& c = *made.value();
-  auto text = [](const zlka::Error& e) { return e.domain + " " + std::to_string(e.code) + " " + e.busErrorName + ": " + e.description; };
+  auto text = [](const zlka::Error& e) {
+    return e.domain + " " + std::to_string(e.code) + " " + e.busErrorName + ": " + e.description;
+  };
   std::promise<std::string> refused, activated;
   std::thread::id refusedOn;
   c.requestMetadataAsync({.requestInfoJSON = "[1]"}, [&](zlka::Result<zlka::Metadata> r) {
@@ -445,17 +507,22 @@ TEST_F(ClientTest, ThePublicInterfaceSpeaksOnlyItsOwnTypes) {
   c.requestActivationAsync({.token = zlka::Bytes{1}}, [&](zlka::Result<zlka::Bytes> r) {
     activated.set_value(r ? hex(r.value().data(), r.value().size()) : text(r.error()));
   });
-  EXPECT_EQ(refused.get_future().get(), "ZLKAClientErrorDomain 3 : Cannot send the call: requestInfo is an array, not a JSON object.");
+  EXPECT_EQ(refused.get_future().get(),
+            "ZLKAClientErrorDomain 3 : Cannot send the call: requestInfo is an array, not a JSON object.");
   EXPECT_NE(refusedOn, std::this_thread::get_id());
   EXPECT_EQ(activated.get_future().get(), "deadbeef");
   auto metadata = c.requestMetadata({.requestInfoJSON = R"({"n":1})"});
-  EXPECT_EQ(metadata ? metadata.value().ppid + " " + metadata.value().metadataJSON : text(metadata.error()), R"(ppid-1 {"plan":"basic","seats":2})");
+  EXPECT_EQ(metadata ? metadata.value().ppid + " " + metadata.value().metadataJSON : text(metadata.error()),
+            R"(ppid-1 {"plan":"basic","seats":2})");
   service->answerWith(EchoService::error("org.freedesktop.DBus.Error.AccessDenied", "No."));
   auto denied = c.confirmActivation({});
   EXPECT_EQ(denied ? "confirmed" : text(denied.error()),
-            "ZLKAClientErrorDomain 4 org.freedesktop.DBus.Error.AccessDenied: The call was refused with org.freedesktop.DBus.Error.AccessDenied: No.");
-  EXPECT_EQ(newCalls(), "RequestActivationForToken a{sv}[s:\"token\"=<ay:01>]\n"
-                        "RequestMetadataForToken a{sv}[s:\"requestInfo\"=<a{sv}[s:\"n\"=<x:1>]>]\nConfirmActivationForToken a{sv}[]");
+            "ZLKAClientErrorDomain 4 org.freedesktop.DBus.Error.AccessDenied: The call was refused with "
+            "org.freedesktop.DBus.Error.AccessDenied: No.");
+  EXPECT_EQ(
+      newCalls(),
+      "RequestActivationForToken a{sv}[s:\"token\"=<ay:01>]\n"
+      "RequestMetadataForToken a{sv}[s:\"requestInfo\"=<a{sv}[s:\"n\"=<x:1>]>]\nConfirmActivationForToken a{sv}[]");
 }
 
 // Parses and runs, as main() does.
@@ -471,7 +538,8 @@ zlkatest::RunResult zlkactl(std::vector<std::string> arguments) {
 
 TEST_F(ClientTest, ZlkactlSendsWhatItIsGivenAndExitsByTheKindOfFailure) {
   zlkatest::TempDir dir;
-  const std::string token = (dir.path() / "token").string(), large = (dir.path() / "large").string(), b = bus->address();
+  const std::string token = (dir.path() / "token").string(), large = (dir.path() / "large").string(),
+                    b = bus->address();
   std::ofstream(token) << std::string("\x00\x01\xff", 3);
   std::ofstream(large) << std::string(zlkactl::kMaxTokenFileSize + 1, 'x');
   const std::string confirmed = R"(ConfirmActivationForToken a{sv}[s:"token"=<ay:01>,s:"uuid"=<s:"U">])";
@@ -540,9 +608,13 @@ TEST_F(ClientTest, ZlkactlSendsWhatItIsGivenAndExitsByTheKindOfFailure) {
   }
   // The other failures of a call: unreachable (3), input that cannot be sent (2), the rest (1).
   using zlka_client::ClientErrorCode;
-  for (const auto& [code, status] : {std::pair{ClientErrorCode::ServiceUnavailable, 3}, {ClientErrorCode::InvalidRequest, 2},
-                                     {ClientErrorCode::Refused, 1}, {ClientErrorCode::MalformedReply, 1}, {ClientErrorCode::Cancelled, 1}})
-    EXPECT_EQ(zlkactl::exitStatusFor({zlka::kClientErrorDomain, static_cast<int64_t>(code), "", ""}), status) << static_cast<int>(code);
+  for (const auto& [code, status] : {std::pair{ClientErrorCode::ServiceUnavailable, 3},
+                                     {ClientErrorCode::InvalidRequest, 2},
+                                     {ClientErrorCode::Refused, 1},
+                                     {ClientErrorCode::MalformedReply, 1},
+                                     {ClientErrorCode::Cancelled, 1}})
+    EXPECT_EQ(zlkactl::exitStatusFor({zlka::kClientErrorDomain, static_cast<int64_t>(code), "", ""}), status)
+        << static_cast<int>(code);
 }
 
 TEST(Zlkactl, DefaultsKeepJSONValuesAndPlainStrings) {
@@ -550,9 +622,14 @@ TEST(Zlkactl, DefaultsKeepJSONValuesAndPlainStrings) {
   const std::filesystem::path dir = temporary.path(), config = dir / "zlkad.toml";
   std::ofstream(config) << "[device]\ninternal_build = true\ndevice_class = \"AccessoryHub\"\n"
                            "[servers.prod]\nstatic_content = \"https://127.0.0.1:1\"\napi = \"https://127.0.0.1:1\"\n"
-                           "[sap]\ntrust_anchor = \"/x.pem\"\n[settings]\nsuite_dir = \"" << dir.string() << "\"\n";
+                           "[sap]\ntrust_anchor = \"/x.pem\"\n[settings]\nsuite_dir = \""
+                        << dir.string() << "\"\n";
   const std::string suite = (dir / "com.kestro.ZLKAuthentication.json").string();
-  const struct { std::vector<std::string> arguments; int status; std::string out, err; } rows[] = {
+  const struct {
+    std::vector<std::string> arguments;
+    int status;
+    std::string out, err;
+  } rows[] = {
       {{"write", "--force", "Plan", R"({"a":[1]})"}, 0, "", ""},
       {{"write", "--force", "Pair", "1,2"}, 0, "", ""},  // not one JSON value
       {{"read", "Plan"}, 0, "{\n  \"a\": [\n    1\n  ]\n}\n", ""},
@@ -560,8 +637,12 @@ TEST(Zlkactl, DefaultsKeepJSONValuesAndPlainStrings) {
       {{"read"}, 0, "{\n  \"Pair\": \"1,2\"\n}\n", ""},
       {{"read", "Plan"}, 1, "", "zlkactl: com.kestro.ZLKAuthentication has no value for 'Plan' (" + suite + ")\n"},
       // Only keys the daemon reads, unless forced: a misspelt one would be ignored silently.
-      {{"write", "ForceNetworkFailur", "true"}, 2, "", "zlkactl: zlkad reads no setting 'ForceNetworkFailur' (it reads Server, CustomServer, "
-       "StaticContentServer, TarvexSAPServer, ForceNetworkFailure, ForceTokenActivationFailure, ForceTokenConfirmationFailure, "
+      {{"write", "ForceNetworkFailur", "true"},
+       2,
+       "",
+       "zlkactl: zlkad reads no setting 'ForceNetworkFailur' (it reads Server, CustomServer, "
+       "StaticContentServer, TarvexSAPServer, ForceNetworkFailure, ForceTokenActivationFailure, "
+       "ForceTokenConfirmationFailure, "
        "ForceTarvexSAPFailure); --force writes it anyway\n"},
       {{"write", "ForceNetworkFailure", "true"}, 0, "", ""},
       {{"read", "ForceNetworkFailure"}, 0, "true\n", ""},

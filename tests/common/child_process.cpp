@@ -1,6 +1,7 @@
 #include "common/child_process.h"
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
@@ -8,13 +9,11 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <gtest/gtest.h>
-
 #include <atomic>
 #include <fstream>
-#include <thread>
 #include <sstream>
 #include <string_view>
+#include <thread>
 
 extern char** environ;
 
@@ -116,15 +115,18 @@ PrivateBus::PrivateBus(bool anyUser) {
          "</busconfig>\n";
   // The address is printed once the daemon listens.
   daemon_ = std::make_unique<ChildProcess>(
-      std::vector<std::string>{"/usr/bin/dbus-daemon", "--config-file=" + config.string(), "--nofork", "--print-address=1"},
+      std::vector<std::string>{"/usr/bin/dbus-daemon", "--config-file=" + config.string(), "--nofork",
+                               "--print-address=1"},
       directory_.path());
   std::string out;
   for (int i = 0; i < 3000 && (out = daemon_->standardOutput()).find('\n') == std::string::npos &&
                   !daemon_->waitExit(std::chrono::milliseconds(0));
        ++i)
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  if (out.find('\n') == std::string::npos) ADD_FAILURE() << "dbus-daemon printed no address: " << daemon_->standardError();
-  else address_ = out.substr(0, out.find('\n'));
+  if (out.find('\n') == std::string::npos)
+    ADD_FAILURE() << "dbus-daemon printed no address: " << daemon_->standardError();
+  else
+    address_ = out.substr(0, out.find('\n'));
 }
 
 }  // namespace zlkatest

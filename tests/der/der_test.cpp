@@ -56,7 +56,7 @@ constexpr DERDecodedItem kSentinel{0x1234, DERSlice{&kMarker, 77}};
 
 // The numbers are the decoder's ABI (4 and 6 reserved); two equal ones would hide a status.
 TEST(DERStatus, NumbersAreFixed) {
-  const std::vector<int> numbers{OK,  DER_STATUS_END_OF_SEQUENCE, DER_STATUS_UNEXPECTED_TAG,
+  const std::vector<int> numbers{OK,  DER_STATUS_END_OF_SEQUENCE,     DER_STATUS_UNEXPECTED_TAG,
                                  BAD, DER_STATUS_INCOMPLETE_SEQUENCE, OVER};
   EXPECT_EQ(numbers, (std::vector<int>{0, 1, 2, 3, 5, 7}));
 }

@@ -4,8 +4,8 @@
 #include <cmath>
 
 #include "network_fixture.h"
-#include "platform/values/base64.h"
 #include "platform/http/http_session.h"
+#include "platform/values/base64.h"
 
 namespace nettest {
 namespace {
@@ -231,8 +231,9 @@ TEST_F(NetworkTest, TheEntitlementGateComesBeforeArgumentsAndTraffic) {
   settings.privateData = false;
   platform::configureLog(settings);
   for (Op op : {Op::metadata, Op::activation, Op::confirmation})
-    expectFailure(run({.op = op, .uuid = std::nullopt, .locale = "xx_ZZ"}, peer(Value(platform::Array{"token-admin"})).get()),
-                  ZLKAErrorMissingEntitlement);
+    expectFailure(
+        run({.op = op, .uuid = std::nullopt, .locale = "xx_ZZ"}, peer(Value(platform::Array{"token-admin"})).get()),
+        ZLKAErrorMissingEntitlement);
   settings.privateData = true;
   platform::configureLog(settings);
   for (const char* line :

@@ -12,9 +12,10 @@ namespace {
 
 namespace fs = std::filesystem;
 
-const std::string kMinimal = "[device]\ninternal_build = true\ndevice_class = \"AccessoryHub\"\n[servers.prod]\n"
-                             "static_content = \"https://static.example.net/\"\napi = \"https://api.example.net:8443\"\n"
-                             "[sap]\ntrust_anchor = \"/etc/zlka/sap-root.pem\"\n";
+const std::string kMinimal =
+    "[device]\ninternal_build = true\ndevice_class = \"AccessoryHub\"\n[servers.prod]\n"
+    "static_content = \"https://static.example.net/\"\napi = \"https://api.example.net:8443\"\n"
+    "[sap]\ntrust_anchor = \"/etc/zlka/sap-root.pem\"\n";
 const fs::path kFile = fs::temp_directory_path() / ("zlkad-" + std::to_string(getpid()) + ".toml");
 
 std::string replaced(std::string text, const std::string& from, const std::string& to) {
@@ -39,15 +40,17 @@ TEST(Configuration, MinimalFileGetsTheDefaultsAndAFullOneWarnsOfUnknownKeys) {
   EXPECT_EQ(std::tuple(c->logLevel, c->privateData, c->maxWorkers, c->warnings.size()),
             std::tuple(platform::LogLevel::Default, false, 64u, 0u));
 
-  c = load(kMinimal + "[servers.ut]\nstatic_content = \"https://s\"\napi = \"https://a\"\n[tls]\nca_file = \"/ca.pem\"\n"
-                      "[settings]\nsuite_dir = \"/d\"\n[entitlements]\ndir = \"/e\"\n[log]\nlevel = \"debug\"\n"
-                      "private_data = true\ncolour = \"blue\"\n[service]\nmax_workers = 2\n[extra]\nx = 1\n", &error);
+  c = load(kMinimal +
+               "[servers.ut]\nstatic_content = \"https://s\"\napi = \"https://a\"\n[tls]\nca_file = \"/ca.pem\"\n"
+               "[settings]\nsuite_dir = \"/d\"\n[entitlements]\ndir = \"/e\"\n[log]\nlevel = \"debug\"\n"
+               "private_data = true\ncolour = \"blue\"\n[service]\nmax_workers = 2\n[extra]\nx = 1\n",
+           &error);
   ASSERT_TRUE(c) << error;
   EXPECT_EQ(c->servers.at("ut").api, "https://a");
   EXPECT_EQ(std::tie(c->caFile, c->settingsDirectory, c->entitlementsDirectory), std::tuple("/ca.pem", "/d", "/e"));
   EXPECT_EQ(std::tie(c->logLevel, c->privateData, c->maxWorkers), std::tuple(platform::LogLevel::Debug, true, 2u));
   EXPECT_EQ(c->warnings, (std::vector<std::string>{kFile.string() + ": unknown key 'extra' ignored",
-                                                    kFile.string() + ": unknown key 'log.colour' ignored"}));
+                                                   kFile.string() + ": unknown key 'log.colour' ignored"}));
   EXPECT_EQ(load(kMinimal + "[service]\nmax_workers = 4096\n", &error)->maxWorkers, 4096u);
 }
 
@@ -90,7 +93,8 @@ TEST(Configuration, BaseURLsAreAbsoluteHttpsWithoutPathQueryOrUser) {
   EXPECT_EQ(platform::normalizedBaseURL("https://h"), "https://h");
   EXPECT_EQ(platform::normalizedBaseURL("https://127.0.0.1:4443/"), "https://127.0.0.1:4443");
   EXPECT_EQ(platform::normalizedBaseURL("https://[::1]:4443"), "https://[::1]:4443");
-  for (const char* bad : {"", "h", "http://h", "https://", "https://h/p", "https://h?q=1", "https://h#f", "https://u:p@h", "ftp://h"})
+  for (const char* bad :
+       {"", "h", "http://h", "https://", "https://h/p", "https://h?q=1", "https://h#f", "https://u:p@h", "ftp://h"})
     EXPECT_FALSE(platform::normalizedBaseURL(bad)) << bad;
 }
 
@@ -110,7 +114,8 @@ TEST(DeviceFacts, AreReadOnceFromTheDeviceTableAndAMissingOrBrokenFileAnswersPro
           if (text) std::ofstream(kFile) << text;
           platform::setDeviceConfigPath(kFile);
           bool ok = platform::deviceAnswerBool("InternalBuild") == internal && !platform::deviceAnswerBool("Unknown") &&
-                    platform::deviceAnswerString("DeviceClass") == deviceClass && !platform::deviceAnswerString("Unknown");
+                    platform::deviceAnswerString("DeviceClass") == deviceClass &&
+                    !platform::deviceAnswerString("Unknown");
           std::ofstream(kFile) << "[device]\ninternal_build = " << (internal ? "false" : "true") << "\n";
           ok = ok && platform::deviceAnswerBool("InternalBuild") == internal;  // not read again
           fs::remove(kFile);

@@ -6,8 +6,8 @@
 #include <atomic>
 #include <thread>
 
-#include "common/log_capture.h"
 #include "common/child_process.h"
+#include "common/log_capture.h"
 #include "platform/bus/handles.h"
 #include "platform/dispatch/semaphore.h"
 
@@ -57,11 +57,13 @@ struct RunningListener {
   platform::Listener& listener = platform::Listener::serviceListener();
   std::atomic<bool> ended{false};
   std::jthread loop;
-  RunningListener(std::shared_ptr<const platform::Interface> interface, size_t maxCallsPerPeer,
-                  std::function<platform::EntitlementLookup(const platform::PeerCredentials&)> entitlementsForPeer = {}) {
+  RunningListener(
+      std::shared_ptr<const platform::Interface> interface, size_t maxCallsPerPeer,
+      std::function<platform::EntitlementLookup(const platform::PeerCredentials&)> entitlementsForPeer = {}) {
     platform::ListenerOptions options;
     options.bus = bus.address(), options.serviceName = kName, options.objectPath = kPath, options.notifyReady = false;
-    options.interface = interface, options.maxCallsPerPeer = maxCallsPerPeer, options.entitlementsForPeer = entitlementsForPeer;
+    options.interface = interface, options.maxCallsPerPeer = maxCallsPerPeer,
+    options.entitlementsForPeer = entitlementsForPeer;
     platform::Listener::configure(options);
     listener.setDelegate(std::make_shared<Accepting>(interface));
     loop = std::jthread([this] {
@@ -85,13 +87,14 @@ TEST(Listener, APeerWhoseIdentityIsSlowHoldsUpNoOtherPeerAndEachPeerIsIdentified
   platform::Semaphore release;  // bounded, so that a failing test still ends
   std::atomic<int> lookups{0};
   std::atomic<pid_t> firstPid{0};
-  RunningListener running(pingInterface(), 8, [&](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
-    if (lookups.fetch_add(1) == 0) {  // the first peer's lookup is held back until the test lets it go
-      firstPid = credentials.pid;
-      release.waitFor(30s);
-    }
-    return nullptr;
-  });
+  RunningListener running(
+      pingInterface(), 8, [&](const platform::PeerCredentials& credentials) -> platform::EntitlementLookup {
+        if (lookups.fetch_add(1) == 0) {  // the first peer's lookup is held back until the test lets it go
+          firstPid = credentials.pid;
+          release.waitFor(30s);
+        }
+        return nullptr;
+      });
   platform::BusPtr slow = connect(running.bus.address()), quick = connect(running.bus.address());
   ASSERT_TRUE(slow && quick);
   for (int i = 0;

@@ -67,8 +67,10 @@ TEST(Log, EntriesBelowTheMinimumAreNeitherFormattedNorWrittenAndPrivateDataRevea
     platform::log(*platform::Log::create("com.example.sub", "cat"), LogLevel::Fault, "f");
     const auto e = capture.entries();
     ASSERT_EQ(e.size(), 2u);
-    EXPECT_EQ(std::tuple(e[0].message, e[0].subsystem + e[0].category), std::tuple(privateData ? "1 abc" : "1 <private>", ""));
-    EXPECT_EQ(std::tuple(e[1].level, e[1].subsystem + "/" + e[1].category), std::tuple(LogLevel::Fault, "com.example.sub/cat"));
+    EXPECT_EQ(std::tuple(e[0].message, e[0].subsystem + e[0].category),
+              std::tuple(privateData ? "1 abc" : "1 <private>", ""));
+    EXPECT_EQ(std::tuple(e[1].level, e[1].subsystem + "/" + e[1].category),
+              std::tuple(LogLevel::Fault, "com.example.sub/cat"));
   }
 }
 
@@ -82,9 +84,10 @@ TEST(Log, StderrLinesCarryTimeIdentifierLevelAndModuleAndStayOneLine) {
   platform::configureLog({});
   const std::string stamp = "[0-9]{4}-[0-9]{2}-[0-9]{2} [0-9]{2}:[0-9]{2}:[0-9]{2}\\.[0-9]{3} test\\[" + pid + "\\] ";
   EXPECT_THAT(out, testing::MatchesRegex(stamp + "<error> \\[com\\.example\\.sub:cat\\] a\\\\nb\n" + stamp +
-                                           "<info> \\\\r\\\\x1b\\[31mforged\\\\t\\\\x7f\\\\x00\\.\n"));
+                                         "<info> \\\\r\\\\x1b\\[31mforged\\\\t\\\\x7f\\\\x00\\.\n"));
   using Names = std::pair<const char*, const char*>;  // module names must be printable and not empty
-  for (auto [subsystem, category] : {Names{"", "cat"}, Names{"sub", ""}, Names{"sub", "bad\ncat"}, Names{"bad\x7f", "c"}, Names{"s\x1f", "c"}})
+  for (auto [subsystem, category] :
+       {Names{"", "cat"}, Names{"sub", ""}, Names{"sub", "bad\ncat"}, Names{"bad\x7f", "c"}, Names{"s\x1f", "c"}})
     EXPECT_FALSE(platform::Log::create(subsystem, category)) << subsystem << "/" << category;
   EXPECT_TRUE(platform::Log::create("sub system", "a category"));
 }
@@ -96,7 +99,8 @@ TEST(Log, JournalEntriesNameTheCallersPlaceTheirModuleAndTheirEvent) {
   const auto e = capture.entries();
   ASSERT_EQ(e.size(), 1u);
   // The call's place, not the log back end's.
-  EXPECT_EQ(std::tuple(e[0].file, e[0].line, e[0].messageID), std::tuple("tests/platform/log_test.cpp", line, "3b3c29f1b71344dbb4e0a7e61382ddca"));
+  EXPECT_EQ(std::tuple(e[0].file, e[0].line, e[0].messageID),
+            std::tuple("tests/platform/log_test.cpp", line, "3b3c29f1b71344dbb4e0a7e61382ddca"));
   EXPECT_EQ(e[0].function, "TestBody");
   using Fields = std::vector<std::string>;
   platform::LogEntry entry{LogLevel::Error, "", "", "m", "src/platform/bus/listener.cpp", 7, "run", ""};
@@ -104,16 +108,27 @@ TEST(Log, JournalEntriesNameTheCallersPlaceTheirModuleAndTheirEvent) {
             (Fields{"MESSAGE=m", "PRIORITY=3", "SYSLOG_IDENTIFIER=zlkad", "ZLKA_SUBSYSTEM=com.kestro.ZLKAuthentication",
                     "ZLKA_CATEGORY=bus", "CODE_FILE=src/platform/bus/listener.cpp", "CODE_LINE=7", "CODE_FUNC=run"}));
   // A log object's own names win; the default log's category is the module of the call.
-  entry = {LogLevel::Fault, "com.example.sub", "cat", "m", "src/network/metadata_query.cpp", 1, "f", "6113ffeebbf84fa0b42d7f30bad01cc9"};
+  entry = {LogLevel::Fault,
+           "com.example.sub",
+           "cat",
+           "m",
+           "src/network/metadata_query.cpp",
+           1,
+           "f",
+           "6113ffeebbf84fa0b42d7f30bad01cc9"};
   EXPECT_THAT(platform::journalFields(entry, "zlkad"),
-              testing::IsSupersetOf({"ZLKA_SUBSYSTEM=com.example.sub", "ZLKA_CATEGORY=cat", "MESSAGE_ID=6113ffeebbf84fa0b42d7f30bad01cc9"}));
+              testing::IsSupersetOf({"ZLKA_SUBSYSTEM=com.example.sub", "ZLKA_CATEGORY=cat",
+                                     "MESSAGE_ID=6113ffeebbf84fa0b42d7f30bad01cc9"}));
   entry.subsystem = "";
   EXPECT_THAT(platform::journalFields(entry, "zlkad"), testing::Contains("ZLKA_CATEGORY=network"));
 }
 
 TEST(Log, LevelNamesAndJournalPriorities) {
-  for (const auto& [level, name, priority] : {std::tuple{LogLevel::Debug, "debug", 7}, {LogLevel::Info, "info", 6},
-           {LogLevel::Default, "default", 5}, {LogLevel::Error, "error", 3}, {LogLevel::Fault, "fault", 2}}) {
+  for (const auto& [level, name, priority] : {std::tuple{LogLevel::Debug, "debug", 7},
+                                              {LogLevel::Info, "info", 6},
+                                              {LogLevel::Default, "default", 5},
+                                              {LogLevel::Error, "error", 3},
+                                              {LogLevel::Fault, "fault", 2}}) {
     EXPECT_EQ(platform::logLevelName(level), name);
     EXPECT_EQ(platform::logLevelFromName(name), level);
     EXPECT_EQ(platform::journalPriority(level), priority);

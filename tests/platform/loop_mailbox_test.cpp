@@ -30,11 +30,11 @@ TEST(LoopMailbox, CloseEndsTheLoopOnceWhatWasPostedHasRunAndRefusesLaterPosts) {
   platform::LoopMailbox mailbox;
   ASSERT_EQ(mailbox.attach(event.get()), 0);
   // Bounds the loop, so that a close that does not end it fails the test instead of hanging it.
-  ASSERT_GE(sd_event_add_time_relative(
-                event.get(), nullptr, CLOCK_MONOTONIC, 30'000'000, 0,
-                [](sd_event_source* s, uint64_t, void*) { return sd_event_exit(sd_event_source_get_event(s), 1); },
-                nullptr),
-            0);
+  ASSERT_GE(
+      sd_event_add_time_relative(
+          event.get(), nullptr, CLOCK_MONOTONIC, 30'000'000, 0,
+          [](sd_event_source* s, uint64_t, void*) { return sd_event_exit(sd_event_source_get_event(s), 1); }, nullptr),
+      0);
   std::vector<int> ran;  // touched by the loop's thread only, read once it has ended
   std::jthread poster([&] {
     for (int i = 0; i < 100; ++i) EXPECT_TRUE(mailbox.post([&ran, i] { ran.push_back(i); }));

@@ -41,7 +41,8 @@ TEST(SerialQueue, RunsItemsOneAtATimeInSubmissionOrderAcrossProducers) {
   std::atomic<bool> overlapped{false};
   auto produce = [&](int p) {
     for (int i = 0; i < 2000; ++i)
-      queue->async([&, p, i] { overlapped = overlapped || inside.fetch_add(1) != 0, ran[p].push_back(i), inside.fetch_sub(1); });
+      queue->async(
+          [&, p, i] { overlapped = overlapped || inside.fetch_add(1) != 0, ran[p].push_back(i), inside.fetch_sub(1); });
   };
   std::thread other(produce, 1);
   produce(0);
@@ -59,7 +60,11 @@ TEST(SerialQueue, WorkSubmittedFromItsOwnWorkKeepsItsPlace) {
   auto queue = Queue::serial("test.serial.self-submit");
   std::string ran;
   Semaphore bSubmitted, cSubmitted;
-  queue->async([&] { queue->async([&] { ran += 'B'; }); bSubmitted.signal(); EXPECT_TRUE(arrives(cSubmitted)); });
+  queue->async([&] {
+    queue->async([&] { ran += 'B'; });
+    bSubmitted.signal();
+    EXPECT_TRUE(arrives(cSubmitted));
+  });
   ASSERT_TRUE(arrives(bSubmitted));
   queue->async([&] { ran += 'C'; });
   cSubmitted.signal();
@@ -74,7 +79,12 @@ TEST(ConcurrentQueue, RunsWidthItemsAtOnceAndABarrierAloneBetweenWhatCameBeforeA
   queue->sync([] {});  // a plain sync does not wait for work already running
   held.signal();
   std::atomic<int> done{0};
-  for (int i = 0; i < 4; ++i) queue->async([&] { started.signal(); EXPECT_TRUE(arrives(release)); done.fetch_add(1); });
+  for (int i = 0; i < 4; ++i)
+    queue->async([&] {
+      started.signal();
+      EXPECT_TRUE(arrives(release));
+      done.fetch_add(1);
+    });
   EXPECT_TRUE(arrives(started, 3));
   EXPECT_TRUE(staysAway(started));  // the fourth waits for a free thread
   queue->barrierAsync([&] {
@@ -83,7 +93,10 @@ TEST(ConcurrentQueue, RunsWidthItemsAtOnceAndABarrierAloneBetweenWhatCameBeforeA
     EXPECT_TRUE(arrives(releaseBarrier));
     done.fetch_add(1);
   });
-  queue->async([&] { EXPECT_EQ(done.load(), 5); afterStarted.signal(); });
+  queue->async([&] {
+    EXPECT_EQ(done.load(), 5);
+    afterStarted.signal();
+  });
   release.signal();
   EXPECT_TRUE(arrives(started));  // the fourth takes the freed thread
   release.signal();               // this one stays free
@@ -127,7 +140,12 @@ TEST(Queue, DroppingTheLastReferenceStillRunsEverythingSubmitted) {
       auto item = [&] { count.fetch_add(1) == 100 ? all.signal() : void(); };
       queue->async([&gate, self = fromOwnWork ? queue : nullptr] { EXPECT_TRUE(arrives(gate)); });
       for (int i = 0; i < 100; ++i) i == 50 ? queue->barrierAsync(item) : queue->async(item);
-      queue->async([&, raw] { raw->async([&, raw] { EXPECT_EQ(Queue::current(), raw); item(); }); });  // while draining
+      queue->async([&, raw] {
+        raw->async([&, raw] {
+          EXPECT_EQ(Queue::current(), raw);
+          item();
+        });
+      });  // while draining
       std::thread dropper([&dropping, last = std::move(queue)]() mutable { dropping.signal(), last.reset(); });
       ASSERT_TRUE(arrives(dropping));
       gate.signal();
@@ -150,7 +168,11 @@ TEST(WorkerPool, GrowsOnlyWhileWorkBlocksUpToItsBoundShrinksBackWhenIdleAndRunsE
     std::vector<std::shared_ptr<Queue>> queues;
     for (int i = 0; i < 20; ++i) {
       queues.push_back(Queue::serial("test.blocked." + std::to_string(i), &pool));
-      queues.back()->async([&] { started.signal(); EXPECT_TRUE(arrives(release)); finished.signal(); });
+      queues.back()->async([&] {
+        started.signal();
+        EXPECT_TRUE(arrives(release));
+        finished.signal();
+      });
     }
     // Blocked workers make room for more, up to the bound; the other queues wait their turn...
     ASSERT_TRUE(arrives(started, kBound));
@@ -214,12 +236,32 @@ TEST(QueueDeathTest, EmptyWorkAndZeroWidthThrowWaitingOnItselfAbortsAThrowingIte
   EXPECT_THROW(Queue::concurrent("test.reject.width", 0), std::invalid_argument);
   // The child re-runs the test binary instead of forking a process that has queue threads.
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH({ auto q = Queue::serial("test.death.s"); q->sync([&] { q->sync([] {}); }); }, "death\\.s.*sync");
-  EXPECT_DEATH({ auto q = Queue::concurrent("test.death.c"); q->sync([&] { q->sync([] {}); }); }, "death\\.c.*sync");
-  EXPECT_DEATH({ auto q = Queue::concurrent("test.death.b"); q->async([&] { q->barrierSync([] {}); }); q->barrierSync([] {}); },
-               "death\\.b.*barrierSync");
-  EXPECT_DEATH({ auto* pool = new platform::WorkerPool("test.death.pool", {}); pool->post([pool] { delete pool; }); sleep(30); },
-               "test\\.death\\.pool.*destroyed by its own worker");
+  EXPECT_DEATH(
+      {
+        auto q = Queue::serial("test.death.s");
+        q->sync([&] { q->sync([] {}); });
+      },
+      "death\\.s.*sync");
+  EXPECT_DEATH(
+      {
+        auto q = Queue::concurrent("test.death.c");
+        q->sync([&] { q->sync([] {}); });
+      },
+      "death\\.c.*sync");
+  EXPECT_DEATH(
+      {
+        auto q = Queue::concurrent("test.death.b");
+        q->async([&] { q->barrierSync([] {}); });
+        q->barrierSync([] {});
+      },
+      "death\\.b.*barrierSync");
+  EXPECT_DEATH(
+      {
+        auto* pool = new platform::WorkerPool("test.death.pool", {});
+        pool->post([pool] { delete pool; });
+        sleep(30);
+      },
+      "test\\.death\\.pool.*destroyed by its own worker");
   EXPECT_DEATH(Queue::serial("test.death.throw")->sync([] { throw std::runtime_error("item failed"); }),
                "test\\.death\\.throw.*item failed");
 }

@@ -33,7 +33,8 @@ TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {
   std::string suite = "{";
   for (size_t i = 0; i < std::size(rows); ++i) suite += "\"k" + std::to_string(i) + "\": " + rows[i].first + ", ";
   std::ofstream(dir / "suite.json") << suite + R"("s": "ut"})";
-  for (size_t i = 0; i < std::size(rows); ++i) EXPECT_EQ(store.boolForKey("k" + std::to_string(i)), rows[i].second) << rows[i].first;
+  for (size_t i = 0; i < std::size(rows); ++i)
+    EXPECT_EQ(store.boolForKey("k" + std::to_string(i)), rows[i].second) << rows[i].first;
   EXPECT_FALSE(store.boolForKey("missing"));
   EXPECT_EQ(store.stringForKey("s"), "ut");
   EXPECT_EQ(store.stringForKey("k1"), std::nullopt);  // strings only
@@ -41,7 +42,8 @@ TEST_F(SettingsStoreTest, BooleanIsATrueNumberOrYesTrueOneInAnyCase) {
 
 TEST_F(SettingsStoreTest, EveryLookupSeesTheFileAsItIsNowAndABrokenOneIsLoggedOncePerChange) {
   zlkatest::LogCapture log;
-  const std::pair<std::string, std::optional<std::string>> steps[] = {  // the file, then what "Server" reads
+  const std::pair<std::string, std::optional<std::string>> steps[] = {
+      // the file, then what "Server" reads
       {"", std::nullopt},  // no file
       {R"({"Server": "ut"})", "ut"},
       {R"({"Server": "maint", "Custom": "x"})", "maint"},
@@ -57,7 +59,8 @@ TEST_F(SettingsStoreTest, EveryLookupSeesTheFileAsItIsNowAndABrokenOneIsLoggedOn
   }
   const auto lines = log.entries();
   ASSERT_EQ(lines.size(), 2u) << log.dump();
-  EXPECT_TRUE(lines[0].message.starts_with("Settings suite suite is unreadable (" + (dir / "suite.json").string() + "): "));
+  EXPECT_TRUE(
+      lines[0].message.starts_with("Settings suite suite is unreadable (" + (dir / "suite.json").string() + "): "));
   EXPECT_NE(lines[1].message.find("not a JSON object"), std::string::npos);
 }
 
@@ -76,7 +79,8 @@ TEST_F(SettingsStoreTest, WritesAreAtomicAndConcurrentWritersLoseNothing) {
   ASSERT_TRUE(fresh.removeObject("x") && fresh.removeObject("never-there"));
   EXPECT_FALSE(fresh.objectForKey("x"));
   for (const auto& entry : fs::directory_iterator(dir / "new-dir"))  // no temporary left behind
-    EXPECT_TRUE(entry.path().filename() == "suite.json" || entry.path().filename() == "suite.json.lock") << entry.path();
+    EXPECT_TRUE(entry.path().filename() == "suite.json" || entry.path().filename() == "suite.json.lock")
+        << entry.path();
 }
 
 }  // namespace

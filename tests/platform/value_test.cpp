@@ -6,10 +6,10 @@
 #include <cstring>
 #include <limits>
 
+#include "platform/config/locale.h"
 #include "platform/values/base64.h"
 #include "platform/values/error.h"
 #include "platform/values/json.h"
-#include "platform/config/locale.h"
 #include "platform/values/uuid.h"
 
 using platform::Array;
@@ -26,7 +26,8 @@ TEST(Data, ComparesByContentSharesCopiesFreesAnAdoptedBufferOnceAndDescribesLong
   const uint8_t raw[] = {1, 2, 3};
   Data a(raw, 3), copy = a;
   EXPECT_EQ(copy.bytes(), a.bytes());
-  EXPECT_TRUE(a == Data(std::vector<uint8_t>{1, 2, 3}) && a != Data(raw, 2) && a != Data(std::vector<uint8_t>{1, 2, 4}));
+  EXPECT_TRUE(a == Data(std::vector<uint8_t>{1, 2, 3}) && a != Data(raw, 2) &&
+              a != Data(std::vector<uint8_t>{1, 2, 4}));
   EXPECT_EQ(Data(), Data(raw, 0));
   auto* p = static_cast<uint8_t*>(std::malloc(4));
   std::memcpy(p, "abcd", 4);
@@ -65,8 +66,11 @@ TEST(Value, BooleansEqualOnlyBooleansAndNumbersCompareByValue) {
 }
 
 TEST(Value, MembersAndDescription) {
-  Value v(Dictionary{{"a", Array{1, true, "q\"\\\n\x01"}}, {"b", Data::fromString("\x0f")}, {"c", platform::Opaque{"fd"}},
-                     {"d", 0.25}, {"e", kU64Max}});
+  Value v(Dictionary{{"a", Array{1, true, "q\"\\\n\x01"}},
+                     {"b", Data::fromString("\x0f")},
+                     {"c", platform::Opaque{"fd"}},
+                     {"d", 0.25},
+                     {"e", kU64Max}});
   EXPECT_EQ(v.description(), R"({"a": [1, true, "q\"\\\n\u0001"], "b": {length = 1, bytes = 0x0f}, "c": <fd>, )"
                              R"("d": 0.25, "e": 18446744073709551615})");
   EXPECT_EQ(std::tuple(v.count(), v.find("a")->count(), Value("s").count()), std::tuple(5u, 3u, 0u));
@@ -85,7 +89,8 @@ TEST(Json, OnlyArraysAndObjectsOfJSONKindsAreWrittenAndTheRoundTripKeepsTheKinds
   for (const auto& [v, valid] : rows) EXPECT_EQ(platform::json::isValidJSONObject(v), valid) << v.description();
   std::string error;
   EXPECT_EQ(platform::json::serialize(Value(1), false, &error).value_or(error), "Invalid type in JSON write");
-  Value v(Dictionary{{"b", true}, {"i", -3}, {"u", kU64Max}, {"d", 0.25}, {"n", Value()}, {"s", "é"}, {"a", Array{false}}});
+  Value v(
+      Dictionary{{"b", true}, {"i", -3}, {"u", kU64Max}, {"d", 0.25}, {"n", Value()}, {"s", "é"}, {"a", Array{false}}});
   auto text = platform::json::serialize(v);
   ASSERT_TRUE(text);
   EXPECT_EQ(text->find('\n'), std::string::npos);
@@ -148,14 +153,17 @@ TEST(UUID, IsRandomVersionFourAndReadsAsItsBytesInUpperCase) {
   EXPECT_THAT(text, testing::MatchesRegex("[0-9A-F]{8}-[0-9A-F]{4}-4[0-9A-F]{3}-[89AB][0-9A-F]{3}-[0-9A-F]{12}"));
   std::string hex = text;
   std::erase(hex, '-');
-  for (size_t i = 0; i < 16 && 2 * i < hex.size(); ++i) EXPECT_EQ(std::stoi(hex.substr(2 * i, 2), nullptr, 16), uuid.bytes()[i]) << text;
+  for (size_t i = 0; i < 16 && 2 * i < hex.size(); ++i)
+    EXPECT_EQ(std::stoi(hex.substr(2 * i, 2), nullptr, 16), uuid.bytes()[i]) << text;
   EXPECT_NE(uuid, platform::UUID());
 }
 
 TEST(Locale, IdentifiersComeFromICUAndCompareExactly) {
   EXPECT_GT(platform::availableLocaleIdentifiers().size(), 100u);
-  for (const char* id : {"en_US", "fr_FR", "zh_Hans_CN", "en"}) EXPECT_TRUE(platform::isAvailableLocaleIdentifier(id)) << id;
-  for (const char* id : {"en-US", "EN_US", "xx_YY", "", "en_US "}) EXPECT_FALSE(platform::isAvailableLocaleIdentifier(id)) << id;
+  for (const char* id : {"en_US", "fr_FR", "zh_Hans_CN", "en"})
+    EXPECT_TRUE(platform::isAvailableLocaleIdentifier(id)) << id;
+  for (const char* id : {"en-US", "EN_US", "xx_YY", "", "en_US "})
+    EXPECT_FALSE(platform::isAvailableLocaleIdentifier(id)) << id;
 }
 
 }  // namespace

@@ -10,8 +10,8 @@
 
 #include "common/log_capture.h"
 #include "common/rows.h"
-#include "platform/values/exception.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/values/exception.h"
 #include "sap/tarvex_sap_session.h"
 
 namespace platform {

@@ -27,8 +27,10 @@ std::string confirmCall() {
     m.resize((m.size() + 7) / 8 * 8, '\0');
     m += {code, 1, type, '\0'};
     const uint32_t length = static_cast<uint32_t>(value.size());
-    if (type == 'g') m += static_cast<char>(length);
-    else m.append(reinterpret_cast<const char*>(&length), 4);
+    if (type == 'g')
+      m += static_cast<char>(length);
+    else
+      m.append(reinterpret_cast<const char*>(&length), 4);
     (m += value) += '\0';
   };
   field(1, 'o', "/com/kestro/ZLKAuthentication/ZLKANetwork");
@@ -45,9 +47,11 @@ std::string confirmCall() {
 // The first D-Bus error name in what the connection receives within 30 seconds.
 std::string answerName(int fd) {
   std::string received;
-  for (auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30); std::chrono::steady_clock::now() < end;) {
+  for (auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+       std::chrono::steady_clock::now() < end;) {
     for (std::string_view prefix : {"com.kestro.ZLKAuthentication.Error.", "org.freedesktop.DBus.Error."})
-      if (size_t at = received.find(prefix), stop = received.find('\0', at); at != std::string::npos && stop != std::string::npos)
+      if (size_t at = received.find(prefix), stop = received.find('\0', at);
+          at != std::string::npos && stop != std::string::npos)
         return received.substr(at, stop - at);
     pollfd p{fd, POLLIN, 0};
     if (::poll(&p, 1, 100) <= 0) continue;
@@ -82,7 +86,9 @@ int main(int argc, char** argv) {
   const std::string exe = "/proc/" + std::to_string(connecting) + "/exe";
   std::error_code ec;
   for (int i = 0; i < 1000 && std::filesystem::read_symlink(exe, ec) != program; ++i) usleep(10'000);
-  std::printf("%s\n", ::write(fd, call.data(), call.size()) == static_cast<ssize_t>(call.size()) ? answerName(fd).c_str() : "write failed");
+  std::printf("%s\n", ::write(fd, call.data(), call.size()) == static_cast<ssize_t>(call.size())
+                          ? answerName(fd).c_str()
+                          : "write failed");
   std::fflush(stdout);
   ::kill(connecting, SIGKILL);
   _exit(0);

@@ -24,17 +24,21 @@ std::string lineAfter(const std::string& file, const std::string& prefix) {
     if (line.starts_with(prefix)) return line.substr(prefix.size());
   return "";
 }
-std::string unitSetting(const std::string& key) { return lineAfter(std::string(DIST_DIR) + "/zlkad.service", key + "="); }
+std::string unitSetting(const std::string& key) {
+  return lineAfter(std::string(DIST_DIR) + "/zlkad.service", key + "=");
+}
 
 // "CAP_SYS_PTRACE CAP_NET_RAW" as setpriv wants it: "-all,+sys_ptrace,+net_raw".
 std::string setprivCapabilities(const std::string& key) {
   std::string caps = std::regex_replace(unitSetting(key), std::regex("\\s*CAP_(\\w+)"), ",+$1");
-  std::transform(caps.begin(), caps.end(), caps.begin(), [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  std::transform(caps.begin(), caps.end(), caps.begin(),
+                 [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
   return "-all" + caps;
 }
 
 std::vector<std::string> asUser(std::pair<uid_t, gid_t> user) {
-  return {"/usr/bin/setpriv", "--reuid=" + std::to_string(user.first), "--regid=" + std::to_string(user.second), "--clear-groups"};
+  return {"/usr/bin/setpriv", "--reuid=" + std::to_string(user.first), "--regid=" + std::to_string(user.second),
+          "--clear-groups"};
 }
 
 TEST(CallerIdentity, TheConfinedDaemonAdmitsByTheRecordedUserWhateverTheCallerExecs) {
@@ -51,11 +55,18 @@ TEST(CallerIdentity, TheConfinedDaemonAdmitsByTheRecordedUserWhateverTheCallerEx
   // /proc mounted the way the unit's ProtectProc, ProcSubset and ReadOnlyPaths ask, then the
   // unit's user and capabilities with no new privileges.
   const std::string ambient = setprivCapabilities("AmbientCapabilities");
-  std::vector<std::string> launcher = {"/usr/bin/unshare", "--mount", "--propagation", "private", "--", "/bin/sh", "-c",
-                                       "mount -t proc -o hidepid=" + unitSetting("ProtectProc") + ",subset=" + unitSetting("ProcSubset") +
-                                           " proc /proc && mount -o remount,bind," + (unitSetting("ReadOnlyPaths") == "/proc" ? "ro" : "rw") +
-                                           " /proc && exec \"$@\"",
-                                       "sh"};
+  std::vector<std::string> launcher = {
+      "/usr/bin/unshare",
+      "--mount",
+      "--propagation",
+      "private",
+      "--",
+      "/bin/sh",
+      "-c",
+      "mount -t proc -o hidepid=" + unitSetting("ProtectProc") + ",subset=" + unitSetting("ProcSubset") +
+          " proc /proc && mount -o remount,bind," + (unitSetting("ReadOnlyPaths") == "/proc" ? "ro" : "rw") +
+          " /proc && exec \"$@\"",
+      "sh"};
   for (const auto& argument : asUser(*daemonUser)) launcher.push_back(argument);
   launcher.insert(launcher.end(), {"--no-new-privs", "--inh-caps=" + ambient, "--ambient-caps=" + ambient,
                                    "--bounding-set=" + setprivCapabilities("CapabilityBoundingSet"), "--"});
@@ -65,13 +76,15 @@ TEST(CallerIdentity, TheConfinedDaemonAdmitsByTheRecordedUserWhateverTheCallerEx
   std::istringstream(lineAfter(status, "Uid:")) >> realUid;
   EXPECT_EQ(realUid, daemonUser->first);
   EXPECT_EQ(lineAfter(status, "CapEff:"), "\t0000000000080000");  // CAP_SYS_PTRACE alone
-  EXPECT_EQ(outcome(harness.connect()->confirmActivation({sampleToken(), "U"})), "ok") << harness.daemon()->standardError();
+  EXPECT_EQ(outcome(harness.connect()->confirmActivation({sampleToken(), "U"})), "ok")
+      << harness.daemon()->standardError();
 
   // borrow_identity connects, then execs sleep, which this user's manifest entitles, and calls
   // from a forked child on the same connection. For this user the gate passes and the empty call
   // fails on its arguments, which shows the attempt reaches the gate; for another it is refused.
-  for (const auto& [user, answer] : {std::pair{std::pair{uid_t{0}, gid_t{0}}, "com.kestro.ZLKAuthentication.Error.InvalidParameter"},
-                                     std::pair{*attacker, "com.kestro.ZLKAuthentication.Error.MissingEntitlement"}}) {
+  for (const auto& [user, answer] :
+       {std::pair{std::pair{uid_t{0}, gid_t{0}}, "com.kestro.ZLKAuthentication.Error.InvalidParameter"},
+        std::pair{*attacker, "com.kestro.ZLKAuthentication.Error.MissingEntitlement"}}) {
     std::vector<std::string> argv = asUser(user);
     argv.insert(argv.end(), {BORROW_IDENTITY_PATH, harness.busAddress(), "/usr/bin/sleep", "60"});
     auto run = zlkatest::runToEnd(argv, harness.directory());
@@ -86,7 +99,9 @@ TEST(TaskLimit, EveryCallerIsAnsweredAndTheDaemonServesOn) {
   for (const char* root : {"/sys/fs/cgroup/pids", "/sys/fs/cgroup"}) {
     std::filesystem::path dir = std::filesystem::path(root) / ("zlka-test-" + std::to_string(getpid()));
     std::error_code ec;
-    if (!std::filesystem::exists(std::filesystem::path(root) / "cgroup.procs") || !std::filesystem::create_directory(dir, ec)) continue;
+    if (!std::filesystem::exists(std::filesystem::path(root) / "cgroup.procs") ||
+        !std::filesystem::create_directory(dir, ec))
+      continue;
     std::ofstream(dir / "pids.max") << 5;
     if (std::filesystem::exists(dir / "pids.max")) {
       group = dir;
@@ -100,7 +115,8 @@ TEST(TaskLimit, EveryCallerIsAnsweredAndTheDaemonServesOn) {
   });
   Harness harness;
   harness.entitleSelf();
-  ASSERT_TRUE(harness.startDaemon({}, {"/bin/sh", "-c", "echo $$ > " + (group / "cgroup.procs").string() + " && exec \"$@\"", "sh"}))
+  ASSERT_TRUE(harness.startDaemon(
+      {}, {"/bin/sh", "-c", "echo $$ > " + (group / "cgroup.procs").string() + " && exec \"$@\"", "sh"}))
       << harness.daemon()->standardError();
   std::vector<std::unique_ptr<ZLKAClient>> clients;
   std::vector<std::future<void>> answered;
@@ -116,7 +132,8 @@ TEST(TaskLimit, EveryCallerIsAnsweredAndTheDaemonServesOn) {
   std::ifstream events(group / "pids.events");
   std::string key;
   long refusals = -1;
-  EXPECT_TRUE(events >> key >> refusals && key == "max" && refusals > 0) << "the limit never bit: raise the callers or lower the limit";
+  EXPECT_TRUE(events >> key >> refusals && key == "max" && refusals > 0)
+      << "the limit never bit: raise the callers or lower the limit";
 
   // And it serves callers again once there is room: the transfer's worker starts when needed.
   std::ofstream(group / "pids.max") << "max";

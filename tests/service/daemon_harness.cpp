@@ -24,12 +24,16 @@ Harness::Harness(bool anyUser) : bus_(anyUser) {
 }
 
 Harness::~Harness() {
-  if (daemon_) daemon_->signal(SIGTERM), daemon_->waitExit(std::chrono::seconds(30));  // a graceful end keeps its coverage data
+  if (daemon_)
+    daemon_->signal(SIGTERM), daemon_->waitExit(std::chrono::seconds(30));  // a graceful end keeps its coverage data
 }
 
-void Harness::writeManifest(const std::string& name, const std::string& executable, const platform::Value& value) const {
-  platform::Value manifest(platform::Dictionary{
-      {"uid", getuid()}, {"executable", executable}, {"entitlements", platform::Dictionary{{"com.kestro.ZLKAuthentication", value}}}});
+void Harness::writeManifest(const std::string& name, const std::string& executable,
+                            const platform::Value& value) const {
+  platform::Value manifest(
+      platform::Dictionary{{"uid", getuid()},
+                           {"executable", executable},
+                           {"entitlements", platform::Dictionary{{"com.kestro.ZLKAuthentication", value}}}});
   std::ofstream(stateDirectory() / "entitlements.d" / (name + ".json")) << *platform::json::serialize(manifest);
 }
 
@@ -42,10 +46,11 @@ bool Harness::startDaemon(const std::vector<std::string>& extraArguments, const 
   if (::bind(notifySocket_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return false;
   std::filesystem::permissions(socketPath, std::filesystem::perms(0666));  // a daemon of any user may notify
   std::vector<std::string> argv = launcher;
-  argv.insert(argv.end(), {ZLKAD_PATH, "--config", (stateDirectory() / "zlkad.toml").string(), "--bus", busAddress(), "--log",
-                           "stderr", "--log-level", "info"});
+  argv.insert(argv.end(), {ZLKAD_PATH, "--config", (stateDirectory() / "zlkad.toml").string(), "--bus", busAddress(),
+                           "--log", "stderr", "--log-level", "info"});
   argv.insert(argv.end(), extraArguments.begin(), extraArguments.end());
-  daemon_ = std::make_unique<zlkatest::ChildProcess>(argv, directory(), std::vector<std::string>{"NOTIFY_SOCKET=" + socketPath.string()});
+  daemon_ = std::make_unique<zlkatest::ChildProcess>(argv, directory(),
+                                                     std::vector<std::string>{"NOTIFY_SOCKET=" + socketPath.string()});
   // READY=1 comes once the daemon owns its name; a daemon that dies first never sends it.
   pollfd p{notifySocket_.get(), POLLIN, 0};
   char buffer[512];
@@ -60,7 +65,8 @@ std::unique_ptr<ZLKAClient> Harness::connect() const {
 }
 
 platform::Data sampleToken() {
-  return platform::Data(std::vector<uint8_t>{0x30, 0x06, 0x04, 0x01, 0x5A, 0x02, 0x01, 0x01, 0x04, 0x03, 0x01, 0x02, 0x03});
+  return platform::Data(
+      std::vector<uint8_t>{0x30, 0x06, 0x04, 0x01, 0x5A, 0x02, 0x01, 0x01, 0x04, 0x03, 0x01, 0x02, 0x03});
 }
 
 }  // namespace service_test

@@ -10,7 +10,6 @@
 
 #include "client/zlka_client.h"
 #include "common/child_process.h"
-#include "common/child_process.h"
 #include "common/server_world.h"
 #include "devserver/dev_server.h"
 #include "platform/bus/handles.h"
@@ -26,7 +25,9 @@ class Harness {
   ~Harness();
 
   std::filesystem::path directory() const { return directory_.path(); }
-  std::filesystem::path stateDirectory() const { return directory() / "state"; }  // zlkad.toml, ca.pem, entitlements.d, defaults
+  std::filesystem::path stateDirectory() const {
+    return directory() / "state";
+  }  // zlkad.toml, ca.pem, entitlements.d, defaults
   const std::string& busAddress() const { return bus_.address(); }
   devserver::DevServer& server() { return *server_; }
   zlkatest::AdminClient admin() const { return zlkatest::AdminClient(*server_); }
@@ -55,7 +56,8 @@ platform::Data sampleToken();
 // "ok", or "domain code: description".
 template <class T>
 std::string outcome(const zlka_client::Result<T>& r) {
-  return r.ok() ? "ok" : r.error().domain() + " " + std::to_string(r.error().code()) + ": " + r.error().localizedDescription();
+  return r.ok() ? "ok"
+                : r.error().domain() + " " + std::to_string(r.error().code()) + ": " + r.error().localizedDescription();
 }
 
 }  // namespace service_test

@@ -53,7 +53,8 @@ class Daemon : public testing::Test {
  protected:
   void SetUp() override {
     const auto file = harness.stateDirectory() / "zlkad.toml";
-    const std::string config = std::regex_replace(zlkatest::readFile(file), std::regex("internal_build = false"), "internal_build = true");
+    const std::string config =
+        std::regex_replace(zlkatest::readFile(file), std::regex("internal_build = false"), "internal_build = true");
     std::ofstream(file) << config;
     harness.entitleSelf();
     ASSERT_TRUE(harness.startDaemon()) << harness.daemon()->standardError();
@@ -64,17 +65,21 @@ class Daemon : public testing::Test {
 };
 
 TEST_F(Daemon, TheGateRefusesACallerNoManifestEntitles) {
-  auto run = zlkatest::runToEnd(
-      {ZLKACTL_PATH, "--bus", harness.busAddress(), "confirm", "--token-hex", "300604015a0201010403010203", "--uuid", "U"}, harness.directory());
+  auto run = zlkatest::runToEnd({ZLKACTL_PATH, "--bus", harness.busAddress(), "confirm", "--token-hex",
+                                 "300604015a0201010403010203", "--uuid", "U"},
+                                harness.directory());
   EXPECT_EQ(run.status, 1);
   EXPECT_EQ(run.err, "zlkactl: ZLKATokenManagerErrorDomain -2: Framework client is missing entitlement.\n");
   EXPECT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), "ok");
-  EXPECT_THAT(harness.daemon()->standardError(), HasSubstr("<info> Loaded 1 entitlement manifest entr(ies)"));  // --log-level info
+  EXPECT_THAT(harness.daemon()->standardError(),
+              HasSubstr("<info> Loaded 1 entitlement manifest entr(ies)"));  // --log-level info
 }
 
 TEST_F(Daemon, ArgumentsAreDecodedBeforeTheOperationAndItsErrorsKeepTheirCodes) {
   const uint64_t requests = harness.admin().requests();
-  auto raw = [&](const char* method, ZLKAClient::ArgumentWriter write) { return outcome(client->callRaw(method, write)); };
+  auto raw = [&](const char* method, ZLKAClient::ArgumentWriter write) {
+    return outcome(client->callRaw(method, write));
+  };
   // clang-format off
   const std::pair<std::string, std::string> refused[] = {  // the call's outcome, the refusal's message
       {raw("ConfirmActivationForToken", [](sd_bus_message* m) { return sd_bus_message_append(m, "a{sv}", 2, "token", "s", "x", "uuid", "s", "U"); }),
@@ -92,23 +97,30 @@ TEST_F(Daemon, ArgumentsAreDecodedBeforeTheOperationAndItsErrorsKeepTheirCodes) 
   };
   // clang-format on
   for (const auto& [got, message] : refused)
-    EXPECT_EQ(got, "ZLKAClientErrorDomain 4: The call was refused with org.freedesktop.DBus.Error.InvalidArgs: " + message);
+    EXPECT_EQ(got,
+              "ZLKAClientErrorDomain 4: The call was refused with org.freedesktop.DBus.Error.InvalidArgs: " + message);
   EXPECT_EQ(harness.admin().requests(), requests);
 
   const std::string failed = "ZLKATokenManagerErrorDomain ";
   EXPECT_EQ(outcome(client->confirmActivation({})), failed + "-3: An invalid parameter was provided by the caller.");
   // Bytes are a value that JSON cannot hold.
-  EXPECT_EQ(outcome(client->requestMetadata({sampleToken(), "U", "en_US", Dictionary{{"b", platform::Data::fromString("x")}}})),
+  EXPECT_EQ(outcome(client->requestMetadata(
+                {sampleToken(), "U", "en_US", Dictionary{{"b", platform::Data::fromString("x")}}})),
             failed + "-4: An internal error has occurred.");
   harness.admin().setFault({{"endpoint", "activateAccessory"}, {"status", 500}});
-  EXPECT_EQ(outcome(client->requestActivation({sampleToken(), "U"})), failed + "-6: An internal server error has occurred.");
+  EXPECT_EQ(outcome(client->requestActivation({sampleToken(), "U"})),
+            failed + "-6: An internal server error has occurred.");
   // A string that D-Bus cannot carry whole is a bad answer, not a silently shortened one.
-  harness.admin().setFault({{"endpoint", "queryProductPlan"}, {"body", std::string(R"({"ppid":"PP\u0000-1","locale":"en_US","ppid_metadata":{}})")}});
-  EXPECT_EQ(outcome(client->requestMetadata({sampleToken(), "U", "en_US"})), failed + "-6: An internal server error has occurred.");
+  harness.admin().setFault({{"endpoint", "queryProductPlan"},
+                            {"body", std::string(R"({"ppid":"PP\u0000-1","locale":"en_US","ppid_metadata":{}})")}});
+  EXPECT_EQ(outcome(client->requestMetadata({sampleToken(), "U", "en_US"})),
+            failed + "-6: An internal server error has occurred.");
   EXPECT_THAT(harness.daemon()->standardError(), HasSubstr("The answer's ppid cannot be sent over D-Bus"));
   // Honoured only because the configuration declares an internal build.
-  platform::SettingsStore("com.kestro.ZLKAuthentication", harness.stateDirectory() / "defaults").setObject("ForceNetworkFailure", true);
-  EXPECT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), failed + "-5: There was a problem connecting to the network.");
+  platform::SettingsStore("com.kestro.ZLKAuthentication", harness.stateDirectory() / "defaults")
+      .setObject("ForceNetworkFailure", true);
+  EXPECT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})),
+            failed + "-5: There was a problem connecting to the network.");
 }
 
 TEST_F(Daemon, AnswersInTheOperationsShapesAndOutlivesAClientThatLeavesMidCall) {
@@ -124,7 +136,8 @@ TEST_F(Daemon, AnswersInTheOperationsShapesAndOutlivesAClientThatLeavesMidCall) 
   {
     auto leaving = harness.connect();
     leaving->confirmActivationAsync({sampleToken(), "U"}, [](auto) {});
-    for (int i = 0; i < 500 && harness.admin().requests("ackAccessory") == acks; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    for (int i = 0; i < 500 && harness.admin().requests("ackAccessory") == acks; ++i)
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
   }  // gone from the bus while the server holds its call; the next call is held as long, so it ends after
   EXPECT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), "ok");
   EXPECT_FALSE(harness.daemon()->waitExit(std::chrono::milliseconds(0)));
@@ -141,7 +154,8 @@ TEST_F(Daemon, SigtermAnswersEveryCallInFlight) {
                         got.find("(org.freedesktop.DBus.Error.ServiceUnknown") != std::string::npos;
       answer.set_value(gone ? "gone" : got);
     });
-  for (int i = 0; i < 500 && harness.admin().requests("ackAccessory") < 2; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  for (int i = 0; i < 500 && harness.admin().requests("ackAccessory") < 2; ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
   harness.daemon()->signal(SIGTERM);
   std::map<std::string, int> outcomes;
   for (auto& answer : answers) {
@@ -172,7 +186,8 @@ TEST(DaemonProcess, ABadStartOrCheckIsRefusedNamingWhatIsWrong) {
   // Root reads any file: the permission row runs as nobody then.
   std::vector<std::string> asNobody;
   if (const passwd* p = getpwnam("nobody"); geteuid() == 0 && p)
-    asNobody = {"/usr/bin/setpriv", "--reuid=" + std::to_string(p->pw_uid), "--regid=" + std::to_string(p->pw_gid), "--clear-groups"};
+    asNobody = {"/usr/bin/setpriv", "--reuid=" + std::to_string(p->pw_uid), "--regid=" + std::to_string(p->pw_gid),
+                "--clear-groups"};
   const std::string bus = harness.busAddress(), noBus = "unix:path=/nonexistent";  // a check never connects
   struct Row {
     const char* name;
@@ -221,9 +236,11 @@ TEST(DaemonProcess, PropertiesShowWhatItDoesAndRootChangesTheLogLevelAtOnce) {
     launcher.insert(launcher.end(), arguments.begin(), arguments.end());
     return zlkatest::runToEnd(launcher, harness.directory());
   };
-  const std::string name = "com.kestro.ZLKAuthentication.ZLKANetwork", path = "/com/kestro/ZLKAuthentication/ZLKANetwork",
+  const std::string name = "com.kestro.ZLKAuthentication.ZLKANetwork",
+                    path = "/com/kestro/ZLKAuthentication/ZLKANetwork",
                     interface = "com.kestro.ZLKAuthentication.ZLKANetworkProtocol";
-  const std::vector<std::string> logLevel = {name, "/org/freedesktop/LogControl1", "org.freedesktop.LogControl1", "LogLevel"};
+  const std::vector<std::string> logLevel = {name, "/org/freedesktop/LogControl1", "org.freedesktop.LogControl1",
+                                             "LogLevel"};
   auto get = [&](const std::vector<std::string>& property) {
     std::vector<std::string> arguments = {"get-property"};
     arguments.insert(arguments.end(), property.begin(), property.end());
@@ -237,7 +254,9 @@ TEST(DaemonProcess, PropertiesShowWhatItDoesAndRootChangesTheLogLevelAtOnce) {
 
   auto client = harness.connect();
   ASSERT_EQ(outcome(client->confirmActivation({sampleToken(), "U"})), "ok");
-  EXPECT_EQ(outcome(client->callRaw("ConfirmActivationForToken", [](sd_bus_message* m) { return appendToken(m, 64 * 1024 + 1); })).substr(0, 24),
+  EXPECT_EQ(outcome(client->callRaw("ConfirmActivationForToken",
+                                    [](sd_bus_message* m) { return appendToken(m, 64 * 1024 + 1); }))
+                .substr(0, 24),
             "ZLKAClientErrorDomain 4:");
   EXPECT_EQ(get({name, path, interface, "SessionState"}), "s \"open\"\n");
   EXPECT_THAT(get({name, path, interface, "SessionTimeToLive"}), testing::MatchesRegex("t [1-9][0-9]*\n"));
@@ -253,7 +272,8 @@ TEST(DaemonProcess, PropertiesShowWhatItDoesAndRootChangesTheLogLevelAtOnce) {
   set.insert(set.end(), {"s", "debug"});
   // The test bus lets anyone send anything: what refuses another user here is the daemon's own check.
   if (const passwd* p = getpwnam("nobody"); geteuid() == 0 && p) {
-    auto refused = busctl(set, {"/usr/bin/setpriv", "--reuid=" + std::to_string(p->pw_uid), "--regid=" + std::to_string(p->pw_gid), "--clear-groups"});
+    auto refused = busctl(set, {"/usr/bin/setpriv", "--reuid=" + std::to_string(p->pw_uid),
+                                "--regid=" + std::to_string(p->pw_gid), "--clear-groups"});
     EXPECT_NE(refused.status, 0);
     EXPECT_THAT(refused.err, HasSubstr("Access denied"));
     EXPECT_EQ(get(logLevel), "s \"info\"\n");

@@ -30,7 +30,8 @@ TEST(Entitlements, AnEntitlementIsHeldByATrueNumberOrAnyContainer) {
   };
   // clang-format on
   for (const Row& r : rows)
-    EXPECT_EQ(Entitlements::hasEntitlement(peerWith(r.value), kKey), r.admitted) << (r.value ? r.value->description() : "absent");
+    EXPECT_EQ(Entitlements::hasEntitlement(peerWith(r.value), kKey), r.admitted)
+        << (r.value ? r.value->description() : "absent");
 }
 
 TEST(Entitlements, ACategoryIsGrantedByAnArrayHoldingItOrATrueNumberUnderItInADictionary) {

@@ -11,8 +11,8 @@
 #include "support/base64_array.h"
 #include "support/hex.h"
 #include "support/json_file.h"
-#include "support/objects.h"
 #include "support/obfuscated_pointer.h"
+#include "support/objects.h"
 #include "support/system_info.h"
 #include "support/unicode.h"
 
@@ -32,7 +32,8 @@ TEST(Hex, TextToBytesSkipsEveryNonDigitAndAnOddLastDigit) {
   };
   // clang-format on
   for (const auto& [text, expected] : rows)
-    EXPECT_EQ(convertNSStringToNSData(text), expected ? std::optional(Data::fromString(*expected)) : std::nullopt) << text.value_or("(none)");
+    EXPECT_EQ(convertNSStringToNSData(text), expected ? std::optional(Data::fromString(*expected)) : std::nullopt)
+        << text.value_or("(none)");
   uint8_t out[3] = {0xEE, 0xEE, 0xEE};
   ascii_to_hex(out + 2, "1", 1);  // whole pairs only
   ascii_to_hex(out, "fFzg9", 5);  // anything else reads as 0
@@ -87,7 +88,8 @@ TEST(Objects, AbsentAndNullAreNullAndConformanceUsesTheInstanceTestForClassMetho
   EXPECT_EQ(NSObjectIfNotNull(Value()), std::nullopt);
   EXPECT_EQ(NSObjectIfNotNull(Value(false)), Value(false));
   EXPECT_TRUE(isNSObjectEqual(std::nullopt, std::nullopt) && isNSObjectEqual(Value(Array{1}), Value(Array{1.0})));
-  EXPECT_FALSE(isNSObjectEqual(std::nullopt, Value()) || isNSObjectEqual(Value(), std::nullopt) || isNSObjectEqual(Value(1), Value(2)));
+  EXPECT_FALSE(isNSObjectEqual(std::nullopt, Value()) || isNSObjectEqual(Value(), std::nullopt) ||
+               isNSObjectEqual(Value(1), Value(2)));
 
   // A class method of C does not count: instances do not answer it.
   platform::Protocol proto{"P", {{"a", true, true}, {"b", true, true}, {"c", false, true}, {"make", true, false}}};
@@ -114,7 +116,8 @@ TEST(JSONFile, IsWrittenWholeAndPrettyOrNotAtAllAndUnreadableOnesReadAsNothing) 
   EXPECT_FALSE(writeJSONFile(Value(Array{Data::fromString("x")}), path) || writeJSONFile(v, std::nullopt) ||
                writeJSONFile(v, dir / "no-such-dir" / "f.json"));
   std::ifstream in(path);
-  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "{\n  \"a\": [\n    1,\n    \"x\"\n  ],\n  \"b\": true\n}");
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}),
+            "{\n  \"a\": [\n    1,\n    \"x\"\n  ],\n  \"b\": true\n}");
   EXPECT_FALSE(readJSONFile(dir / "absent.json") || readJSONFile(dir) || readJSONFile(std::nullopt));
   EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), {}), 1);  // no temporary left
   std::filesystem::remove_all(dir);
@@ -122,13 +125,14 @@ TEST(JSONFile, IsWrittenWholeAndPrettyOrNotAtAllAndUnreadableOnesReadAsNothing) 
 
 TEST(SystemInfo, ClockRoundsHalvesAwayFromZeroAndMemoryUseWritesOnlyTheGivenPointers) {
   using systemInfo_detail::roundedUnixTime;
-  const std::tuple<double, double, uint64_t> rows[] = {
-      {10.5, 1, 11}, {10.49, 1, 10}, {1.0005, 1000, 1001}, {0.4, 1, 0}, {0, 1, 0}, {-3, 1000, 0}, {std::nan(""), 1, 0}};
+  const std::tuple<double, double, uint64_t> rows[] = {{10.5, 1, 11}, {10.49, 1, 10}, {1.0005, 1000, 1001}, {0.4, 1, 0},
+                                                       {0, 1, 0},     {-3, 1000, 0},  {std::nan(""), 1, 0}};
   for (const auto& [seconds, scale, expected] : rows) EXPECT_EQ(roundedUnixTime(seconds, scale), expected) << seconds;
   const uint64_t s = systemInfo_getCurrentUnixTime(), ms = systemInfo_getCurrentUnixTimeMS();
   EXPECT_TRUE(s > 1'700'000'000u && ms / 1000 <= s + 1 && ms / 1000 + 1 >= s) << s << " " << ms;
   uint64_t resident = 0, virt = 0, footprint = 0;
-  ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr) && getMemoryUse(nullptr, &virt, &footprint) && getMemoryUse(nullptr, nullptr, nullptr));
+  ASSERT_TRUE(getMemoryUse(&resident, nullptr, nullptr) && getMemoryUse(nullptr, &virt, &footprint) &&
+              getMemoryUse(nullptr, nullptr, nullptr));
   EXPECT_TRUE(resident > 0 && virt >= resident && footprint > 0);
   std::vector<char> block(64 << 20, 1);  // touched, so resident and anonymous
   uint64_t grown = 0;

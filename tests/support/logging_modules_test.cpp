@@ -29,12 +29,15 @@ TEST(LoggingModules, CreatesOneObjectPerRowNamingMissingNamesUndefinedAndCountsO
       {
         static LoggingModuleLog out[4];
         setUp({{"com.kestro.a", "one"}, {"com.kestro.a", nullptr}, {nullptr, "cat"}, {"", "empty"}}, out);
-        bool ok = out[0]->subsystem() == "com.kestro.a" && out[0]->category() == "one" && out[1]->category() == "<Undefined>" &&
-                  out[2]->subsystem() == "<Undefined>" && !out[3] && loggingModules_logs() == out && loggingModules_count() == 4 &&
-                  logged(LogLevel::Debug, "Created log object com.kestro.a: one") &&
-                  logged(LogLevel::Error, "Category missing for logging module 1!\n(Check LoggingModuleEntry_t table)") &&
-                  logged(LogLevel::Error, "Subsystem missing for logging module 2!\n(Check LoggingModuleEntry_t table)") &&
-                  logged(LogLevel::Error, "Failed to create log object : empty!") && logged(LogLevel::Info, "Created 3 log object(s)!");
+        bool ok =
+            out[0]->subsystem() == "com.kestro.a" && out[0]->category() == "one" &&
+            out[1]->category() == "<Undefined>" && out[2]->subsystem() == "<Undefined>" && !out[3] &&
+            loggingModules_logs() == out && loggingModules_count() == 4 &&
+            logged(LogLevel::Debug, "Created log object com.kestro.a: one") &&
+            logged(LogLevel::Error, "Category missing for logging module 1!\n(Check LoggingModuleEntry_t table)") &&
+            logged(LogLevel::Error, "Subsystem missing for logging module 2!\n(Check LoggingModuleEntry_t table)") &&
+            logged(LogLevel::Error, "Failed to create log object : empty!") &&
+            logged(LogLevel::Info, "Created 3 log object(s)!");
         std::exit(ok ? 0 : 1);
       },
       testing::ExitedWithCode(0), "");
@@ -50,7 +53,8 @@ TEST(LoggingModules, ASecondSetUpChangesNothingEvenWhenRacing) {
         first.join();
         second.join();
         const LoggingModuleLog* published = loggingModules_logs();
-        bool ok = (published == a && loggingModules_count() == 1 && !b[0]) || (published == b && loggingModules_count() == 2 && !a[0]);
+        bool ok = (published == a && loggingModules_count() == 1 && !b[0]) ||
+                  (published == b && loggingModules_count() == 2 && !a[0]);
         setUp({{"com.kestro.third", "c"}}, b);
         std::exit(ok && loggingModules_logs() == published ? 0 : 1);
       },

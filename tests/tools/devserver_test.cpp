@@ -43,14 +43,15 @@ TEST(FaultRules, AreRefusedNamingTheWrongMemberAndTheEndpointsOwnBeatsTheWildcar
     }
     EXPECT_THAT(thrown, HasSubstr(mentions)) << rule;
   }
-  EXPECT_EQ(devserver::parseFaultRule({{"endpoint", "*"}, {"delay_ms", 999999999}}).fault.delay, devserver::kLongestFaultDelay);
+  EXPECT_EQ(devserver::parseFaultRule({{"endpoint", "*"}, {"delay_ms", 999999999}}).fault.delay,
+            devserver::kLongestFaultDelay);
 
   devserver::FaultTable table;
   table.set(devserver::parseFaultRule({{"endpoint", "*"}, {"status", 502}}));
   table.set(devserver::parseFaultRule({{"endpoint", "queryProductPlan"}, {"status", 418}, {"remaining", 2}}));
   std::vector<int> statuses;
-  for (auto e : {devserver::Endpoint::queryProductPlan, devserver::Endpoint::setupCertificate, devserver::Endpoint::queryProductPlan,
-                 devserver::Endpoint::queryProductPlan})
+  for (auto e : {devserver::Endpoint::queryProductPlan, devserver::Endpoint::setupCertificate,
+                 devserver::Endpoint::queryProductPlan, devserver::Endpoint::queryProductPlan})
     statuses.push_back(table.take(e).value_or(devserver::Fault{}).status.value_or(0));
   EXPECT_EQ(statuses, (std::vector<int>{418, 502, 418, 502}));
   table.clear();
@@ -76,14 +77,19 @@ TEST(StateDirectory, IsMadePrivateOnceAndThenReused) {
   const fs::path dir = parent.path() / "nested" / "state";
   auto contents = [&dir] {
     std::string all;
-    for (const char* name : {"ca.pem", "ca.key", "server.pem", "server.key", "sap-root.pem", "sap-root.key", "setup.crt", "setup.key"})
+    for (const char* name :
+         {"ca.pem", "ca.key", "server.pem", "server.key", "sap-root.pem", "sap-root.key", "setup.crt", "setup.key"})
       all += "|" + zlkatest::readFile(dir / name);
     return all;
   };
-  auto mode = [](const fs::path& p) { struct stat s{}; return ::stat(p.c_str(), &s) == 0 ? s.st_mode & 07777 : 0; };
+  auto mode = [](const fs::path& p) {
+    struct stat s {};
+    return ::stat(p.c_str(), &s) == 0 ? s.st_mode & 07777 : 0;
+  };
   devserver::prepareStateDirectory(dir);
   EXPECT_EQ(mode(dir), 0700u);
-  for (const char* key : {"ca.key", "server.key", "sap-root.key", "setup.key"}) EXPECT_EQ(mode(dir / key), 0600u) << key;
+  for (const char* key : {"ca.key", "server.key", "sap-root.key", "setup.key"})
+    EXPECT_EQ(mode(dir / key), 0600u) << key;
   const std::string first = contents();
   EXPECT_THAT(first + "|", testing::Not(HasSubstr("||")));  // none is empty
   devserver::prepareStateDirectory(dir);
@@ -124,7 +130,8 @@ TEST(DevServer, RefusesUnsignedAndMalformedRequestsInJSONWithoutASignature) {
 TEST(DevServer, TheProgramServesUntilSIGTERMAndRefusesBadArguments) {
   zlkatest::TempDir dir;
   const fs::path state = dir.path() / "state";
-  zlkatest::ChildProcess program({ZLKA_DEVSERVER_BINARY, "--listen", "127.0.0.1:0", "--state-dir", state.string()}, dir.path());
+  zlkatest::ChildProcess program({ZLKA_DEVSERVER_BINARY, "--listen", "127.0.0.1:0", "--state-dir", state.string()},
+                                 dir.path());
   std::smatch match;
   std::string line;
   const std::regex announced("zlka-devserver listening on https://127\\.0\\.0\\.1:([0-9]+) \\(state in (.*)\\)\n");

@@ -23,8 +23,8 @@
 #include <chrono>
 #include <cstdint>
 #include <filesystem>
-#include <nlohmann/json.hpp>
 #include <memory>
+#include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
 

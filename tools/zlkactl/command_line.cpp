@@ -1,7 +1,6 @@
 #include "zlkactl/command_line.h"
 
 #include <CLI/CLI.hpp>
-
 #include <algorithm>
 
 #include "platform/bus/bus_values.h"
@@ -40,22 +39,27 @@ bool validBus(const std::string& bus) {
 
 std::optional<zlka::Bytes> token(const Invocation& inv, std::string* error) {
   std::optional<platform::Data> data;
-  if (inv.tokenFile) data = readTokenFile(*inv.tokenFile, error);
-  else if (inv.tokenHex) data = parseHexToken(*inv.tokenHex, error);
-  else if (inv.tokenBase64) data = parseBase64Token(*inv.tokenBase64, error);
+  if (inv.tokenFile)
+    data = readTokenFile(*inv.tokenFile, error);
+  else if (inv.tokenHex)
+    data = parseHexToken(*inv.tokenHex, error);
+  else if (inv.tokenBase64)
+    data = parseBase64Token(*inv.tokenBase64, error);
   if (!data) return std::nullopt;
   return data->toVector();
 }
 
 // What the daemon refuses as InvalidParameter when it is absent, named as the user gives it.
 void requireArguments(const Invocation& inv) {
-  if (!inv.tokenFile && !inv.tokenHex && !inv.tokenBase64) throw CLI::RequiredError("A token (--token-file, --token-hex or --token-base64)");
+  if (!inv.tokenFile && !inv.tokenHex && !inv.tokenBase64)
+    throw CLI::RequiredError("A token (--token-file, --token-hex or --token-base64)");
   if (!inv.uuid) throw CLI::RequiredError("--uuid");
   if (inv.command == Command::Metadata && !inv.locale) throw CLI::RequiredError("--locale");
 }
 
 bool jsonRequested(int argc, const char* const* argv) {
-  return std::any_of(argv + std::min(argc, 1), argv + argc, [](const char* a) { return std::string_view(a) == "--json"; });
+  return std::any_of(argv + std::min(argc, 1), argv + argc,
+                     [](const char* a) { return std::string_view(a) == "--json"; });
 }
 
 bool checkText(const std::optional<std::string>& text, const char* option, std::string* error) {
@@ -79,11 +83,13 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
       ->type_name("BUS")
       ->capture_default_str();
   app.add_flag("--json", inv.json, "Print the answer, and any error, as one line of JSON");
-  app.add_option("--timeout", inv.timeoutSeconds, "Give up on the call after SECONDS (opening a session can take minutes)")
+  app.add_option("--timeout", inv.timeoutSeconds,
+                 "Give up on the call after SECONDS (opening a session can take minutes)")
       ->type_name("SECONDS")
       ->check(CLI::Range(0.001, 86400.0))
       ->capture_default_str();
-  app.add_option("--config", inv.configPath, "The configuration file whose [settings] suite_dir holds the settings (defaults only)")
+  app.add_option("--config", inv.configPath,
+                 "The configuration file whose [settings] suite_dir holds the settings (defaults only)")
       ->type_name("PATH")
       ->capture_default_str();
   app.footer(
@@ -97,12 +103,17 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
 
   std::string file, hex, base64, uuid, locale, requestInfo;
 
-  CLI::App* metadata = app.add_subcommand("metadata", "Ask for the product-plan metadata of a token (RequestMetadataForToken)");
+  CLI::App* metadata =
+      app.add_subcommand("metadata", "Ask for the product-plan metadata of a token (RequestMetadataForToken)");
   TokenOptions metadataToken = addTokenOptions(*metadata, file, hex, base64);
   CLI::Option* metadataUUID = metadata->add_option("--uuid", uuid, "The accessory's UUID")->type_name("UUID");
-  CLI::Option* metadataLocale = metadata->add_option("--locale", locale, "The locale to answer in, as an identifier such as en_US")->type_name("ID");
+  CLI::Option* metadataLocale =
+      metadata->add_option("--locale", locale, "The locale to answer in, as an identifier such as en_US")
+          ->type_name("ID");
   CLI::Option* metadataInfo =
-      metadata->add_option("--request-info", requestInfo, "Request info as a JSON object, e.g. '{\"source\":\"setup\"}'")->type_name("JSON");
+      metadata
+          ->add_option("--request-info", requestInfo, "Request info as a JSON object, e.g. '{\"source\":\"setup\"}'")
+          ->type_name("JSON");
   metadata->footer(
       "Prints the ppid, the locale and the metadata; with --json {\"locale\":...,\"metadata\":{...},\"ppid\":...}.\n"
       "Example:\n"
@@ -117,7 +128,8 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
       "Example:\n"
       "  zlkactl activate --token-file token.bin --uuid 6f1c9a52-0000-4000-8000-000000000001");
 
-  CLI::App* confirm = app.add_subcommand("confirm", "Confirm that an accessory took its new token (ConfirmActivationForToken)");
+  CLI::App* confirm =
+      app.add_subcommand("confirm", "Confirm that an accessory took its new token (ConfirmActivationForToken)");
   TokenOptions confirmToken = addTokenOptions(*confirm, file, hex, base64);
   CLI::Option* confirmUUID = confirm->add_option("--uuid", uuid, "The accessory's UUID")->type_name("UUID");
   confirm->footer(
@@ -125,10 +137,12 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
       "Example:\n"
       "  zlkactl confirm --token-file new-token.bin --uuid 6f1c9a52-0000-4000-8000-000000000001");
 
-  CLI::App* defaults = app.add_subcommand("defaults", "Read and edit the developer settings suite com.kestro.ZLKAuthentication");
+  CLI::App* defaults =
+      app.add_subcommand("defaults", "Read and edit the developer settings suite com.kestro.ZLKAuthentication");
   defaults->require_subcommand(1);
   defaults->footer(
-      "The suite is <suite_dir>/com.kestro.ZLKAuthentication.json, suite_dir from [settings] of the configuration file.\n"
+      "The suite is <suite_dir>/com.kestro.ZLKAuthentication.json, suite_dir from [settings] of the configuration "
+      "file.\n"
       "Examples:\n"
       "  zlkactl defaults read\n"
       "  zlkactl --config ./zlkad.toml defaults write CustomServer https://127.0.0.1:8443\n"
@@ -140,7 +154,10 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
   CLI::App* write = defaults->add_subcommand("write", "Set a setting (only one zlkad reads, unless --force)");
   write->add_flag("--force", inv.force, "Write a key that zlkad is not known to read");
   write->add_option("KEY", key, "The setting")->required();
-  write->add_option("VALUE", value, "Its value: JSON when it is one JSON value (true, 3, \"x\", {...}), else a plain string")->required();
+  write
+      ->add_option("VALUE", value,
+                   "Its value: JSON when it is one JSON value (true, 3, \"x\", {...}), else a plain string")
+      ->required();
   write->footer("Examples:\n  zlkactl defaults write ForceNetworkFailure true\n  zlkactl defaults write Server it");
   CLI::App* remove = defaults->add_subcommand("delete", "Remove a setting");
   remove->add_option("KEY", key, "The setting")->required();
@@ -156,7 +173,8 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
   try {
     app.parse(argc, argv);
     if (!validBus(inv.bus))
-      throw CLI::ValidationError("--bus", "must be system, session or a D-Bus address such as unix:path=/run/dbus/system_bus_socket");
+      throw CLI::ValidationError(
+          "--bus", "must be system, session or a D-Bus address such as unix:path=/run/dbus/system_bus_socket");
     if (*metadata) {
       takeOperation(Command::Metadata, metadataToken, metadataUUID);
       inv.locale = given(metadataLocale, locale);

@@ -9,7 +9,8 @@ namespace zlkactl {
 namespace {
 
 template <class T>
-int finish(const zlka::Result<T>& result, std::ostream& out, std::ostream& err, std::string (*format)(const T&, bool), bool json) {
+int finish(const zlka::Result<T>& result, std::ostream& out, std::ostream& err, std::string (*format)(const T&, bool),
+           bool json) {
   if (!result) {
     err << formatError(result.error(), json);
     return exitStatusFor(result.error());
@@ -28,7 +29,8 @@ bool isClientError(const zlka::Error& error, zlka::ClientErrorCode code) {
 
 int exitStatusFor(const zlka::Error& error) {
   using zlka::ClientErrorCode;
-  if (isClientError(error, ClientErrorCode::ConnectionFailed) || isClientError(error, ClientErrorCode::ServiceUnavailable))
+  if (isClientError(error, ClientErrorCode::ConnectionFailed) ||
+      isClientError(error, ClientErrorCode::ServiceUnavailable))
     return kExitUnreachable;
   if (isClientError(error, ClientErrorCode::InvalidRequest)) return kExitUsage;
   return kExitOperationFailed;
@@ -44,11 +46,14 @@ int runOperation(const Invocation& inv, std::ostream& out, std::ostream& err) {
   std::string problem;
   std::optional<zlka::MetadataArguments> metadata;
   std::optional<zlka::TokenArguments> token;
-  if (inv.command == Command::Metadata) metadata = metadataArguments(inv, &problem);
-  else token = tokenArguments(inv, &problem);
+  if (inv.command == Command::Metadata)
+    metadata = metadataArguments(inv, &problem);
+  else
+    token = tokenArguments(inv, &problem);
   if (!metadata && !token) return fail(inv, err, kExitUsage, problem);
 
-  const auto timeout = std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::duration<double>(inv.timeoutSeconds));
+  const auto timeout =
+      std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::duration<double>(inv.timeoutSeconds));
   auto client = zlka::Client::connect({.bus = inv.bus, .callTimeout = timeout});
   if (!client) {
     err << formatError(client.error(), inv.json);
@@ -56,9 +61,12 @@ int runOperation(const Invocation& inv, std::ostream& out, std::ostream& err) {
   }
   zlka::Client& c = *client.value();
   switch (inv.command) {
-    case Command::Metadata: return finish(c.requestMetadata(*metadata), out, err, &formatMetadata, inv.json);
-    case Command::Activate: return finish(c.requestActivation(*token), out, err, &formatActivation, inv.json);
-    default: return finish(c.confirmActivation(*token), out, err, &confirmationText, inv.json);
+    case Command::Metadata:
+      return finish(c.requestMetadata(*metadata), out, err, &formatMetadata, inv.json);
+    case Command::Activate:
+      return finish(c.requestActivation(*token), out, err, &formatActivation, inv.json);
+    default:
+      return finish(c.confirmActivation(*token), out, err, &confirmationText, inv.json);
   }
 }
 
@@ -66,8 +74,10 @@ int run(const Invocation& inv, std::ostream& out, std::ostream& err) {
   switch (inv.command) {
     case Command::Metadata:
     case Command::Activate:
-    case Command::Confirm: return runOperation(inv, out, err);
-    default: return runDefaults(inv, out, err);
+    case Command::Confirm:
+      return runOperation(inv, out, err);
+    default:
+      return runDefaults(inv, out, err);
   }
 }
 

@@ -13,7 +13,8 @@ namespace zlkactl {
 namespace {
 
 bool daemonReads(const std::string& key) {
-  return std::any_of(std::begin(ZLKAUserDefaultsKeys), std::end(ZLKAUserDefaultsKeys), [&](const char* known) { return key == known; });
+  return std::any_of(std::begin(ZLKAUserDefaultsKeys), std::end(ZLKAUserDefaultsKeys),
+                     [&](const char* known) { return key == known; });
 }
 
 std::string knownKeys() {
@@ -27,7 +28,8 @@ std::string knownKeys() {
 int runDefaults(const Invocation& inv, std::ostream& out, std::ostream& err) {
   // A misspelt key would be written and silently ignored by the daemon.
   if (inv.command == Command::DefaultsWrite && !inv.force && !daemonReads(*inv.key))
-    return fail(inv, err, kExitUsage, "zlkad reads no setting '" + *inv.key + "' (it reads " + knownKeys() + "); --force writes it anyway");
+    return fail(inv, err, kExitUsage,
+                "zlkad reads no setting '" + *inv.key + "' (it reads " + knownKeys() + "); --force writes it anyway");
   std::string problem;
   std::optional<platform::Configuration> configuration = platform::loadConfiguration(inv.configPath, &problem);
   if (!configuration) return fail(inv, err, kExitUsage, problem);
@@ -42,12 +44,14 @@ int runDefaults(const Invocation& inv, std::ostream& out, std::ostream& err) {
       }
       std::optional<platform::Value> value = store.objectForKey(*inv.key);
       if (!value)
-        return fail(inv, err, kExitOperationFailed, std::string(ZLKAUserDefaultsDomain) + " has no value for '" + *inv.key + "' (" + path + ")");
+        return fail(inv, err, kExitOperationFailed,
+                    std::string(ZLKAUserDefaultsDomain) + " has no value for '" + *inv.key + "' (" + path + ")");
       out << jsonText(*value, true) << "\n";
       return kExitSuccess;
     }
     case Command::DefaultsWrite:
-      if (!store.setObject(*inv.key, parseSettingsValue(*inv.value))) return fail(inv, err, kExitOperationFailed, "cannot write " + path);
+      if (!store.setObject(*inv.key, parseSettingsValue(*inv.value)))
+        return fail(inv, err, kExitOperationFailed, "cannot write " + path);
       return kExitSuccess;
     default:
       if (!store.removeObject(*inv.key)) return fail(inv, err, kExitOperationFailed, "cannot write " + path);

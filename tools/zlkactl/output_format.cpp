@@ -15,7 +15,8 @@ std::string jsonText(const platform::Value& value, bool pretty) {
 
 std::string formatMetadata(const zlka::Metadata& reply, bool json) {
   // The library hands over JSON it has already parsed once, so this parse succeeds.
-  platform::Value metadata = platform::json::parse(reply.metadataJSON).value_or(platform::Value(platform::Dictionary{}));
+  platform::Value metadata =
+      platform::json::parse(reply.metadataJSON).value_or(platform::Value(platform::Dictionary{}));
   if (json) {
     platform::Dictionary out{{"ppid", reply.ppid}, {"locale", reply.locale}, {"metadata", std::move(metadata)}};
     return jsonText(platform::Value(std::move(out)), false) + "\n";
@@ -26,7 +27,8 @@ std::string formatMetadata(const zlka::Metadata& reply, bool json) {
 std::string formatActivation(const zlka::Bytes& bytes, bool json) {
   platform::Data token(bytes.data(), bytes.size());
   if (json) {
-    platform::Dictionary out{{"token_hex", hexString(token)}, {"token_base64", platform::base64Encode(token.span())},
+    platform::Dictionary out{{"token_hex", hexString(token)},
+                             {"token_base64", platform::base64Encode(token.span())},
                              {"length", static_cast<uint64_t>(token.length())}};
     return jsonText(platform::Value(std::move(out)), false) + "\n";
   }
@@ -44,6 +46,8 @@ std::string formatError(const zlka::Error& error, bool json) {
   return "zlkactl: " + error.domain + " " + std::to_string(error.code) + ": " + error.description + "\n";
 }
 
-zlka::Error toolError(int exitStatus, std::string description) { return {kToolErrorDomain, exitStatus, std::move(description), {}}; }
+zlka::Error toolError(int exitStatus, std::string description) {
+  return {kToolErrorDomain, exitStatus, std::move(description), {}};
+}
 
 }  // namespace zlkactl

@@ -59,11 +59,14 @@ std::optional<platform::Data> parseHexToken(std::string_view text, std::string* 
 
 std::optional<platform::Data> parseBase64Token(std::string_view text, std::string* error) {
   if (auto data = platform::base64DecodeStrict(text)) return data;
-  return fail<platform::Data>(error, "--token-base64: not valid base64 (standard alphabet, '=' padding, no white space)");
+  return fail<platform::Data>(error,
+                              "--token-base64: not valid base64 (standard alphabet, '=' padding, no white space)");
 }
 
 std::optional<platform::Data> readTokenFile(const std::filesystem::path& path, std::string* error) {
-  auto failure = [&](int e) { return fail<platform::Data>(error, "--token-file: cannot read " + path.string() + ": " + std::strerror(e)); };
+  auto failure = [&](int e) {
+    return fail<platform::Data>(error, "--token-file: cannot read " + path.string() + ": " + std::strerror(e));
+  };
   FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
   if (fd.get() < 0) return failure(errno);
   std::vector<uint8_t> bytes;
@@ -75,7 +78,8 @@ std::optional<platform::Data> readTokenFile(const std::filesystem::path& path, s
     if (n == 0) break;
     bytes.insert(bytes.end(), buffer, buffer + n);
     if (bytes.size() > kMaxTokenFileSize)
-      return fail<platform::Data>(error, "--token-file: " + path.string() + " is larger than " + std::to_string(kMaxTokenFileSize) + " bytes");
+      return fail<platform::Data>(
+          error, "--token-file: " + path.string() + " is larger than " + std::to_string(kMaxTokenFileSize) + " bytes");
   }
   return platform::Data(std::move(bytes));
 }
@@ -84,8 +88,10 @@ std::optional<platform::Dictionary> parseRequestInfo(std::string_view json, std:
   std::string problem;
   std::optional<platform::Value> value = platform::json::parse(json, &problem);
   if (!value) return fail<platform::Dictionary>(error, "--request-info: not valid JSON: " + problem);
-  if (!value->dictionary()) return fail<platform::Dictionary>(error, "--request-info: must be a JSON object, not an array");
-  if (auto reason = zlka_client::unsendableReason(*value, "requestInfo")) return fail<platform::Dictionary>(error, "--request-info: " + *reason);
+  if (!value->dictionary())
+    return fail<platform::Dictionary>(error, "--request-info: must be a JSON object, not an array");
+  if (auto reason = zlka_client::unsendableReason(*value, "requestInfo"))
+    return fail<platform::Dictionary>(error, "--request-info: " + *reason);
   return *value->dictionary();
 }
 

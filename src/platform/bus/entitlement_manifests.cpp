@@ -11,8 +11,8 @@
 #include <array>
 #include <limits>
 
-#include "platform/values/json.h"
 #include "platform/log/log.h"
+#include "platform/values/json.h"
 
 namespace platform {
 
@@ -49,7 +49,8 @@ std::optional<uid_t> uidOfUser(const std::string& name) {
 std::optional<uid_t> uidOfNumber(const Value& v) {
   // (uid_t)-1 means "no user" to the kernel, so it can never pin one.
   constexpr uint64_t kLargest = std::numeric_limits<uid_t>::max() - 1;
-  if (const int64_t* i = v.integer(); i && *i >= 0 && static_cast<uint64_t>(*i) <= kLargest) return static_cast<uid_t>(*i);
+  if (const int64_t* i = v.integer(); i && *i >= 0 && static_cast<uint64_t>(*i) <= kLargest)
+    return static_cast<uid_t>(*i);
   if (const uint64_t* u = v.unsignedInteger(); u && *u <= kLargest) return static_cast<uid_t>(*u);
   return std::nullopt;
 }

@@ -57,7 +57,8 @@ int Listener::Core::run() {
   // Answers handed over as the loop ended still go out, and a call left open (the loop failed) is
   // answered rather than left waiting.
   mailbox_.drain();
-  if (size_t left = ledger_.failAll(BusError{kBusErrorNoServer, "The service shut down before the operation finished."}))
+  if (size_t left =
+          ledger_.failAll(BusError{kBusErrorNoServer, "The service shut down before the operation finished."}))
     log(LogLevel::Error, "Messaging: the event loop ended with %zu call(s) unanswered", left);
   return rc < 0 ? 1 : rc;
 }

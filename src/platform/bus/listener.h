@@ -8,13 +8,13 @@
 // when the drain limit passes), then resume() returns. SIGHUP runs the reload hook.
 #pragma once
 
+#include <systemd/sd-event.h>
+
 #include <chrono>
 #include <functional>
 #include <memory>
 #include <optional>
 #include <string>
-
-#include <systemd/sd-event.h>
 
 #include "platform/bus/connection.h"
 #include "platform/bus/entitlement_manifests.h"
@@ -30,13 +30,13 @@ struct ListenerOptions {
   // The entitlement lookup of a new peer, from the credentials the bus recorded for it. Runs once
   // per peer, on the peer's queue before any of its calls, so it may read /proc at leisure.
   std::function<EntitlementLookup(const PeerCredentials&)> entitlementsForPeer;
-  std::function<void()> onReload;              // SIGHUP
+  std::function<void()> onReload;  // SIGHUP
   std::optional<std::chrono::seconds> exitOnIdle;
-  std::chrono::seconds drainLimit{120};        // longest wait for calls in flight at shutdown
+  std::chrono::seconds drainLimit{120};  // longest wait for calls in flight at shutdown
   // Calls of one peer worked on at once; its further calls wait in order, so a greedy peer cannot
   // take the workers, connections or memory that the others need.
   size_t maxCallsPerPeer = 8;
-  bool notifyReady = true;                     // READY=1 through sd_notify once the name is owned
+  bool notifyReady = true;  // READY=1 through sd_notify once the name is owned
   // Runs on the bus thread once the interface is exported, before the name is requested, with the
   // loop's bus and event loop, to add objects, properties and timers of the caller's own; what it
   // returns is kept until the loop ends.

@@ -83,7 +83,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   std::vector<sd_bus_vtable> vtable_;  // read by sd-bus until vtableSlot_ goes
   std::vector<std::string> names_;
   BusSlotPtr vtableSlot_;
-  std::shared_ptr<void> serving_;  // what options_.onServing made
+  std::shared_ptr<void> serving_;         // what options_.onServing made
   sd_event_source* idleTimer_ = nullptr;  // one of sources_
   std::vector<EventSourcePtr> sources_;
   PeerTable peers_;

@@ -86,7 +86,8 @@ int Listener::Core::dispatch(sd_bus_message* m) {
     for (const auto& candidate : interface->methods)
       if (candidate.name == member) method = &candidate;
   if (!method) {
-    CallLedger::sendError(m, BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
+    CallLedger::sendError(
+        m, BusError{"org.freedesktop.DBus.Error.UnknownMethod", "No method " + member + " is exported here."});
     return 1;
   }
   DecodedCall decoded;

@@ -78,10 +78,9 @@ void PeerTable::identify(Peer& peer, sd_bus_message* credentialsReply, const std
     log(LogLevel::Error, "No credentials for peer %s%s%s: it holds no entitlements", peer.connection->peerName(),
         error.empty() ? "" : ": ", error);
   else if (entitlementsForPeer_)
-    peer.connection->queue()->async(
-        [connection = peer.connection, credentials, identify = entitlementsForPeer_] {
-          connection->setEntitlementLookup(identify(**credentials));
-        });
+    peer.connection->queue()->async([connection = peer.connection, credentials, identify = entitlementsForPeer_] {
+      connection->setEntitlementLookup(identify(**credentials));
+    });
   peer.identified = true;
   pump(peer);
 }

@@ -3,9 +3,10 @@
 // new contents, never a mix.
 #pragma once
 
+#include <sys/types.h>
+
 #include <filesystem>
 #include <string_view>
-#include <sys/types.h>
 
 namespace platform {
 

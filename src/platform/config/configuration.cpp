@@ -1,10 +1,10 @@
 #include "platform/config/configuration.h"
 
 #include <curl/curl.h>
+#include <toml++/toml.h>
 
 #include <memory>
 #include <mutex>
-#include <toml++/toml.h>
 
 #include "platform/config/readable_file.h"
 
@@ -59,7 +59,8 @@ class Reader {
     if (!n) return true;
     const toml::value<int64_t>* v = n->as_integer();
     if (!v || v->get() < lowest || v->get() > highest)
-      return fail(std::string(key), "expected a whole number from " + std::to_string(lowest) + " to " + std::to_string(highest));
+      return fail(std::string(key),
+                  "expected a whole number from " + std::to_string(lowest) + " to " + std::to_string(highest));
     out = static_cast<unsigned>(v->get());
     return true;
   }
@@ -99,7 +100,8 @@ void collectUnknownKeys(const toml::table& table, const std::string& prefix, std
   for (const auto& [k, v] : table) {
     std::string key(k.str());
     std::string full = prefix.empty() ? key : prefix + "." + key;
-    bool ok = allowed != known.end() && std::find(allowed->second.begin(), allowed->second.end(), key) != allowed->second.end();
+    bool ok = allowed != known.end() &&
+              std::find(allowed->second.begin(), allowed->second.end(), key) != allowed->second.end();
     if (!ok) {
       unknown.push_back(full);
       continue;
@@ -118,8 +120,8 @@ std::optional<std::string> normalizedBaseURL(const std::string& url) {
   if (!u || curl_url_set(u.get(), CURLUPART_URL, url.c_str(), 0) != CURLUE_OK) return std::nullopt;
   if (part(u.get(), CURLUPART_SCHEME) != "https" || part(u.get(), CURLUPART_HOST).empty()) return std::nullopt;
   std::string path = part(u.get(), CURLUPART_PATH);
-  if (!(path.empty() || path == "/") || !part(u.get(), CURLUPART_QUERY).empty() || !part(u.get(), CURLUPART_FRAGMENT).empty() ||
-      !part(u.get(), CURLUPART_USER).empty())
+  if (!(path.empty() || path == "/") || !part(u.get(), CURLUPART_QUERY).empty() ||
+      !part(u.get(), CURLUPART_FRAGMENT).empty() || !part(u.get(), CURLUPART_USER).empty())
     return std::nullopt;
   std::string out = url;
   while (!out.empty() && out.back() == '/') out.pop_back();
@@ -144,7 +146,8 @@ std::optional<Configuration> loadConfiguration(const std::filesystem::path& path
   c.path = path;
   Reader r(root, path.string());
   std::string deviceClass, level, trustAnchor, settingsDir, entitlementsDir;
-  bool ok = r.boolean("device.internal_build", c.device.internalBuild, true) && r.string("device.device_class", deviceClass, true);
+  bool ok = r.boolean("device.internal_build", c.device.internalBuild, true) &&
+            r.string("device.device_class", deviceClass, true);
   c.device.deviceClass = deviceClass;
   for (const char* env : {"prod", "it", "ut", "maint"}) {
     if (!ok) break;
@@ -173,8 +176,10 @@ std::optional<Configuration> loadConfiguration(const std::filesystem::path& path
   ok = ok && r.string("log.level", level, false) && r.boolean("log.private_data", c.privateData, false);
   if (ok) {
     auto parsed = logLevelFromName(level);
-    if (!parsed) ok = r.fail("log.level", "'" + level + "' is not one of debug, info, default, error, fault");
-    else c.logLevel = *parsed;
+    if (!parsed)
+      ok = r.fail("log.level", "'" + level + "' is not one of debug, info, default, error, fault");
+    else
+      c.logLevel = *parsed;
   }
   // Each connection worker costs a thread; past a few thousand the bound no longer protects anything.
   ok = ok && r.count("service.max_workers", c.maxWorkers, 2, 4096);

@@ -34,7 +34,7 @@ struct Configuration {
   std::filesystem::path entitlementsDirectory = "/etc/zlka/entitlements.d";
   LogLevel logLevel = LogLevel::Default;
   bool privateData = false;
-  unsigned maxWorkers = 64;  // [service] max_workers: threads that connection work may use
+  unsigned maxWorkers = 64;           // [service] max_workers: threads that connection work may use
   std::vector<std::string> warnings;  // "zlkad.toml: unknown key 'x.y'"
 
   static constexpr char kDefaultPath[] = "/etc/zlka/zlkad.toml";

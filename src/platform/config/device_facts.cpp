@@ -1,7 +1,8 @@
 #include "platform/config/device_facts.h"
 
-#include <mutex>
 #include <toml++/toml.h>
+
+#include <mutex>
 
 #include "platform/log/log.h"
 

@@ -12,8 +12,8 @@
 
 #include "platform/config/atomic_file.h"
 #include "platform/config/configuration.h"
-#include "platform/values/json.h"
 #include "platform/log/log.h"
+#include "platform/values/json.h"
 
 namespace platform {
 

@@ -4,9 +4,10 @@
 // reads as empty; an unparsable one is logged once per change.
 #pragma once
 
+#include <sys/stat.h>
+
 #include <filesystem>
 #include <functional>
-#include <sys/stat.h>
 #include <memory>
 #include <mutex>
 #include <optional>

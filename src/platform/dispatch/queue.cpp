@@ -21,7 +21,8 @@ namespace detail {
 // to run (that work holds it), so a queue dropped by its own work finishes in the background.
 class QueueEngine : public std::enable_shared_from_this<QueueEngine> {
  public:
-  QueueEngine(const Queue* owner, std::string label, WorkerPool& pool) : owner_(owner), label_(std::move(label)), pool_(pool) {}
+  QueueEngine(const Queue* owner, std::string label, WorkerPool& pool)
+      : owner_(owner), label_(std::move(label)), pool_(pool) {}
   virtual ~QueueEngine() = default;
 
   virtual void submit(std::function<void()> work, bool barrier) = 0;
@@ -196,8 +197,10 @@ class ConcurrentEngine final : public QueueEngine {
 
   void submit(std::function<void()> work, bool barrier) override {
     std::lock_guard lock(mutex_);
-    if (held_.empty() && !barrierRunning_ && started_ < width_ && (!barrier || started_ == 0)) start(std::move(work), barrier);
-    else held_.push_back({std::move(work), barrier});
+    if (held_.empty() && !barrierRunning_ && started_ < width_ && (!barrier || started_ == 0))
+      start(std::move(work), barrier);
+    else
+      held_.push_back({std::move(work), barrier});
   }
 
   bool runInline(std::function<void()>&) override { return false; }
@@ -258,7 +261,8 @@ class ConcurrentEngine final : public QueueEngine {
 }  // namespace detail
 
 std::shared_ptr<Queue> Queue::serial(std::string label, WorkerPool* pool) {
-  return std::shared_ptr<Queue>(new Queue(std::move(label), true, 1, pool ? *pool : WorkerPool::shared()), &Queue::release);
+  return std::shared_ptr<Queue>(new Queue(std::move(label), true, 1, pool ? *pool : WorkerPool::shared()),
+                                &Queue::release);
 }
 
 std::shared_ptr<Queue> Queue::concurrent(std::string label, unsigned width, WorkerPool* pool) {
@@ -267,9 +271,12 @@ std::shared_ptr<Queue> Queue::concurrent(std::string label, unsigned width, Work
                                 &Queue::release);
 }
 
-Queue::Queue(std::string label, bool serial, unsigned width, WorkerPool& pool) : label_(std::move(label)), serial_(serial) {
-  if (serial_) engine_ = std::make_shared<detail::SerialEngine>(this, label_, pool);
-  else engine_ = std::make_shared<detail::ConcurrentEngine>(this, label_, pool, width);
+Queue::Queue(std::string label, bool serial, unsigned width, WorkerPool& pool)
+    : label_(std::move(label)), serial_(serial) {
+  if (serial_)
+    engine_ = std::make_shared<detail::SerialEngine>(this, label_, pool);
+  else
+    engine_ = std::make_shared<detail::ConcurrentEngine>(this, label_, pool, width);
 }
 
 Queue::~Queue() = default;

@@ -57,8 +57,9 @@ void HTTPSession::Engine::submit(const std::shared_ptr<HTTPTaskState>& task) {
     }
   }
   complete(task, HTTPOutcome::failure(stopping ? cancelledError(task->request.URL)
-                                    : transportError(CURLE_OUT_OF_MEMORY, "no thread could be started for the transfer",
-                                                     task->request.URL)));
+                                               : transportError(CURLE_OUT_OF_MEMORY,
+                                                                "no thread could be started for the transfer",
+                                                                task->request.URL)));
 }
 
 void HTTPSession::Engine::cancel(const std::shared_ptr<HTTPTaskState>& task) {

@@ -19,10 +19,10 @@
 #include <optional>
 #include <string>
 
+#include "platform/dispatch/queue.h"
+#include "platform/http/http_message.h"
 #include "platform/values/data.h"
 #include "platform/values/error.h"
-#include "platform/http/http_message.h"
-#include "platform/dispatch/queue.h"
 
 namespace platform {
 
@@ -38,14 +38,14 @@ enum HTTPErrorCode : int64_t {
   HTTPErrorSecureConnectionFailed = -1200,
 };
 
-using HTTPCompletion = std::function<void(std::optional<Data> body, std::optional<HTTPResponse> response,
-                                          std::optional<Error> error)>;
+using HTTPCompletion =
+    std::function<void(std::optional<Data> body, std::optional<HTTPResponse> response, std::optional<Error> error)>;
 
 struct HTTPSessionConfiguration {
-  std::string caFile;                         // extra CA bundle; empty: the system store
-  size_t maximumResponseSize = 16u << 20;     // larger answers fail with HTTPErrorResourceTooLarge
-  std::string label = "HTTPSession";          // names the callback queue
-  long maximumConnectionsPerHost = 32;        // further requests to that server wait for one
+  std::string caFile;                      // extra CA bundle; empty: the system store
+  size_t maximumResponseSize = 16u << 20;  // larger answers fail with HTTPErrorResourceTooLarge
+  std::string label = "HTTPSession";       // names the callback queue
+  long maximumConnectionsPerHost = 32;     // further requests to that server wait for one
 
   // Both take the CA file of the current configuration.
   static HTTPSessionConfiguration defaultSessionConfiguration();

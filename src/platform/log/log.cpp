@@ -94,7 +94,6 @@ void appendEscaped(std::string& line, std::string_view text) {
   }
 }
 
-
 void writeStderr(const std::string& identifier, const Log& log, LogLevel level, const std::string& message) {
   std::string line =
       timestamp() + " " + identifier + "[" + std::to_string(getpid()) + "] <" + std::string(logLevelName(level)) + ">";
@@ -236,7 +235,6 @@ std::shared_ptr<const Log> Log::create(std::string subsystem, std::string catego
 }
 
 bool Log::enabled(LogLevel level) { return static_cast<int>(level) >= gMinimum.load(std::memory_order_relaxed); }
-
 
 void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogFormat& format,
               std::span<const LogArg> args) {

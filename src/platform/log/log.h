@@ -41,10 +41,10 @@ struct MessageID {
 };
 
 struct LogSettings {
-  LogLevel minimum = LogLevel::Default;  // lowest level written
-  bool privateData = false;              // show %{private} arguments
-  LogBackend backend = LogBackend::Auto; // Auto: the journal when stderr is connected to it
-  std::string identifier = "zlkad";      // SYSLOG_IDENTIFIER and stderr prefix
+  LogLevel minimum = LogLevel::Default;   // lowest level written
+  bool privateData = false;               // show %{private} arguments
+  LogBackend backend = LogBackend::Auto;  // Auto: the journal when stderr is connected to it
+  std::string identifier = "zlkad";       // SYSLOG_IDENTIFIER and stderr prefix
 };
 void configureLog(const LogSettings& settings);
 LogSettings currentLogSettings();
@@ -56,9 +56,10 @@ bool logGoesToJournal();
 // than std::source_location, which the clang of Debian 12 cannot use with its libstdc++.)
 struct LogFormat {
   template <class S>
-    requires std::is_convertible_v<const S&, std::string_view>
-  LogFormat(const S& text, const char* file = __builtin_FILE(), unsigned line = __builtin_LINE(),
-            const char* function = __builtin_FUNCTION())
+  requires std::is_convertible_v<const S&, std::string_view> LogFormat(const S& text,
+                                                                       const char* file = __builtin_FILE(),
+                                                                       unsigned line = __builtin_LINE(),
+                                                                       const char* function = __builtin_FUNCTION())
       : text(text), file(file), line(line), function(function) {}
   std::string_view text;
   const char* file;
@@ -74,7 +75,7 @@ struct LogEntry {
   std::string message;
   std::string file;  // "src/network/request_pipeline.cpp": from the source tree's root
   unsigned line = 0;
-  std::string function;  // "failure": the function's own name, as __func__ gives it
+  std::string function;   // "failure": the function's own name, as __func__ gives it
   std::string messageID;  // empty for most entries
 };
 
@@ -98,44 +99,62 @@ class Log {
   static bool enabled(LogLevel level);
 
  private:
-  Log(std::string subsystem, std::string category)
-      : subsystem_(std::move(subsystem)), category_(std::move(category)) {}
+  Log(std::string subsystem, std::string category) : subsystem_(std::move(subsystem)), category_(std::move(category)) {}
   std::string subsystem_, category_;
 };
 
 // A formatted argument; built from the call's arguments only when the level is enabled.
 class LogArg {
  public:
-  struct Pointer { uintptr_t value; };
+  struct Pointer {
+    uintptr_t value;
+  };
   struct Nil {};
   using Storage = std::variant<int64_t, uint64_t, double, Pointer, std::string, Nil>;
 
   template <class T>
-    requires(!std::is_same_v<T, LogArg>)
-  LogArg(const T& v) : v_(convert(v)) {}
+  requires(!std::is_same_v<T, LogArg>) LogArg(const T& v) : v_(convert(v)) {}
   const Storage& storage() const { return v_; }
 
  private:
   template <class T>
   static Storage convert(const T& v) {
-    if constexpr (std::is_same_v<T, const char*> || std::is_same_v<T, char*>) return v ? Storage(std::string(v)) : Storage(Nil{});
-    else if constexpr (std::is_same_v<T, bool>) return static_cast<int64_t>(v);
-    else if constexpr (std::is_integral_v<T> && std::is_signed_v<T>) return static_cast<int64_t>(v);
-    else if constexpr (std::is_integral_v<T>) return static_cast<uint64_t>(v);
-    else if constexpr (std::is_enum_v<T>) return static_cast<int64_t>(v);
-    else if constexpr (std::is_floating_point_v<T>) return static_cast<double>(v);
-    else if constexpr (std::is_convertible_v<const T&, std::string_view>) return std::string(std::string_view(v));
-    else if constexpr (std::is_pointer_v<T> || std::is_null_pointer_v<T>) return Pointer{reinterpret_cast<uintptr_t>(v)};
-    else if constexpr (requires { v.has_value(); *v; }) return v ? convert(*v) : Storage(Nil{});
-    else if constexpr (requires { v.get(); v->description(); }) return v ? Storage(v->description()) : Storage(Nil{});
-    else return v.description();
+    if constexpr (std::is_same_v<T, const char*> || std::is_same_v<T, char*>)
+      return v ? Storage(std::string(v)) : Storage(Nil{});
+    else if constexpr (std::is_same_v<T, bool>)
+      return static_cast<int64_t>(v);
+    else if constexpr (std::is_integral_v<T> && std::is_signed_v<T>)
+      return static_cast<int64_t>(v);
+    else if constexpr (std::is_integral_v<T>)
+      return static_cast<uint64_t>(v);
+    else if constexpr (std::is_enum_v<T>)
+      return static_cast<int64_t>(v);
+    else if constexpr (std::is_floating_point_v<T>)
+      return static_cast<double>(v);
+    else if constexpr (std::is_convertible_v<const T&, std::string_view>)
+      return std::string(std::string_view(v));
+    else if constexpr (std::is_pointer_v<T> || std::is_null_pointer_v<T>)
+      return Pointer{reinterpret_cast<uintptr_t>(v)};
+    else if constexpr (requires {
+                         v.has_value();
+                         *v;
+                       })
+      return v ? convert(*v) : Storage(Nil{});
+    else if constexpr (requires {
+                         v.get();
+                         v->description();
+                       })
+      return v ? Storage(v->description()) : Storage(Nil{});
+    else
+      return v.description();
   }
   Storage v_;
 };
 
 std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate);
 // writeLog formats and writes one entry (when its level is enabled); `id` may be null.
-void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogFormat& format, std::span<const LogArg> args);
+void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogFormat& format,
+              std::span<const LogArg> args);
 
 template <class... A>
 void log(const Log& target, LogLevel level, LogFormat format, const A&... args) {

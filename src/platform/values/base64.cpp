@@ -38,7 +38,8 @@ std::optional<Data> base64DecodeStrict(std::string_view text) {
   for (size_t i = 0; i < text.size() - pad; ++i)
     if (!inAlphabet(static_cast<unsigned char>(text[i]))) return std::nullopt;
   std::vector<uint8_t> out(text.size() / 4 * 3);
-  int n = EVP_DecodeBlock(out.data(), reinterpret_cast<const unsigned char*>(text.data()), static_cast<int>(text.size()));
+  int n =
+      EVP_DecodeBlock(out.data(), reinterpret_cast<const unsigned char*>(text.data()), static_cast<int>(text.size()));
   if (n < 0) return std::nullopt;
   out.resize(static_cast<size_t>(n) - pad);
   return Data(std::move(out));

@@ -11,8 +11,8 @@ std::string Error::localizedDescription() const {
 }
 
 std::string Error::description() const {
-  std::string out = "Error Domain=" + domain_ + " Code=" + std::to_string(code_) + " \"" +
-                    localizedDescription() + "\"";
+  std::string out =
+      "Error Domain=" + domain_ + " Code=" + std::to_string(code_) + " \"" + localizedDescription() + "\"";
   if (userInfo_) out += " UserInfo=" + Value(*userInfo_).description();
   return out;
 }

@@ -47,11 +47,16 @@ json toJSON(const Value& v) {
 
 Value fromJSON(const json& j) {
   switch (j.type()) {
-    case json::value_t::boolean: return Value(j.get<bool>());
-    case json::value_t::number_integer: return Value(j.get<int64_t>());
-    case json::value_t::number_unsigned: return Value(j.get<uint64_t>());
-    case json::value_t::number_float: return Value(j.get<double>());
-    case json::value_t::string: return Value(j.get_ref<const std::string&>());
+    case json::value_t::boolean:
+      return Value(j.get<bool>());
+    case json::value_t::number_integer:
+      return Value(j.get<int64_t>());
+    case json::value_t::number_unsigned:
+      return Value(j.get<uint64_t>());
+    case json::value_t::number_float:
+      return Value(j.get<double>());
+    case json::value_t::string:
+      return Value(j.get_ref<const std::string&>());
     case json::value_t::array: {
       Array a;
       a.reserve(j.size());
@@ -63,7 +68,8 @@ Value fromJSON(const json& j) {
       for (const auto& [k, m] : j.items()) d.emplace(k, fromJSON(m));
       return Value(std::move(d));
     }
-    default: return Value();
+    default:
+      return Value();
   }
 }
 
@@ -74,8 +80,10 @@ bool depthWithinLimit(std::string_view text) {
   for (size_t i = 0; i < text.size(); ++i) {
     char c = text[i];
     if (inString) {
-      if (c == '\\') ++i;
-      else if (c == '"') inString = false;
+      if (c == '\\')
+        ++i;
+      else if (c == '"')
+        inString = false;
     } else if (c == '"') {
       inString = true;
     } else if (c == '[' || c == '{') {

@@ -5,9 +5,7 @@
 
 namespace platform {
 
-bool Value::isNumber() const {
-  return isBool() || integer() || unsignedInteger() || real();
-}
+bool Value::isNumber() const { return isBool() || integer() || unsignedInteger() || real(); }
 
 const Array* Value::array() const {
   auto p = std::get_if<ArrayPtr>(&v_);
@@ -54,7 +52,8 @@ namespace {
 bool numbersEqual(const Value& a, const Value& b) {
   if (a.integer() && b.integer()) return *a.integer() == *b.integer();
   if (a.unsignedInteger() && b.unsignedInteger()) return *a.unsignedInteger() == *b.unsignedInteger();
-  if (a.integer() && b.unsignedInteger()) return *a.integer() >= 0 && static_cast<uint64_t>(*a.integer()) == *b.unsignedInteger();
+  if (a.integer() && b.unsignedInteger())
+    return *a.integer() >= 0 && static_cast<uint64_t>(*a.integer()) == *b.unsignedInteger();
   if (a.unsignedInteger() && b.integer()) return numbersEqual(b, a);
   return *a.numberValue() == *b.numberValue();
 }
@@ -63,11 +62,21 @@ void appendQuoted(std::string& out, const std::string& s) {
   out += '"';
   for (char c : s) {
     switch (c) {
-      case '"': out += "\\\""; break;
-      case '\\': out += "\\\\"; break;
-      case '\n': out += "\\n"; break;
-      case '\r': out += "\\r"; break;
-      case '\t': out += "\\t"; break;
+      case '"':
+        out += "\\\"";
+        break;
+      case '\\':
+        out += "\\\\";
+        break;
+      case '\n':
+        out += "\\n";
+        break;
+      case '\r':
+        out += "\\r";
+        break;
+      case '\t':
+        out += "\\t";
+        break;
       default:
         if (static_cast<unsigned char>(c) < 0x20) {
           char buf[8];

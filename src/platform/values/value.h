@@ -41,11 +41,9 @@ class Value {
   Value(Null) {}
   Value(bool b) : v_(b) {}
   template <std::signed_integral T>
-    requires(!std::same_as<T, bool>)
-  Value(T i) : v_(static_cast<int64_t>(i)) {}
+  requires(!std::same_as<T, bool>) Value(T i) : v_(static_cast<int64_t>(i)) {}
   template <std::unsigned_integral T>
-    requires(!std::same_as<T, bool>)
-  Value(T u) : v_(static_cast<uint64_t>(u)) {}
+  requires(!std::same_as<T, bool>) Value(T u) : v_(static_cast<uint64_t>(u)) {}
   Value(double d) : v_(d) {}
   Value(const char* s) : v_(std::string(s)) {}
   Value(std::string s) : v_(std::move(s)) {}
