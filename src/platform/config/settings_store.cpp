@@ -18,7 +18,7 @@
 namespace platform {
 
 SettingsStore::SettingsStore(std::string suiteName, std::filesystem::path directory)
-    : suite_(std::move(suiteName)), path_(std::move(directory) / (suite_ + ".json")) {}
+    : suite_(std::move(suiteName)), path_(directory / (suite_ + ".json")) {}
 
 std::shared_ptr<SettingsStore> SettingsStore::openSuite(std::string suiteName) {
   return std::make_shared<SettingsStore>(std::move(suiteName), currentConfiguration()->settingsDirectory);
