@@ -179,6 +179,32 @@ void BM_Operation(benchmark::State& state, Operation op) {
   if (floor > 0) state.counters["p50_over_floor"] = state.counters["p50_us"] / floor;
 }
 
+// The confirmation made with a bare sd-bus call: what the client library adds.
+void BM_OperationBare(benchmark::State& state) {
+  platform::BusPtr bus = connectRaw();
+  const platform::Data token = service_test::sampleToken();
+  timed(state, "", [&] {
+    sd_bus_message* m = nullptr;
+    if (!bus ||
+        sd_bus_message_new_method_call(bus.get(), &m, kName, kPath, kInterface, "ConfirmActivationForToken") < 0)
+      return false;
+    platform::BusMessagePtr call(m);
+    int r = sd_bus_message_open_container(m, 'a', "{sv}");
+    r = r < 0 ? r : sd_bus_message_open_container(m, 'e', "sv");
+    r = r < 0 ? r : sd_bus_message_append(m, "s", "token");
+    r = r < 0 ? r : sd_bus_message_open_container(m, 'v', "ay");
+    r = r < 0 ? r : sd_bus_message_append_array(m, 'y', token.bytes(), token.length());
+    r = r < 0 ? r : sd_bus_message_close_container(m);
+    r = r < 0 ? r : sd_bus_message_close_container(m);
+    r = r < 0 ? r : sd_bus_message_append(m, "{sv}", "uuid", "s", kUUID);
+    r = r < 0 ? r : sd_bus_message_close_container(m);
+    sd_bus_message* reply = nullptr;
+    r = r < 0 ? r : sd_bus_call(bus.get(), m, 0, nullptr, &reply);
+    platform::BusMessagePtr owned(reply);
+    return r >= 0;
+  });
+}
+
 // Operations per second with `clients` callers each on a connection of its own, calling in a loop
 // for a fixed time; the floor does the same with a Ping and a bare signed POST per operation.
 // Failed calls are counted in `failures` (none given: the first one ends the run with -1).
@@ -360,6 +386,7 @@ BENCHMARK_CAPTURE(BM_FloorHTTPS, confirmation, Operation::confirmation)->UseReal
 BENCHMARK_CAPTURE(BM_Operation, metadata, Operation::metadata)->UseRealTime();
 BENCHMARK_CAPTURE(BM_Operation, activation, Operation::activation)->UseRealTime();
 BENCHMARK_CAPTURE(BM_Operation, confirmation, Operation::confirmation)->UseRealTime();
+BENCHMARK(BM_OperationBare)->UseRealTime();
 BENCHMARK(BM_ThroughputFloor)->Arg(1)->Arg(8)->Arg(64)->Arg(256)->UseRealTime()->Iterations(1);
 BENCHMARK(BM_Throughput)->Arg(1)->Arg(8)->Arg(64)->Arg(256)->UseRealTime()->Iterations(1);
 BENCHMARK(BM_Idle)->Arg(6000)->UseRealTime()->Iterations(1);

@@ -2,6 +2,7 @@
 
 #include <limits>
 #include <stdexcept>
+#include <thread>
 
 #include "platform/dispatch/worker_pool.h"
 
@@ -11,11 +12,20 @@ Semaphore::Semaphore(long value) : count_(value) {
   if (value < 0) throw std::invalid_argument("Semaphore: negative initial value");
 }
 
+Semaphore::~Semaphore() {
+  // A waiter may return, and its owner destroy this, while a signaller is still leaving signal().
+  while (signalling_.load(std::memory_order_acquire) != 0) std::this_thread::yield();
+}
+
 void Semaphore::signal() {
-  std::lock_guard lock(mutex_);
-  if (count_ < std::numeric_limits<long>::max()) ++count_;
-  // Notified under the lock: a waiter cannot return, and destroy this object, until we let go.
+  signalling_.fetch_add(1, std::memory_order_acq_rel);
+  {
+    std::lock_guard lock(mutex_);
+    if (count_ < std::numeric_limits<long>::max()) ++count_;
+  }
+  // Notified after the lock is let go: a waiter woken under it would at once sleep again on it.
   available_.notify_one();
+  signalling_.fetch_sub(1, std::memory_order_release);
 }
 
 void Semaphore::wait() { take(std::nullopt); }

@@ -10,6 +10,7 @@
 // pool that waits here tells its pool, which may start another worker meanwhile or, when none can
 // be started, have the waiter run the pool's waiting work (see WorkerPool).
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
@@ -25,7 +26,7 @@ class Semaphore final : private WorkerPool::HelpWaker {
   explicit Semaphore(long value = 0);
   Semaphore(const Semaphore&) = delete;
   Semaphore& operator=(const Semaphore&) = delete;
-  ~Semaphore() = default;
+  ~Semaphore();
 
   // signal adds one to the count and wakes a waiter; it never fails.
   void signal();
@@ -43,7 +44,8 @@ class Semaphore final : private WorkerPool::HelpWaker {
   std::mutex mutex_;
   std::condition_variable available_;
   long count_;
-  bool helpWanted_ = false;  // the waiter's pool has work that only a blocked worker can run
+  std::atomic<int> signalling_{0};  // signal() calls not yet returned
+  bool helpWanted_ = false;         // the waiter's pool has work that only a blocked worker can run
 };
 
 }  // namespace platform

@@ -33,9 +33,11 @@ WorkerPool::~WorkerPool() {
 }
 
 void WorkerPool::post(std::function<void()> job) {
-  std::lock_guard lock(mutex_);
+  std::unique_lock lock(mutex_);
   jobs_.push_back(std::move(job));
   if (idle_ > 0) {
+    // Notified after the lock is let go: a worker woken under it would at once sleep again on it.
+    lock.unlock();
     available_.notify_one();
   } else {
     growIfNeeded();

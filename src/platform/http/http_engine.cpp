@@ -47,14 +47,19 @@ std::shared_ptr<ConnectionClaim> HTTPSession::Engine::claimConnection() {
 
 void HTTPSession::Engine::submit(const std::shared_ptr<HTTPTaskState>& task) {
   bool stopping;
+  bool added = false;
   {
     std::lock_guard lock(mutex_);
     stopping = stopping_;
     if (!stopping && startWorker()) {
       toAdd_.push_back(task);
-      curl_multi_wakeup(multi_.get());
-      return;
+      added = true;
     }
+  }
+  // Woken outside the lock, so that the event thread does not wake only to wait for it.
+  if (added) {
+    curl_multi_wakeup(multi_.get());
+    return;
   }
   complete(task, HTTPOutcome::failure(stopping ? cancelledError(task->request.URL)
                                                : transportError(CURLE_OUT_OF_MEMORY,
@@ -63,8 +68,10 @@ void HTTPSession::Engine::submit(const std::shared_ptr<HTTPTaskState>& task) {
 }
 
 void HTTPSession::Engine::cancel(const std::shared_ptr<HTTPTaskState>& task) {
-  std::lock_guard lock(mutex_);
-  toCancel_.push_back(task);
+  {
+    std::lock_guard lock(mutex_);
+    toCancel_.push_back(task);
+  }
   curl_multi_wakeup(multi_.get());
 }
 
