@@ -1,4 +1,6 @@
 // zlkad: the process entry. Everything after start-up runs on the listener's loop and the queues.
+#include <malloc.h>
+
 #include <unistd.h>
 
 #include "platform/bus/listener.h"
@@ -6,6 +8,9 @@
 #include "service/service_delegate.h"
 
 int main(int argc, char** argv) {
+  // One heap for all threads: a per-thread arena keeps its own high-water mark, and a daemon that
+  // mostly waits on the network gains nothing from allocating in parallel.
+  mallopt(M_ARENA_MAX, 1);
   // Before any thread exists, so that every thread inherits the mask and the loop gets the signals.
   platform::Listener::blockSignals();
   if (std::optional<int> status = setUpDaemon(argc, argv)) return *status;
