@@ -12,10 +12,12 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <filesystem>
 #include <fstream>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <nlohmann/json.hpp>
 #include <thread>
 #include <vector>
@@ -232,21 +234,51 @@ double rate(int clients, std::chrono::milliseconds duration, Worker makeWorker, 
   return failed ? -1 : double(done) / std::chrono::duration<double>(duration).count();
 }
 
+// The floor's callers share at most as many HTTPS connections as zlkad keeps to one server (32):
+// the reference server, like any, cannot hold one per caller at 256.
+class DevicePool {
+ public:
+  explicit DevicePool(int size) {
+    for (int i = 0; i < size; ++i) {
+      free_.push_back(std::make_unique<netbench::CurlDevice>(stack().harness.server().baseURL(),
+                                                             stack().harness.stateDirectory() / "ca.pem"));
+      free_.back()->associate();
+    }
+  }
+  bool post(const std::string& endpoint, const std::string& body) {
+    std::unique_ptr<netbench::CurlDevice> device;
+    {
+      std::unique_lock lock(mutex_);
+      returned_.wait(lock, [&] { return !free_.empty(); });
+      device = std::move(free_.back());
+      free_.pop_back();
+    }
+    netbench::CurlAnswer answer;
+    bool ok = device->post(endpoint, body, answer);
+    {
+      std::lock_guard lock(mutex_);
+      free_.push_back(std::move(device));
+    }
+    returned_.notify_one();
+    return ok;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable returned_;
+  std::vector<std::unique_ptr<netbench::CurlDevice>> free_;
+};
+
 void BM_ThroughputFloor(benchmark::State& state) {
   if (!stack().ready) return state.SkipWithError("the daemon did not start");
   const int clients = static_cast<int>(state.range(0));
+  auto devices = std::make_shared<DevicePool>(std::min(clients, 32));
+  const std::string body = bodyOf(Operation::confirmation);
   double perSecond = 0;
   for (auto _ : state)
-    perSecond = rate(clients, std::chrono::milliseconds(1500), [] {
+    perSecond = rate(clients, std::chrono::milliseconds(1500), [&] {
       auto bus = std::make_shared<platform::BusPtr>(connectRaw());
-      auto device = std::make_shared<netbench::CurlDevice>(stack().harness.server().baseURL(),
-                                                           stack().harness.stateDirectory() / "ca.pem");
-      device->associate();
-      auto body = bodyOf(Operation::confirmation);
-      return [bus, device, body] {
-        netbench::CurlAnswer answer;
-        return *bus && ping(bus->get()) && device->post("ackAccessory", body, answer);
-      };
+      return [bus, devices, &body] { return *bus && ping(bus->get()) && devices->post("ackAccessory", body); };
     });
   if (perSecond < 0) return state.SkipWithError("a floor operation failed");
   gFloorRate[clients] = perSecond;
