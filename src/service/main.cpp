@@ -1,6 +1,5 @@
 // zlkad: the process entry. Everything after start-up runs on the listener's loop and the queues.
 #include <malloc.h>
-
 #include <unistd.h>
 
 #include "platform/bus/listener.h"
