@@ -81,6 +81,31 @@ int appendBasicVariant(sd_bus_message* m, char type, const T& v) {
   return r < 0 ? r : sd_bus_message_close_container(m);
 }
 
+// The daemon reads numbers by value, so the signed type is used whenever it can hold the number.
+int appendUnsignedVariant(sd_bus_message* m, uint64_t u) {
+  if (u <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max()))
+    return appendBasicVariant(m, 'x', static_cast<int64_t>(u));
+  return appendBasicVariant(m, 't', u);
+}
+
+// Wraps what `append` writes in a variant of type `contents`.
+template <class Append>
+int inVariant(sd_bus_message* m, const char* contents, Append append) {
+  int r;
+  if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_VARIANT, contents)) < 0) return r;
+  if ((r = append()) < 0) return r;
+  return sd_bus_message_close_container(m);
+}
+
+// JSON arrays hold any mix of values: an array of variants.
+int appendArray(sd_bus_message* m, const platform::Array& array) {
+  int r;
+  if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_ARRAY, "v")) < 0) return r;
+  for (const platform::Value& item : array)
+    if ((r = appendVariant(m, item)) < 0) return r;
+  return sd_bus_message_close_container(m);
+}
+
 }  // namespace
 
 std::optional<std::string> unsendableReason(const platform::Value& value, const std::string& path) {
@@ -101,37 +126,14 @@ std::optional<std::string> unsendableReason(const MetadataArguments& arguments) 
 int appendVariant(sd_bus_message* m, const platform::Value& value) {
   if (value.isBool()) return appendBasicVariant<int>(m, 'b', value.boolValue() ? 1 : 0);
   if (const int64_t* i = value.integer()) return appendBasicVariant(m, 'x', *i);
-  if (const uint64_t* u = value.unsignedInteger()) {
-    // The daemon reads numbers by value, so the signed type is used whenever it can hold the number.
-    if (*u <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max()))
-      return appendBasicVariant(m, 'x', static_cast<int64_t>(*u));
-    return appendBasicVariant(m, 't', *u);
-  }
+  if (const uint64_t* u = value.unsignedInteger()) return appendUnsignedVariant(m, *u);
   if (const double* d = value.real()) return appendBasicVariant(m, 'd', *d);
-  int r;
-  if (const std::string* s = value.string()) {
-    if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_VARIANT, "s")) < 0) return r;
-    if ((r = sd_bus_message_append_basic(m, SD_BUS_TYPE_STRING, s->c_str())) < 0) return r;
-    return sd_bus_message_close_container(m);
-  }
-  if (const platform::Data* data = value.data()) {
-    if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_VARIANT, "ay")) < 0) return r;
-    if ((r = appendBytes(m, *data)) < 0) return r;
-    return sd_bus_message_close_container(m);
-  }
-  if (const platform::Array* array = value.array()) {
-    if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_VARIANT, "av")) < 0) return r;
-    if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_ARRAY, "v")) < 0) return r;
-    for (const platform::Value& item : *array)
-      if ((r = appendVariant(m, item)) < 0) return r;
-    if ((r = sd_bus_message_close_container(m)) < 0) return r;
-    return sd_bus_message_close_container(m);
-  }
-  if (const platform::Dictionary* dictionary = value.dictionary()) {
-    if ((r = sd_bus_message_open_container(m, SD_BUS_TYPE_VARIANT, "a{sv}")) < 0) return r;
-    if ((r = appendDictionary(m, *dictionary)) < 0) return r;
-    return sd_bus_message_close_container(m);
-  }
+  if (const std::string* s = value.string())
+    return inVariant(m, "s", [&] { return sd_bus_message_append_basic(m, SD_BUS_TYPE_STRING, s->c_str()); });
+  if (const platform::Data* data = value.data()) return inVariant(m, "ay", [&] { return appendBytes(m, *data); });
+  if (const platform::Array* array = value.array()) return inVariant(m, "av", [&] { return appendArray(m, *array); });
+  if (const platform::Dictionary* dictionary = value.dictionary())
+    return inVariant(m, "a{sv}", [&] { return appendDictionary(m, *dictionary); });
   return -EINVAL;  // null and opaque values have no bus form
 }
 

@@ -13,60 +13,80 @@ constexpr std::uint8_t kHighTagNumber = 0x1F;
 constexpr std::uint64_t kTopSevenBits = 0xFE00000000000000ULL;
 constexpr std::uint64_t kClassAndConstructedBits = 0xE000000000000000ULL;
 
-DERStatus decodeItem(DERSlice input, DERDecodedItem* item, LengthMode mode, std::uint64_t* declaredLength) {
-  if (input.length < 2) return DER_STATUS_DECODE_ERROR;
-  // `remaining` always counts the input bytes from `p` on, so every read is checked against it.
-  const std::uint8_t* p = input.data;
-  std::uint64_t remaining = input.length;
+// The reads below walk `rest`, the input bytes not yet read; each is checked against its length.
+std::uint8_t take(DERSlice& rest) {
+  --rest.length;
+  return *rest.data++;
+}
 
-  const std::uint8_t identifier = *p++;
-  --remaining;
+// High-tag-number form: base-128 groups, most significant first, the top bit set on all but the
+// last. A leading zero group or a number below 31 would not be the minimal encoding.
+DERStatus readHighTagNumber(DERSlice& rest, std::uint64_t* number) {
+  if (*rest.data == 0x80 || *rest.data < kHighTagNumber) return DER_STATUS_DECODE_ERROR;
+  std::uint64_t value = 0;
+  std::uint8_t group = 0;
+  do {
+    // Each group must leave at least the length octet behind it.
+    if ((value & kTopSevenBits) != 0 || rest.length < 2) return DER_STATUS_DECODE_ERROR;
+    group = take(rest);
+    value = (value << 7) | (group & 0x7F);
+  } while ((group & 0x80) != 0);
+  if ((value & kClassAndConstructedBits) != 0) return DER_STATUS_DECODE_ERROR;
+  *number = value;
+  return DER_STATUS_OK;
+}
+
+// The identifier octets; `rest` holds at least two bytes.
+DERStatus readTag(DERSlice& rest, DERTag* tag) {
+  const std::uint8_t identifier = take(rest);
   std::uint64_t number = identifier & kHighTagNumber;
   if (number == kHighTagNumber) {
-    // High-tag-number form: base-128 groups, most significant first, the top bit set on all but
-    // the last. A leading zero group or a number below 31 would not be the minimal encoding.
-    if (*p == 0x80 || *p < kHighTagNumber) return DER_STATUS_DECODE_ERROR;
-    number = 0;
-    std::uint8_t group = 0;
-    do {
-      // Each group must leave at least the length octet behind it.
-      if ((number & kTopSevenBits) != 0 || remaining < 2) return DER_STATUS_DECODE_ERROR;
-      group = *p++;
-      --remaining;
-      number = (number << 7) | (group & 0x7F);
-    } while ((group & 0x80) != 0);
-    if ((number & kClassAndConstructedBits) != 0) return DER_STATUS_DECODE_ERROR;
+    if (const DERStatus status = readHighTagNumber(rest, &number); status != DER_STATUS_OK) return status;
   }
-  const DERTag tag = (static_cast<DERTag>(identifier & 0xE0) << 56) | number;
+  *tag = (static_cast<DERTag>(identifier & 0xE0) << 56) | number;
+  return DER_STATUS_OK;
+}
 
-  // At least one byte is left: the input has two, and the high-tag loop keeps one back.
-  const std::uint8_t lengthOctet = *p++;
-  --remaining;
-  std::uint64_t length = lengthOctet;
-  if ((lengthOctet & 0x80) != 0) {
-    const std::uint8_t count = lengthOctet & 0x7F;
-    if (count == 0 || count > 8) return DER_STATUS_DECODE_ERROR;  // indefinite, or too wide
-    if (remaining < count) return DER_STATUS_DECODE_ERROR;
-    if (*p == 0) return DER_STATUS_DECODE_ERROR;
-    length = 0;
-    for (std::uint8_t i = 0; i < count; ++i) length = (length << 8) | *p++;
-    remaining -= count;
+// The length octets in their minimal definite form; `rest` holds at least one byte.
+DERStatus readLength(DERSlice& rest, std::uint64_t* length) {
+  const std::uint8_t lengthOctet = take(rest);
+  if ((lengthOctet & 0x80) == 0) {
+    *length = lengthOctet;
+    return DER_STATUS_OK;
   }
+  const std::uint8_t count = lengthOctet & 0x7F;
+  if (count == 0 || count > 8) return DER_STATUS_DECODE_ERROR;  // indefinite, or too wide
+  if (rest.length < count) return DER_STATUS_DECODE_ERROR;
+  if (*rest.data == 0) return DER_STATUS_DECODE_ERROR;
+  std::uint64_t value = 0;
+  for (std::uint8_t i = 0; i < count; ++i) value = (value << 8) | take(rest);
+  *length = value;
+  return DER_STATUS_OK;
+}
+
+DERStatus decodeItem(DERSlice input, DERDecodedItem* item, LengthMode mode, std::uint64_t* declaredLength) {
+  if (input.length < 2) return DER_STATUS_DECODE_ERROR;
+  DERSlice rest = input;
+  DERTag tag = 0;
+  if (const DERStatus status = readTag(rest, &tag); status != DER_STATUS_OK) return status;
+  // At least one byte is left: the input has two, and the high-tag loop keeps one back.
+  std::uint64_t length = 0;
+  if (const DERStatus status = readLength(rest, &length); status != DER_STATUS_OK) return status;
 
   std::uint64_t contentLength = length;
-  if (length > remaining) {
+  if (length > rest.length) {
     switch (mode) {
       case LengthMode::kStrict:
         return DER_STATUS_DECODE_ERROR;
       case LengthMode::kClip:
-        contentLength = remaining;
+        contentLength = rest.length;
         break;
       case LengthMode::kUnclip:
         break;
     }
   }
   item->tag = tag;
-  item->content = DERSlice{p, contentLength};
+  item->content = DERSlice{rest.data, contentLength};
   if (declaredLength != nullptr) *declaredLength = length;
   return DER_STATUS_OK;
 }

@@ -21,6 +21,38 @@ bool matches(const DERFieldSpec& field, DERTag tag) {
   return (field.options & DER_FIELD_SKIP_TAG_CHECK) != 0 || field.tag == tag;
 }
 
+bool isOptional(const DERFieldSpec& field) { return (field.options & DER_FIELD_OPTIONAL) != 0; }
+
+// What the end of the content means with rows `from` onwards unmatched: only optional rows may be.
+DERStatus endOfContent(std::uint16_t from, std::uint16_t fieldCount, const DERFieldSpec* fields) {
+  for (std::uint16_t i = from; i < fieldCount; ++i) {
+    if (!isOptional(fields[i])) return DER_STATUS_INCOMPLETE_SEQUENCE;
+  }
+  return DER_STATUS_OK;
+}
+
+// Advances `*field` past optional rows to the one that matches `tag`; an unmatched required row,
+// or no row left, refuses the item.
+DERStatus findRow(DERTag tag, std::uint16_t fieldCount, const DERFieldSpec* fields, std::uint16_t* field) {
+  while (!matches(fields[*field], tag)) {
+    if (!isOptional(fields[*field])) return DER_STATUS_UNEXPECTED_TAG;
+    if (++*field == fieldCount) return DER_STATUS_UNEXPECTED_TAG;
+  }
+  return DER_STATUS_OK;
+}
+
+// Stores the row's slice, borrowed from the input: the item's content, or the whole item from
+// `itemStart` to `itemEnd`.
+void writeRow(const DERFieldSpec& row, const DERDecodedItem& item, const std::uint8_t* itemStart,
+              const std::uint8_t* itemEnd, void* dest) {
+  if ((row.options & DER_FIELD_SKIP_WRITE) != 0) return;
+  DERSlice slice = item.content;
+  if ((row.options & DER_FIELD_KEEP_HEADER) != 0) {
+    slice = DERSlice{itemStart, static_cast<std::uint64_t>(itemEnd - itemStart)};
+  }
+  std::memcpy(static_cast<std::uint8_t*>(dest) + row.offset, &slice, sizeof slice);
+}
+
 }  // namespace
 
 DERStatus DERDecodeSeqInit(DERSlice input, DERTag* tag, DERSeqCursor* cursor) {
@@ -78,29 +110,10 @@ DERStatus DERParseSequenceContent(DERSlice content, std::uint16_t fieldCount, co
     const std::uint8_t* itemStart = cursor.next;
     DERDecodedItem item;
     const DERStatus status = DERDecodeSeqNext(&cursor, &item);
-    if (status == DER_STATUS_END_OF_SEQUENCE) {
-      for (; field < fieldCount; ++field) {
-        if ((fields[field].options & DER_FIELD_OPTIONAL) == 0) {
-          return DER_STATUS_INCOMPLETE_SEQUENCE;
-        }
-      }
-      return DER_STATUS_OK;
-    }
+    if (status == DER_STATUS_END_OF_SEQUENCE) return endOfContent(field, fieldCount, fields);
     if (status != DER_STATUS_OK) return status;
-
-    while (!matches(fields[field], item.tag)) {
-      if ((fields[field].options & DER_FIELD_OPTIONAL) == 0) return DER_STATUS_UNEXPECTED_TAG;
-      if (++field == fieldCount) return DER_STATUS_UNEXPECTED_TAG;
-    }
-
-    const DERFieldSpec& row = fields[field];
-    if ((row.options & DER_FIELD_SKIP_WRITE) == 0) {
-      DERSlice slice = item.content;
-      if ((row.options & DER_FIELD_KEEP_HEADER) != 0) {
-        slice = DERSlice{itemStart, static_cast<std::uint64_t>(cursor.next - itemStart)};
-      }
-      std::memcpy(static_cast<std::uint8_t*>(dest) + row.offset, &slice, sizeof slice);
-    }
+    if (const DERStatus found = findRow(item.tag, fieldCount, fields, &field); found != DER_STATUS_OK) return found;
+    writeRow(fields[field], item, itemStart, cursor.next, dest);
     // Matching the last row ends the parse: any byte after its item is one too many.
     if (++field == fieldCount) {
       return cursor.next == cursor.end ? DER_STATUS_OK : DER_STATUS_DECODE_ERROR;

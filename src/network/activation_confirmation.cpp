@@ -30,7 +30,7 @@ void ZLKANetwork::confirmActivationForToken(const std::optional<Data>& token, co
                                      }};
   auto handler = [fail, reply](std::optional<Data> body, std::optional<platform::HTTPResponse> response,
                                std::optional<platform::Error> taskError) {
-    if (auto code = request_pipeline::checkTransportAndStatus(taskError, response, body, true)) return fail(*code);
+    if (auto code = request_pipeline::checkAnswer(taskError, response, body, true)) return fail(*code);
     reply(std::nullopt);
   };
   if (auto code = request_pipeline::sendSignedRequest(*this, *token, plan, std::move(handler))) fail(*code);

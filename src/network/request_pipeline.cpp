@@ -1,10 +1,11 @@
 #include "network/request_pipeline.h"
 
+#include "network/answer_check.h"
+#include "network/signed_request.h"
 #include "network/token_array.h"
 #include "platform/bus/connection.h"
 #include "platform/log/log.h"
 #include "platform/values/base64.h"
-#include "platform/values/json.h"
 #include "support/base64_array.h"
 #include "support/entitlements.h"
 #include "support/errors.h"
@@ -31,6 +32,12 @@ int64_t codeForSigningError(const std::optional<Error>& error) {
   if (error && error->code() == TarvexSAPSessionErrorTransport) return ZLKAErrorNetwork;
   if (error && error->code() == TarvexSAPSessionErrorBadResponse) return ZLKAErrorServer;
   return ZLKAErrorInternal;
+}
+
+int64_t codeForStatus(long status) {
+  if (status == 400) return ZLKAErrorInvalidParameter;
+  if (status == 401) return ZLKAErrorInternal;
+  return ZLKAErrorServer;
 }
 
 }  // namespace
@@ -64,21 +71,9 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
     platform::log(LogLevel::Debug, "[#TokenAuth] encodedTokenArray: %{private}@", Value(encoded));
 
   Value requestDict(plan.requestDict(std::move(encoded)));
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestDict: %{private}@", requestDict);
-  if (!platform::json::isValidJSONObject(requestDict)) {
-    platform::log(LogLevel::Error, "[#TokenAuth] isValidJSONObject (requestDict) = NO!");
-    return ZLKAErrorInternal;
-  }
-  std::string jsonError;
-  std::optional<std::string> text = platform::json::serialize(requestDict, false, &jsonError);
-  if (!text) {
-    platform::log(LogLevel::Error, "[#TokenAuth] requestJSONError: %@", jsonError);
-    return ZLKAErrorInternal;
-  }
   // The bytes signed are exactly the bytes uploaded.
-  Data body = Data::fromString(*text);
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestData.length: %lu", body.length());
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestData (string): %{private}@", *text);
+  std::optional<Data> body = signed_request::serializeBody(requestDict);
+  if (!body) return ZLKAErrorInternal;
 
   std::optional<Data> signature;
   if (network.forceTarvexSAPFailure()) {
@@ -86,7 +81,7 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
   } else {
     bool timedOut = false;
     std::optional<Error> signingError;
-    signature = network._tarvexSignatureForDataSync(body, &timedOut, &signingError);
+    signature = network._tarvexSignatureForDataSync(*body, &timedOut, &signingError);
     if (timedOut) {
       platform::log(LogLevel::Error, "[#TokenAuth] Timed out waiting to generate Tarvex SAP signature!");
       return ZLKAErrorInternal;
@@ -102,54 +97,40 @@ std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const Data& token
     platform::log(LogLevel::Info, "[#TokenAuth] self._selectedAPIServer: %@", network._selectedAPIServer());
   std::string sessionID = network.tarvexSAPSession()->UUID().UUIDString();
   platform::HTTPRequest request = network._generateTokenAuthURLRequestForEndpoint(plan.endpoint, sessionID, signature);
-  platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request);
-  if (platform::Log::enabled(LogLevel::Debug))
-    platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@",
-                  Value(request.allHTTPHeaderFields()));
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestDict: %{private}@", requestDict);
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestData.length: %lu", body.length());
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestData (string): %{private}@", *text);
+  signed_request::logRequest(request);
+  signed_request::logBody(requestDict, *body);
 
   network.urlSession()
-      ->uploadTaskWithRequest(std::move(request), std::move(body), std::move(handler), std::move(claim))
+      ->uploadTaskWithRequest(std::move(request), std::move(*body), std::move(handler), std::move(claim))
       ->resume();
   return std::nullopt;
 }
 
-std::optional<int64_t> checkTransportAndStatus(const std::optional<Error>& taskError,
-                                               const std::optional<platform::HTTPResponse>& response,
-                                               const std::optional<Data>& body, bool acceptNoContent) {
-  if (taskError || !response) {
-    platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
-    return ZLKAErrorNetwork;
-  }
-  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", *response);
-  platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", body ? body->length() : 0);
-  if (body && !body->empty())
-    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", body->view());
-  long status = response->statusCode;
-  if (status == 200 || (acceptNoContent && status == 204)) return std::nullopt;
-  platform::log(LogLevel::Error,
-                "[#TokenAuth] Server responded with invalid HTTP status code: %ld!\nresponseData (string): %@", status,
-                body ? std::string(body->view()) : std::string());
-  if (status == 400) return ZLKAErrorInvalidParameter;
-  if (status == 401) return ZLKAErrorInternal;
-  return ZLKAErrorServer;
+std::optional<int64_t> checkAnswer(const std::optional<Error>& taskError,
+                                   const std::optional<platform::HTTPResponse>& response,
+                                   const std::optional<Data>& body, bool judgedByStatusAlone) {
+  // A refused status is logged with the body: the server's error text says why.
+  const answer_check::AnswerRules rules{.acceptNoContent = judgedByStatusAlone,
+                                        .requireBody = !judgedByStatusAlone,
+                                        .showBody = true,
+                                        .statusLineShowsBody = true,
+                                        .emptyBodyLevel = LogLevel::Default};
+  std::optional<answer_check::AnswerFault> fault = answer_check::checkAnswer({body, response, taskError}, rules);
+  if (!fault) return std::nullopt;
+  if (*fault == answer_check::AnswerFault::Transport) return ZLKAErrorNetwork;
+  if (*fault == answer_check::AnswerFault::Empty) return ZLKAErrorServer;
+  return codeForStatus(response->statusCode);
 }
 
 std::variant<Value, int64_t> verifyAndParse(ZLKANetwork& network, const platform::HTTPResponse& response,
-                                            const std::optional<Data>& body) {
-  if (!body || body->empty()) {
-    platform::log(LogLevel::Default, "[#TokenAuth] responseData is empty!");
-    return ZLKAErrorServer;
-  }
+                                            const Data& body) {
   std::optional<Data> signature;
   if (std::optional<std::string> header = response.valueForHTTPHeaderField("signature"))
     signature = platform::base64DecodeStrict(*header);
   if (network.forceTarvexSAPFailure()) signature = forcedSignature();
   bool timedOut = false;
   std::optional<Error> verifyError;
-  bool valid = network._verifyTarvexSignatureSync(signature, *body, &timedOut, &verifyError);
+  bool valid = network._verifyTarvexSignatureSync(signature, body, &timedOut, &verifyError);
   if (timedOut) {
     platform::log(LogLevel::Error, "[#TokenAuth] Timed out waiting to verify Tarvex SAP signature!");
     return ZLKAErrorInternal;
@@ -158,13 +139,8 @@ std::variant<Value, int64_t> verifyAndParse(ZLKANetwork& network, const platform
     platform::log(LogLevel::Error, "[#TokenAuth] tarvexError: %@", verifyError);
     return ZLKAErrorServer;
   }
-  std::string parseError;
-  std::optional<Value> parsed = platform::json::parse(body->view(), &parseError);
-  if (!parsed) {
-    platform::log(LogLevel::Error, "[#TokenAuth] responseJSONError: %@", parseError);
-    return ZLKAErrorServer;
-  }
-  platform::log(LogLevel::Debug, "[#TokenAuth] responseDict: %{private}@", parsed);
+  std::optional<Value> parsed = answer_check::parseAnswer(body);
+  if (!parsed) return ZLKAErrorServer;
   return std::move(*parsed);
 }
 

@@ -39,13 +39,14 @@ platform::Error failure(int64_t code);
 std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const platform::Data& token, const RequestPlan& plan,
                                          ResponseHandler handler);
 
-// Transport error and status: nullopt when the answer may go on. 204 passes too when asked.
-std::optional<int64_t> checkTransportAndStatus(const std::optional<platform::Error>& taskError,
-                                               const std::optional<platform::HTTPResponse>& response,
-                                               const std::optional<platform::Data>& body, bool acceptNoContent);
+// Transport error, status and empty body: nullopt when the answer may go on, else the code to fail
+// with. An answer judged by its status alone also passes with 204 and needs no body.
+std::optional<int64_t> checkAnswer(const std::optional<platform::Error>& taskError,
+                                   const std::optional<platform::HTTPResponse>& response,
+                                   const std::optional<platform::Data>& body, bool judgedByStatusAlone);
 
-// Empty body, signature, JSON: the parsed answer or the code to fail with.
+// Signature and JSON of a body that checkAnswer passed: the parsed answer or the code to fail with.
 std::variant<platform::Value, int64_t> verifyAndParse(ZLKANetwork& network, const platform::HTTPResponse& response,
-                                                      const std::optional<platform::Data>& body);
+                                                      const platform::Data& body);
 
 }  // namespace request_pipeline

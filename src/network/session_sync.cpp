@@ -3,10 +3,10 @@
 #include <chrono>
 #include <mutex>
 
+#include "network/signed_request.h"
 #include "network/zlka_network.h"
 #include "platform/dispatch/semaphore.h"
 #include "platform/log/log.h"
-#include "platform/values/base64.h"
 #include "support/message_ids.h"
 
 using platform::Data;
@@ -16,7 +16,6 @@ using platform::LogLevel;
 namespace {
 
 constexpr auto kSessionWait = std::chrono::seconds(10);
-constexpr double kRequestTimeout = 60.0;
 
 // Shared between a waiter and a completion that may arrive after the waiter gave up.
 template <class Result>
@@ -107,12 +106,5 @@ bool ZLKANetwork::_verifyTarvexSignatureSync(const std::optional<Data>& signatur
 platform::HTTPRequest ZLKANetwork::_generateTokenAuthURLRequestForEndpoint(const std::string& endpoint,
                                                                            const std::optional<std::string>& sessionID,
                                                                            const std::optional<Data>& signature) {
-  platform::HTTPRequest request(_selectedAPIServer() + "/" + endpoint, 0, kRequestTimeout);
-  request.HTTPMethod = "POST";
-  request.setValueForHTTPHeaderField("application/json", "Content-Type");
-  request.setValueForHTTPHeaderField("application/json", "Accept");
-  request.setValueForHTTPHeaderField("1.0", "protocol-version");
-  if (sessionID) request.setValueForHTTPHeaderField(*sessionID, "session-identifier");
-  if (signature) request.setValueForHTTPHeaderField(platform::base64Encode(signature->span()), "signature");
-  return request;
+  return signed_request::jsonPost(_selectedAPIServer() + "/" + endpoint, sessionID, signature);
 }

@@ -71,8 +71,8 @@ void ZLKANetwork::requestActivationForToken(const std::optional<Data>& token, co
   auto self = shared_from_this();
   auto handler = [self, fail, reply](std::optional<Data> body, std::optional<platform::HTTPResponse> response,
                                      std::optional<platform::Error> taskError) {
-    if (auto code = request_pipeline::checkTransportAndStatus(taskError, response, body, false)) return fail(*code);
-    auto parsed = request_pipeline::verifyAndParse(*self, *response, body);
+    if (auto code = request_pipeline::checkAnswer(taskError, response, body, false)) return fail(*code);
+    auto parsed = request_pipeline::verifyAndParse(*self, *response, *body);
     if (auto code = std::get_if<int64_t>(&parsed)) return fail(*code);
     replyWithNewToken(std::get<Value>(parsed), fail, reply);
   };

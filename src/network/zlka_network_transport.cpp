@@ -1,9 +1,10 @@
 // The session's two network legs: the setup certificate from the static-content server and the
 // handshake with the secure-association server, both over the process-wide shared HTTP session.
+#include "network/answer_check.h"
+#include "network/signed_request.h"
 #include "network/zlka_network.h"
 #include "platform/log/log.h"
 #include "platform/values/base64.h"
-#include "platform/values/json.h"
 
 using platform::Data;
 using platform::Error;
@@ -14,41 +15,24 @@ namespace {
 
 constexpr char kCertificateEndpoint[] = "deviceservices/setup.crt";
 constexpr char kHandshakeEndpoint[] = "deviceservices/sapSession";
-constexpr double kRequestTimeout = 60.0;
+
+// The certificate is not text worth showing; the handshake's answer is.
+constexpr answer_check::AnswerRules kCertificateAnswer{.showBody = false};
+constexpr answer_check::AnswerRules kHandshakeAnswer{};
 
 // Transport errors carry the failed task's user-info; the others carry none.
 Error sessionError(int64_t code, std::optional<platform::Dictionary> userInfo = std::nullopt) {
   return Error(TarvexSAPSessionErrorDomain, code, std::move(userInfo));
 }
 
-void logRequest(const platform::HTTPRequest& request) {
-  if (!platform::Log::enabled(LogLevel::Debug)) return;  // the header dictionary is made only to be written
-  platform::log(LogLevel::Debug, "[#TokenAuth] request: %@", request);
-  platform::log(LogLevel::Debug, "[#TokenAuth] request.allHTTPHeaderFields: %@", Value(request.allHTTPHeaderFields()));
-}
-
-// The checks both legs make of an answer: it arrived, with status 200 and a body. The error to
-// hand the session otherwise. `showBody` adds the body to the debug lines.
+// The error to hand the session when an answer did not pass, else nullopt.
 std::optional<Error> checkAnswer(const std::optional<Data>& data, const std::optional<platform::HTTPResponse>& response,
-                                 const std::optional<Error>& taskError, bool showBody) {
-  if (taskError || !response) {
-    platform::log(LogLevel::Fault, "[#TokenAuth] taskError: %@", taskError);
+                                 const std::optional<Error>& taskError, const answer_check::AnswerRules& rules) {
+  std::optional<answer_check::AnswerFault> fault = answer_check::checkAnswer({data, response, taskError}, rules);
+  if (!fault) return std::nullopt;
+  if (*fault == answer_check::AnswerFault::Transport)
     return sessionError(TarvexSAPSessionErrorTransport, taskError ? taskError->userInfo() : std::nullopt);
-  }
-  platform::log(LogLevel::Debug, "[#TokenAuth] response: %@", *response);
-  platform::log(LogLevel::Debug, "[#TokenAuth] responseData.length: %lu", data ? data->length() : 0);
-  if (showBody && data && !data->empty())
-    platform::log(LogLevel::Debug, "[#TokenAuth] responseData (string): %{private}@", data->view());
-  if (response->statusCode != 200) {
-    platform::log(LogLevel::Error, "[#TokenAuth] Server responded with invalid HTTP status code: %ld!",
-                  response->statusCode);
-    return sessionError(TarvexSAPSessionErrorBadResponse);
-  }
-  if (!data || data->empty()) {
-    platform::log(LogLevel::Error, "[#TokenAuth] responseData is empty!");
-    return sessionError(TarvexSAPSessionErrorBadResponse);
-  }
-  return std::nullopt;
+  return sessionError(TarvexSAPSessionErrorBadResponse);
 }
 
 }  // namespace
@@ -59,14 +43,14 @@ void ZLKANetwork::sessionRequestCertificateWithCompletionHandler(TarvexSAPSessio
   if (!completion) return;
   std::string server = _selectedStaticContentServer();
   platform::log(LogLevel::Info, "[#TokenAuth] self._selectedStaticContentServer: %@", server);
-  platform::HTTPRequest request(server + "/" + kCertificateEndpoint, 0, kRequestTimeout);
+  platform::HTTPRequest request(server + "/" + kCertificateEndpoint, 0, signed_request::kRequestTimeout);
   request.HTTPMethod = "GET";
-  logRequest(request);
+  signed_request::logRequest(request);
 
   auto task = platform::HTTPSession::sharedSession()->dataTaskWithRequest(
       std::move(request), [completion](std::optional<Data> data, std::optional<platform::HTTPResponse> response,
                                        std::optional<Error> taskError) {
-        if (auto error = checkAnswer(data, response, taskError, false))
+        if (auto error = checkAnswer(data, response, taskError, kCertificateAnswer))
           return completion(std::nullopt, std::move(error));
         completion(std::move(data), std::nullopt);
       });
@@ -85,46 +69,31 @@ void ZLKANetwork::sessionRequestHandshakeWithServerCompletionHandler(TarvexSAPSe
   }
   std::string server = _selectedTarvexSAPServer();
   platform::log(LogLevel::Info, "[#TokenAuth] self._selectedTarvexSAPServer: %@", server);
-  platform::HTTPRequest request(server + "/" + kHandshakeEndpoint, 0, kRequestTimeout);
-  request.HTTPMethod = "POST";
-  request.setValueForHTTPHeaderField("application/json", "Content-Type");
-  request.setValueForHTTPHeaderField("application/json", "Accept");
-  request.setValueForHTTPHeaderField("1.0", "protocol-version");
-  logRequest(request);
+  // The handshake is what makes signing possible: it goes out unsigned.
+  platform::HTTPRequest request =
+      signed_request::jsonPost(server + "/" + kHandshakeEndpoint, std::nullopt, std::nullopt);
+  signed_request::logRequest(request);
 
   Value requestDict(platform::Dictionary{{"session-request", platform::base64Encode(handshakeData->span())},
                                          {"session-identifier", session.UUID().UUIDString()}});
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestDict: %{private}@", requestDict);
-  if (!platform::json::isValidJSONObject(requestDict)) {
-    platform::log(LogLevel::Error, "[#TokenAuth] isValidJSONObject (requestDict) = NO!");
-    completion(std::nullopt, sessionError(TarvexSAPSessionErrorInternal));
-    return;
-  }
-  std::string jsonError;
-  std::optional<std::string> body = platform::json::serialize(requestDict, false, &jsonError);
+  std::optional<Data> body = signed_request::serializeBody(requestDict);
   if (!body) {
-    platform::log(LogLevel::Error, "[#TokenAuth] requestJSONError: %@", jsonError);
     completion(std::nullopt, sessionError(TarvexSAPSessionErrorInternal));
     return;
   }
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestData.length: %lu", body->size());
-  platform::log(LogLevel::Debug, "[#TokenAuth] requestData (string): %{private}@", *body);
 
   std::weak_ptr<ZLKANetwork> weakSelf = weak_from_this();
   auto task = platform::HTTPSession::sharedSession()->uploadTaskWithRequest(
-      std::move(request), Data::fromString(*body),
+      std::move(request), std::move(*body),
       [weakSelf, completion](std::optional<Data> data, std::optional<platform::HTTPResponse> response,
                              std::optional<Error> taskError) {
-        if (auto error = checkAnswer(data, response, taskError, true))
+        if (auto error = checkAnswer(data, response, taskError, kHandshakeAnswer))
           return completion(std::nullopt, std::move(error));
-        std::string parseError;
-        std::optional<Value> responseDict = platform::json::parse(data->view(), &parseError);
+        std::optional<Value> responseDict = answer_check::parseAnswer(*data);
         if (!responseDict) {
-          platform::log(LogLevel::Error, "[#TokenAuth] responseJSONError: %@", parseError);
           completion(std::nullopt, sessionError(TarvexSAPSessionErrorBadResponse));
           return;
         }
-        platform::log(LogLevel::Debug, "[#TokenAuth] responseDict: %{private}@", responseDict);
         // A top-level array or scalar counts as missing members.
         const Value* info = responseDict->find("session-info");
         const Value* validity = responseDict->find("session-validity");

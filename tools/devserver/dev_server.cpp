@@ -127,6 +127,7 @@ struct DevServer::Impl {
   void dispatchDevice(const httplib::Request& req, httplib::Response& res);
   void dispatchAdmin(const httplib::Request& req, httplib::Response& res);
   void respond(Endpoint endpoint, const httplib::Request& req, httplib::Response& res, Answer answer);
+  void signAnswer(const Answer& answer, SignatureFault mode, httplib::Response& res);
   bool pause(std::chrono::milliseconds delay);
   void log(const httplib::Request& req, const httplib::Response& res);
 };
@@ -253,6 +254,38 @@ void DevServer::Impl::dispatchDevice(const httplib::Request& req, httplib::Respo
   }
 }
 
+// The faults that rewrite an answer: the handshake's members (only of a successful handshake,
+// the one answer that has them), then the status and the body.
+static void applyFault(Endpoint endpoint, const Fault& fault, Answer& answer) {
+  if (endpoint == Endpoint::sapSession && answer.status == 200 && (fault.sessionValidity || fault.sessionInfo)) {
+    json document = json::parse(answer.body);
+    if (fault.sessionValidity) {
+      document["session-validity"] = *fault.sessionValidity;
+    }
+    if (fault.sessionInfo) {
+      document["session-info"] = *fault.sessionInfo;
+    }
+    answer.body = document.dump(-1, ' ', false, json::error_handler_t::replace);
+  }
+  if (fault.status) {
+    answer.status = *fault.status;
+  }
+  if (fault.body) {
+    answer.body = *fault.body;
+  }
+}
+
+// The right seq with a wrong MAC, or, where there was no signature to spoil, a random one.
+static void corruptSignature(std::optional<std::array<uint8_t, 40>>& signature) {
+  if (signature) {
+    (*signature)[39] ^= 0x01;
+    return;
+  }
+  signature.emplace();
+  (*signature)[7] = 1;
+  RAND_bytes(signature->data() + 8, 32);
+}
+
 // Faults act on the finished answer, so a verified request's seq is known for signing.
 void DevServer::Impl::respond(Endpoint endpoint, const httplib::Request& req, httplib::Response& res, Answer answer) {
   const std::optional<Fault> fault = faults.take(endpoint);
@@ -262,48 +295,31 @@ void DevServer::Impl::respond(Endpoint endpoint, const httplib::Request& req, ht
     return;
   }
   if (fault) {
-    if (endpoint == Endpoint::sapSession && answer.status == 200 && (fault->sessionValidity || fault->sessionInfo)) {
-      json document = json::parse(answer.body);
-      if (fault->sessionValidity) {
-        document["session-validity"] = *fault->sessionValidity;
-      }
-      if (fault->sessionInfo) {
-        document["session-info"] = *fault->sessionInfo;
-      }
-      answer.body = document.dump(-1, ' ', false, json::error_handler_t::replace);
-    }
-    if (fault->status) {
-      answer.status = *fault->status;
-    }
-    if (fault->body) {
-      answer.body = *fault->body;
-    }
+    applyFault(endpoint, *fault, answer);
   }
   if (answer.status == 204 || answer.status == 304) {
     answer.body.clear();  // what is signed must be what is sent
   }
   if (isTokenEndpoint(endpoint)) {
-    const SignatureFault mode = fault && fault->signature ? *fault->signature : SignatureFault::valid;
-    std::optional<std::array<uint8_t, 40>> signature;
-    if (mode != SignatureFault::missing) {
-      signature = services->sign(answer, answer.body);
-    }
-    if (mode == SignatureFault::corrupt) {
-      if (signature) {
-        (*signature)[39] ^= 0x01;  // the right seq with a wrong MAC
-      } else {
-        signature.emplace();
-        (*signature)[7] = 1;
-        RAND_bytes(signature->data() + 8, 32);
-      }
-    }
-    if (signature) {
-      const bool padded = mode == SignatureFault::padded;
-      res.set_header("signature", padded ? " \t " + base64Encode(*signature) + " \t" : base64Encode(*signature));
-    }
+    signAnswer(answer, fault && fault->signature ? *fault->signature : SignatureFault::valid, res);
   }
   setAnswer(res, answer);
   stats.countStatus(answer.status);
+}
+
+void DevServer::Impl::signAnswer(const Answer& answer, SignatureFault mode, httplib::Response& res) {
+  std::optional<std::array<uint8_t, 40>> signature;
+  if (mode != SignatureFault::missing) {
+    signature = services->sign(answer, answer.body);
+  }
+  if (mode == SignatureFault::corrupt) {
+    corruptSignature(signature);
+  }
+  if (!signature) {
+    return;
+  }
+  const std::string text = base64Encode(*signature);
+  res.set_header("signature", mode == SignatureFault::padded ? " \t " + text + " \t" : text);
 }
 
 bool DevServer::Impl::pause(std::chrono::milliseconds delay) {

@@ -44,6 +44,78 @@ const char* signatureName(SignatureFault mode) {
   return "";
 }
 
+SignatureFault signatureMember(const json& value, const std::string& member) {
+  const std::string mode = value.is_string() ? value.get<std::string>() : "";
+  for (SignatureFault known :
+       {SignatureFault::valid, SignatureFault::missing, SignatureFault::corrupt, SignatureFault::padded}) {
+    if (mode == signatureName(known)) {
+      return known;
+    }
+  }
+  invalid(member, "must be \"valid\", \"missing\", \"corrupt\" or \"padded\"");
+}
+
+std::string stringMember(const json& value, const std::string& member) {
+  if (!value.is_string()) {
+    invalid(member, "must be a string");
+  }
+  return value.get<std::string>();
+}
+
+// nullopt for "*", every endpoint.
+std::optional<Endpoint> endpointMember(const json& value, const std::string& member) {
+  const std::string name = stringMember(value, member);
+  if (name == "*") {
+    return std::nullopt;
+  }
+  std::optional<Endpoint> endpoint = endpointNamed(name);
+  if (!endpoint) {
+    invalid(member,
+            "must be \"setup.crt\", \"sapSession\", \"queryProductPlan\", "
+            "\"activateAccessory\", \"ackAccessory\" or \"*\"");
+  }
+  return endpoint;
+}
+
+// The members that describe a fault, each with the parser that stores it.
+struct FaultMember {
+  const char* name;
+  void (*parse)(const json& value, const std::string& member, Fault& fault);
+};
+
+const FaultMember kFaultMembers[] = {
+    {"status", [](const json& value, const std::string& member,
+                  Fault& fault) { fault.status = static_cast<int>(integerMember(value, member, 200, 599)); }},
+    {"delay_ms",
+     [](const json& value, const std::string& member, Fault& fault) {
+       const int64_t ms = integerMember(value, member, 0, INT64_MAX);
+       fault.delay = std::min(std::chrono::milliseconds(ms), kLongestFaultDelay);
+     }},
+    {"body",
+     [](const json& value, const std::string& member, Fault& fault) { fault.body = stringMember(value, member); }},
+    {"signature", [](const json& value, const std::string& member,
+                     Fault& fault) { fault.signature = signatureMember(value, member); }},
+    {"drop",
+     [](const json& value, const std::string& member, Fault& fault) {
+       if (!value.is_boolean()) {
+         invalid(member, "must be true or false");
+       }
+       fault.drop = value.get<bool>();
+     }},
+    {"session_validity", [](const json& value, const std::string&, Fault& fault) { fault.sessionValidity = value; }},
+    {"session_info", [](const json& value, const std::string& member,
+                        Fault& fault) { fault.sessionInfo = stringMember(value, member); }},
+};
+
+const FaultMember* faultMemberNamed(const std::string& name) {
+  for (const FaultMember& known : kFaultMembers) {
+    if (name == known.name) {
+      return &known;
+    }
+  }
+  return nullptr;
+}
+
 }  // namespace
 
 FaultRule parseFaultRule(const json& document) {
@@ -51,66 +123,17 @@ FaultRule parseFaultRule(const json& document) {
     throw std::invalid_argument("a fault must be a JSON object");
   }
   FaultRule rule;
-  Fault& fault = rule.fault;
   bool endpointGiven = false;
   bool faultGiven = false;
   for (const auto& [member, value] : document.items()) {
     if (member == "endpoint") {
-      if (!value.is_string()) {
-        invalid(member, "must be a string");
-      }
-      const auto& name = value.get_ref<const std::string&>();
-      if (name != "*") {
-        rule.endpoint = endpointNamed(name);
-        if (!rule.endpoint) {
-          invalid(member,
-                  "must be \"setup.crt\", \"sapSession\", \"queryProductPlan\", "
-                  "\"activateAccessory\", \"ackAccessory\" or \"*\"");
-        }
-      }
+      rule.endpoint = endpointMember(value, member);
       endpointGiven = true;
-      continue;
-    }
-    if (member == "remaining") {
-      fault.remaining = integerMember(value, member, 1, INT64_MAX);
-      continue;
-    }
-    faultGiven = true;
-    if (member == "status") {
-      fault.status = static_cast<int>(integerMember(value, member, 200, 599));
-    } else if (member == "delay_ms") {
-      const int64_t ms = integerMember(value, member, 0, INT64_MAX);
-      fault.delay = std::min(std::chrono::milliseconds(ms), kLongestFaultDelay);
-    } else if (member == "body") {
-      if (!value.is_string()) {
-        invalid(member, "must be a string");
-      }
-      fault.body = value.get<std::string>();
-    } else if (member == "signature") {
-      const std::string mode = value.is_string() ? value.get<std::string>() : "";
-      if (mode == "valid") {
-        fault.signature = SignatureFault::valid;
-      } else if (mode == "missing") {
-        fault.signature = SignatureFault::missing;
-      } else if (mode == "corrupt") {
-        fault.signature = SignatureFault::corrupt;
-      } else if (mode == "padded") {
-        fault.signature = SignatureFault::padded;
-      } else {
-        invalid(member, "must be \"valid\", \"missing\", \"corrupt\" or \"padded\"");
-      }
-    } else if (member == "drop") {
-      if (!value.is_boolean()) {
-        invalid(member, "must be true or false");
-      }
-      fault.drop = value.get<bool>();
-    } else if (member == "session_validity") {
-      fault.sessionValidity = value;
-    } else if (member == "session_info") {
-      if (!value.is_string()) {
-        invalid(member, "must be a string");
-      }
-      fault.sessionInfo = value.get<std::string>();
+    } else if (member == "remaining") {
+      rule.fault.remaining = integerMember(value, member, 1, INT64_MAX);
+    } else if (const FaultMember* known = faultMemberNamed(member)) {
+      known->parse(value, member, rule.fault);
+      faultGiven = true;
     } else {
       throw std::invalid_argument("unknown member \"" + member + "\"");
     }

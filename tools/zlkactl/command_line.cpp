@@ -37,16 +37,11 @@ bool validBus(const std::string& bus) {
   return bus == "system" || bus == "session" || bus.find(':') != std::string::npos;
 }
 
-std::optional<zlka::Bytes> token(const Invocation& inv, std::string* error) {
-  std::optional<platform::Data> data;
-  if (inv.tokenFile)
-    data = readTokenFile(*inv.tokenFile, error);
-  else if (inv.tokenHex)
-    data = parseHexToken(*inv.tokenHex, error);
-  else if (inv.tokenBase64)
-    data = parseBase64Token(*inv.tokenBase64, error);
-  if (!data) return std::nullopt;
-  return data->toVector();
+platform::Result<platform::Data> tokenData(const Invocation& inv) {
+  if (inv.tokenFile) return readTokenFile(*inv.tokenFile);
+  if (inv.tokenHex) return parseHexToken(*inv.tokenHex);
+  if (inv.tokenBase64) return parseBase64Token(*inv.tokenBase64);
+  return platform::Failure{"a token (--token-file, --token-hex or --token-base64) is required"};
 }
 
 // What the daemon refuses as InvalidParameter when it is absent, named as the user gives it.
@@ -62,10 +57,10 @@ bool jsonRequested(int argc, const char* const* argv) {
                      [](const char* a) { return std::string_view(a) == "--json"; });
 }
 
-bool checkText(const std::optional<std::string>& text, const char* option, std::string* error) {
-  if (!text || platform::isBusString(*text)) return true;
-  if (error) *error = std::string(option) + ": not UTF-8 text";
-  return false;
+// nullopt when the option is absent or UTF-8 text, else why it cannot be sent.
+std::optional<std::string> textProblem(const std::optional<std::string>& text, const char* option) {
+  if (!text || platform::isBusString(*text)) return std::nullopt;
+  return std::string(option) + ": not UTF-8 text";
 }
 
 }  // namespace
@@ -208,18 +203,24 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
   return {std::move(inv), kExitSuccess};
 }
 
-std::optional<zlka::TokenArguments> tokenArguments(const Invocation& inv, std::string* error) {
-  auto data = token(inv, error);
-  if (!data || !checkText(inv.uuid, "--uuid", error)) return std::nullopt;
-  return zlka::TokenArguments{std::move(*data), inv.uuid};
+platform::Result<zlka::TokenArguments> tokenArguments(const Invocation& inv) {
+  platform::Result<platform::Data> data = tokenData(inv);
+  if (!data) return platform::Failure{data.error()};
+  if (auto problem = textProblem(inv.uuid, "--uuid")) return platform::Failure{*problem};
+  return zlka::TokenArguments{data->toVector(), inv.uuid};
 }
 
-std::optional<zlka::MetadataArguments> metadataArguments(const Invocation& inv, std::string* error) {
-  auto data = token(inv, error);
-  if (!data || !checkText(inv.uuid, "--uuid", error) || !checkText(inv.locale, "--locale", error)) return std::nullopt;
+platform::Result<zlka::MetadataArguments> metadataArguments(const Invocation& inv) {
+  platform::Result<platform::Data> data = tokenData(inv);
+  if (!data) return platform::Failure{data.error()};
+  for (auto [text, option] : {std::pair{&inv.uuid, "--uuid"}, std::pair{&inv.locale, "--locale"}})
+    if (auto problem = textProblem(*text, option)) return platform::Failure{*problem};
   // Checked here too, for a message that names the option; the library sends the text as it is.
-  if (inv.requestInfo && !parseRequestInfo(*inv.requestInfo, error)) return std::nullopt;
-  return zlka::MetadataArguments{std::move(*data), inv.uuid, inv.locale, inv.requestInfo};
+  if (inv.requestInfo) {
+    platform::Result<platform::Dictionary> requestInfo = parseRequestInfo(*inv.requestInfo);
+    if (!requestInfo) return platform::Failure{requestInfo.error()};
+  }
+  return zlka::MetadataArguments{data->toVector(), inv.uuid, inv.locale, inv.requestInfo};
 }
 
 }  // namespace zlkactl

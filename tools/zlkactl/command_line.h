@@ -14,6 +14,7 @@
 #include <ostream>
 #include <string>
 
+#include "platform/values/result.h"
 #include "zlka/client.h"
 
 namespace zlkactl {
@@ -53,8 +54,8 @@ struct ParsedCommandLine {
 ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostream& out, std::ostream& err);
 
 // The call arguments of an operation invocation, reading the token from whichever source was
-// given; nullopt with *error set for unusable input (a usage error).
-std::optional<zlka::MetadataArguments> metadataArguments(const Invocation& invocation, std::string* error);
-std::optional<zlka::TokenArguments> tokenArguments(const Invocation& invocation, std::string* error);
+// given; a failure fit for the user for unusable input (a usage error).
+platform::Result<zlka::MetadataArguments> metadataArguments(const Invocation& invocation);
+platform::Result<zlka::TokenArguments> tokenArguments(const Invocation& invocation);
 
 }  // namespace zlkactl

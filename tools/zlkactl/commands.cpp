@@ -43,14 +43,17 @@ int fail(const Invocation& inv, std::ostream& err, int exitStatus, std::string d
 
 int runOperation(const Invocation& inv, std::ostream& out, std::ostream& err) {
   // Input is checked before the bus is touched, so that a typo never costs a round trip.
-  std::string problem;
   std::optional<zlka::MetadataArguments> metadata;
   std::optional<zlka::TokenArguments> token;
-  if (inv.command == Command::Metadata)
-    metadata = metadataArguments(inv, &problem);
-  else
-    token = tokenArguments(inv, &problem);
-  if (!metadata && !token) return fail(inv, err, kExitUsage, problem);
+  if (inv.command == Command::Metadata) {
+    platform::Result<zlka::MetadataArguments> arguments = metadataArguments(inv);
+    if (!arguments) return fail(inv, err, kExitUsage, arguments.error());
+    metadata = *std::move(arguments);
+  } else {
+    platform::Result<zlka::TokenArguments> arguments = tokenArguments(inv);
+    if (!arguments) return fail(inv, err, kExitUsage, arguments.error());
+    token = *std::move(arguments);
+  }
 
   const auto timeout =
       std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::duration<double>(inv.timeoutSeconds));

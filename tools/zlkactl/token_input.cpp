@@ -22,12 +22,6 @@ int hexDigit(char c) {
   return -1;
 }
 
-template <class T>
-std::optional<T> fail(std::string* error, std::string message) {
-  if (error) *error = std::move(message);
-  return std::nullopt;
-}
-
 class FileDescriptor {
  public:
   explicit FileDescriptor(int fd) : fd_(fd) {}
@@ -44,28 +38,27 @@ class FileDescriptor {
 
 }  // namespace
 
-std::optional<platform::Data> parseHexToken(std::string_view text, std::string* error) {
+platform::Result<platform::Data> parseHexToken(std::string_view text) {
   std::vector<uint8_t> bytes;
   bytes.reserve(text.size() / 2);
   for (size_t i = 0; i < text.size(); ++i) {
     if (hexDigit(text[i]) < 0)
-      return fail<platform::Data>(error, "--token-hex: character " + std::to_string(i + 1) + " is not a hex digit");
+      return platform::Failure{"--token-hex: character " + std::to_string(i + 1) + " is not a hex digit"};
   }
-  if (text.size() % 2 != 0) return fail<platform::Data>(error, "--token-hex: an odd number of hex digits");
+  if (text.size() % 2 != 0) return platform::Failure{"--token-hex: an odd number of hex digits"};
   for (size_t i = 0; i < text.size(); i += 2)
     bytes.push_back(static_cast<uint8_t>(hexDigit(text[i]) << 4 | hexDigit(text[i + 1])));
   return platform::Data(std::move(bytes));
 }
 
-std::optional<platform::Data> parseBase64Token(std::string_view text, std::string* error) {
-  if (auto data = platform::base64DecodeStrict(text)) return data;
-  return fail<platform::Data>(error,
-                              "--token-base64: not valid base64 (standard alphabet, '=' padding, no white space)");
+platform::Result<platform::Data> parseBase64Token(std::string_view text) {
+  if (std::optional<platform::Data> data = platform::base64DecodeStrict(text)) return *std::move(data);
+  return platform::Failure{"--token-base64: not valid base64 (standard alphabet, '=' padding, no white space)"};
 }
 
-std::optional<platform::Data> readTokenFile(const std::filesystem::path& path, std::string* error) {
+platform::Result<platform::Data> readTokenFile(const std::filesystem::path& path) {
   auto failure = [&](int e) {
-    return fail<platform::Data>(error, "--token-file: cannot read " + path.string() + ": " + std::strerror(e));
+    return platform::Failure{"--token-file: cannot read " + path.string() + ": " + std::strerror(e)};
   };
   FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
   if (fd.get() < 0) return failure(errno);
@@ -78,20 +71,19 @@ std::optional<platform::Data> readTokenFile(const std::filesystem::path& path, s
     if (n == 0) break;
     bytes.insert(bytes.end(), buffer, buffer + n);
     if (bytes.size() > kMaxTokenFileSize)
-      return fail<platform::Data>(
-          error, "--token-file: " + path.string() + " is larger than " + std::to_string(kMaxTokenFileSize) + " bytes");
+      return platform::Failure{"--token-file: " + path.string() + " is larger than " +
+                               std::to_string(kMaxTokenFileSize) + " bytes"};
   }
   return platform::Data(std::move(bytes));
 }
 
-std::optional<platform::Dictionary> parseRequestInfo(std::string_view json, std::string* error) {
+platform::Result<platform::Dictionary> parseRequestInfo(std::string_view json) {
   std::string problem;
   std::optional<platform::Value> value = platform::json::parse(json, &problem);
-  if (!value) return fail<platform::Dictionary>(error, "--request-info: not valid JSON: " + problem);
-  if (!value->dictionary())
-    return fail<platform::Dictionary>(error, "--request-info: must be a JSON object, not an array");
+  if (!value) return platform::Failure{"--request-info: not valid JSON: " + problem};
+  if (!value->dictionary()) return platform::Failure{"--request-info: must be a JSON object, not an array"};
   if (auto reason = zlka_client::unsendableReason(*value, "requestInfo"))
-    return fail<platform::Dictionary>(error, "--request-info: " + *reason);
+    return platform::Failure{"--request-info: " + *reason};
   return *value->dictionary();
 }
 

@@ -1,6 +1,6 @@
 // Turning what the user typed into call arguments: token bytes from hex, base64 or a file, and
-// JSON for the request info and for settings values. Each returns nullopt with *error set to a
-// message fit for the user when the input is unusable.
+// JSON for the request info and for settings values. Each parser fails with a message fit for the
+// user when the input is unusable.
 #pragma once
 
 #include <filesystem>
@@ -9,6 +9,7 @@
 #include <string_view>
 
 #include "platform/values/data.h"
+#include "platform/values/result.h"
 #include "platform/values/value.h"
 
 namespace zlkactl {
@@ -17,14 +18,14 @@ namespace zlkactl {
 inline constexpr size_t kMaxTokenFileSize = 1 << 20;
 
 // Pairs of hex digits, either letter case, nothing else; "" is an empty token.
-std::optional<platform::Data> parseHexToken(std::string_view text, std::string* error);
+platform::Result<platform::Data> parseHexToken(std::string_view text);
 // Standard alphabet, "=" padding, no white space.
-std::optional<platform::Data> parseBase64Token(std::string_view text, std::string* error);
+platform::Result<platform::Data> parseBase64Token(std::string_view text);
 // The file's bytes as they are.
-std::optional<platform::Data> readTokenFile(const std::filesystem::path& path, std::string* error);
+platform::Result<platform::Data> readTokenFile(const std::filesystem::path& path);
 
 // A JSON object whose values can all travel to the daemon (no nulls).
-std::optional<platform::Dictionary> parseRequestInfo(std::string_view json, std::string* error);
+platform::Result<platform::Dictionary> parseRequestInfo(std::string_view json);
 
 // A settings value: the JSON value when the text is one JSON value (true, 3, "x", {...}, [...],
 // null), otherwise the text itself as a string.

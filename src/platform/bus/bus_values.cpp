@@ -20,50 +20,84 @@ int readInteger(sd_bus_message* m, char type, Value& out) {
 
 int readValue(sd_bus_message* m, Value& out, int depth);
 
-int readArray(sd_bus_message* m, const char* contents, Value& out, int depth) {
+int exitContainer(sd_bus_message* m) { return sd_bus_message_exit_container(m) < 0 ? -EBADMSG : 1; }
+
+// Reads values up to the end of the open container into `items`: >0 at its end, <0 on error.
+int readItems(sd_bus_message* m, Array& items, int depth) {
   int r;
-  if (std::string_view(contents) == "y") {
-    const void* bytes = nullptr;
-    size_t size = 0;
-    if ((r = sd_bus_message_read_array(m, 'y', &bytes, &size)) < 0) return r;
-    out = Value(Data(bytes, size));
-    return 1;
+  while ((r = sd_bus_message_at_end(m, 0)) == 0) {
+    Value item;
+    if ((r = readValue(m, item, depth + 1)) < 0) return r;
+    items.push_back(std::move(item));
   }
-  if ((r = sd_bus_message_enter_container(m, 'a', contents)) < 0) return r;
-  if (contents[0] == '{') {
-    std::string entry(contents + 1, std::string_view(contents).size() - 2);
-    bool stringKeys = contents[1] == 's' || contents[1] == 'o' || contents[1] == 'g';
-    Dictionary dictionary;
-    while ((r = sd_bus_message_enter_container(m, 'e', entry.c_str())) > 0) {
-      Value key, value;
-      if ((r = readValue(m, key, depth + 1)) < 0 || (r = readValue(m, value, depth + 1)) < 0) return r;
-      if ((r = sd_bus_message_exit_container(m)) < 0) return r;
-      if (stringKeys) dictionary.insert_or_assign(*key.string(), std::move(value));
-    }
-    if (r < 0) return r;
-    if (stringKeys)
-      out = Value(std::move(dictionary));
-    else
-      out = Value(Opaque{"dictionary with " + std::string(1, contents[1]) + " keys"});
-  } else {
-    Array array;
-    while ((r = sd_bus_message_at_end(m, 0)) == 0) {
-      Value item;
-      if ((r = readValue(m, item, depth + 1)) < 0) return r;
-      array.push_back(std::move(item));
-    }
-    if (r < 0) return r;
-    out = Value(std::move(array));
-  }
-  return sd_bus_message_exit_container(m) < 0 ? -EBADMSG : 1;
+  return r;
 }
 
-int readValue(sd_bus_message* m, Value& out, int depth) {
-  if (depth > kMaxDepth) return -ELOOP;
-  char type = 0;
-  const char* contents = nullptr;
-  int r = sd_bus_message_peek_type(m, &type, &contents);
-  if (r <= 0) return r < 0 ? r : -EBADMSG;
+int readBytes(sd_bus_message* m, Value& out) {
+  const void* bytes = nullptr;
+  size_t size = 0;
+  if (int r = sd_bus_message_read_array(m, 'y', &bytes, &size); r < 0) return r;
+  out = Value(Data(bytes, size));
+  return 1;
+}
+
+// The entries of an open dictionary array. JSON keys are strings: a dictionary with other keys is
+// read through (so that the message stays well-formed) and kept only as a placeholder.
+int readDictionary(sd_bus_message* m, const char* contents, Value& out, int depth) {
+  std::string entry(contents + 1, std::string_view(contents).size() - 2);
+  bool stringKeys = contents[1] == 's' || contents[1] == 'o' || contents[1] == 'g';
+  Dictionary dictionary;
+  int r;
+  while ((r = sd_bus_message_enter_container(m, 'e', entry.c_str())) > 0) {
+    Value key, value;
+    if ((r = readValue(m, key, depth + 1)) < 0 || (r = readValue(m, value, depth + 1)) < 0) return r;
+    if ((r = sd_bus_message_exit_container(m)) < 0) return r;
+    if (stringKeys) dictionary.insert_or_assign(*key.string(), std::move(value));
+  }
+  if (r < 0) return r;
+  if (stringKeys)
+    out = Value(std::move(dictionary));
+  else
+    out = Value(Opaque{"dictionary with " + std::string(1, contents[1]) + " keys"});
+  return 1;
+}
+
+int readList(sd_bus_message* m, Value& out, int depth) {
+  Array array;
+  if (int r = readItems(m, array, depth); r < 0) return r;
+  out = Value(std::move(array));
+  return 1;
+}
+
+int readArray(sd_bus_message* m, const char* contents, Value& out, int depth) {
+  if (std::string_view(contents) == "y") return readBytes(m, out);
+  int r;
+  if ((r = sd_bus_message_enter_container(m, 'a', contents)) < 0) return r;
+  r = contents[0] == '{' ? readDictionary(m, contents, out, depth) : readList(m, out, depth);
+  if (r < 0) return r;
+  return exitContainer(m);
+}
+
+// Structs map to arrays of their fields.
+int readStruct(sd_bus_message* m, const char* contents, Value& out, int depth) {
+  int r;
+  if ((r = sd_bus_message_enter_container(m, 'r', contents)) < 0) return r;
+  Array fields;
+  if ((r = readItems(m, fields, depth)) < 0) return r;
+  out = Value(std::move(fields));
+  return exitContainer(m);
+}
+
+int readVariant(sd_bus_message* m, const char* contents, Value& out, int depth) {
+  int r;
+  if ((r = sd_bus_message_enter_container(m, 'v', contents)) < 0) return r;
+  if ((r = readValue(m, out, depth + 1)) < 0) return r;
+  return exitContainer(m);
+}
+
+// A value of a basic type; file descriptors are kept only as a placeholder JSON cannot hold.
+int readBasic(sd_bus_message* m, char type, Value& out) {
+  int r;
   switch (type) {
     case 'y':
       return readInteger<uint8_t>(m, type, out);
@@ -101,27 +135,26 @@ int readValue(sd_bus_message* m, Value& out, int depth) {
       if ((r = sd_bus_message_read_basic(m, 'h', &fd)) > 0) out = Value(Opaque{"file descriptor"});
       return r;
     }
-    case 'v': {
-      if ((r = sd_bus_message_enter_container(m, 'v', contents)) < 0) return r;
-      if ((r = readValue(m, out, depth + 1)) < 0) return r;
-      return sd_bus_message_exit_container(m) < 0 ? -EBADMSG : 1;
-    }
-    case 'r': {
-      if ((r = sd_bus_message_enter_container(m, 'r', contents)) < 0) return r;
-      Array fields;
-      while ((r = sd_bus_message_at_end(m, 0)) == 0) {
-        Value field;
-        if ((r = readValue(m, field, depth + 1)) < 0) return r;
-        fields.push_back(std::move(field));
-      }
-      if (r < 0) return r;
-      out = Value(std::move(fields));
-      return sd_bus_message_exit_container(m) < 0 ? -EBADMSG : 1;
-    }
+    default:
+      return -EBADMSG;
+  }
+}
+
+int readValue(sd_bus_message* m, Value& out, int depth) {
+  if (depth > kMaxDepth) return -ELOOP;
+  char type = 0;
+  const char* contents = nullptr;
+  int r = sd_bus_message_peek_type(m, &type, &contents);
+  if (r <= 0) return r < 0 ? r : -EBADMSG;
+  switch (type) {
+    case 'v':
+      return readVariant(m, contents, out, depth);
+    case 'r':
+      return readStruct(m, contents, out, depth);
     case 'a':
       return readArray(m, contents, out, depth);
     default:
-      return -EBADMSG;
+      return readBasic(m, type, out);
   }
 }
 
@@ -138,6 +171,35 @@ bool isLongerThan(sd_bus_message* m, const std::string& signature, size_t maximu
   }
   sd_bus_message_rewind(m, 0);
   return length > maximum;
+}
+
+struct Utf8Lead {
+  size_t length;  // of the whole sequence; 0 when the byte starts none
+  uint32_t bits;  // of the code point that it carries
+};
+
+Utf8Lead utf8Lead(unsigned char c) {
+  if (c >= 0xC2 && c <= 0xDF) return {2, c & 0x1Fu};
+  if (c >= 0xE0 && c <= 0xEF) return {3, c & 0x0Fu};
+  if (c >= 0xF0 && c <= 0xF4) return {4, c & 0x07u};
+  return {0, 0};
+}
+
+// The length of the well-formed multi-byte UTF-8 sequence at text[i], 0 when there is none.
+size_t utf8SequenceLength(std::string_view text, size_t i) {
+  const Utf8Lead lead = utf8Lead(static_cast<unsigned char>(text[i]));
+  if (lead.length == 0 || i + lead.length > text.size()) return 0;
+  uint32_t cp = lead.bits;
+  for (size_t k = 1; k < lead.length; ++k) {
+    const auto c = static_cast<unsigned char>(text[i + k]);
+    if ((c & 0xC0) != 0x80) return 0;
+    cp = (cp << 6) | (c & 0x3F);
+  }
+  // Overlong forms, UTF-16 surrogates and code points beyond U+10FFFF.
+  if ((lead.length == 3 && cp < 0x800) || (lead.length == 4 && (cp < 0x10000 || cp > 0x10FFFF)) ||
+      (cp >= 0xD800 && cp <= 0xDFFF))
+    return 0;
+  return lead.length;
 }
 
 }  // namespace
@@ -180,36 +242,10 @@ std::optional<BusError> readKnownDictionary(sd_bus_message* m, const std::map<st
 bool isBusString(std::string_view text) {
   size_t i = 0;
   while (i < text.size()) {
-    auto byte = [&](size_t k) { return static_cast<unsigned char>(text[k]); };
-    unsigned char c = byte(i);
+    const auto c = static_cast<unsigned char>(text[i]);
     if (c == 0) return false;
-    if (c < 0x80) {
-      ++i;
-      continue;
-    }
-    size_t length = 0;
-    uint32_t cp = 0;
-    if (c >= 0xC2 && c <= 0xDF) {
-      length = 2;
-      cp = c & 0x1F;
-    } else if (c >= 0xE0 && c <= 0xEF) {
-      length = 3;
-      cp = c & 0x0F;
-    } else if (c >= 0xF0 && c <= 0xF4) {
-      length = 4;
-      cp = c & 0x07;
-    } else {
-      return false;
-    }
-    if (i + length > text.size()) return false;
-    for (size_t k = 1; k < length; ++k) {
-      if ((byte(i + k) & 0xC0) != 0x80) return false;
-      cp = (cp << 6) | (byte(i + k) & 0x3F);
-    }
-    // Overlong forms, UTF-16 surrogates and code points beyond U+10FFFF.
-    if ((length == 3 && cp < 0x800) || (length == 4 && (cp < 0x10000 || cp > 0x10FFFF)) ||
-        (cp >= 0xD800 && cp <= 0xDFFF))
-      return false;
+    const size_t length = c < 0x80 ? 1 : utf8SequenceLength(text, i);
+    if (length == 0) return false;
     i += length;
   }
   return true;

@@ -62,6 +62,46 @@ bool stillRunning(int pidfd) {
   return ::poll(&p, 1, 0) == 0;
 }
 
+bool isManifestKey(const std::string& key) {
+  return key == "uid" || key == "user" || key == "label" || key == "executable" || key == "entitlements";
+}
+
+// The user an entry pins, by number or by name; exactly one of the two.
+Result<uid_t> pinnedUser(const Value& manifest) {
+  const Value* uid = manifest.find("uid");
+  const Value* user = manifest.find("user");
+  if (!uid && !user) return Failure{"pins no user: an entry must give \"uid\" (a number) or \"user\" (a name)"};
+  if (uid && user) return Failure{"gives both \"uid\" and \"user\": give one"};
+  if (uid) {
+    std::optional<uid_t> number = uidOfNumber(*uid);
+    if (!number) return Failure{"has a \"uid\" that is not a user id"};
+    return *number;
+  }
+  const std::string* name = user->string();
+  if (!name || name->empty()) return Failure{"has a \"user\" that is not a user name"};
+  std::optional<uid_t> resolved = uidOfUser(*name);
+  if (!resolved) return Failure{"names an unknown user \"" + *name + "\""};
+  return *resolved;
+}
+
+Result<std::optional<std::string>> pinnedLabel(const Value& manifest) {
+  const Value* label = manifest.find("label");
+  if (!label) return std::optional<std::string>();
+  if (!label->string() || label->string()->empty()) return Failure{"has a \"label\" that is not a non-empty string"};
+  return std::optional<std::string>(*label->string());
+}
+
+Result<std::optional<std::string>> pinnedExecutable(const Value& manifest) {
+  const Value* executable = manifest.find("executable");
+  if (!executable) return std::optional<std::string>();
+  const std::string* path = executable->string();
+  if (!path || !path->starts_with("/")) return Failure{"has an \"executable\" that is not an absolute path"};
+  // Compare against the resolved path the kernel reports for a running executable.
+  std::error_code ec;
+  std::filesystem::path canonical = std::filesystem::canonical(*path, ec);
+  return std::optional<std::string>(ec ? *path : canonical.string());
+}
+
 }  // namespace
 
 Result<ManifestEntry> parseManifestEntry(std::string_view text) {
@@ -72,37 +112,18 @@ Result<ManifestEntry> parseManifestEntry(std::string_view text) {
   if (!fields) return Failure{"is not a JSON object"};
   // A misspelt key would silently widen the entry ("lable" pins no label), so it voids the entry.
   for (const auto& [key, value] : *fields)
-    if (key != "uid" && key != "user" && key != "label" && key != "executable" && key != "entitlements")
-      return Failure{"has an unknown key \"" + key + "\""};
+    if (!isManifestKey(key)) return Failure{"has an unknown key \"" + key + "\""};
 
   ManifestEntry entry;
-  const Value* uid = parsed->find("uid");
-  const Value* user = parsed->find("user");
-  if (!uid && !user) return Failure{"pins no user: an entry must give \"uid\" (a number) or \"user\" (a name)"};
-  if (uid && user) return Failure{"gives both \"uid\" and \"user\": give one"};
-  if (uid) {
-    std::optional<uid_t> number = uidOfNumber(*uid);
-    if (!number) return Failure{"has a \"uid\" that is not a user id"};
-    entry.uid = *number;
-  } else {
-    const std::string* name = user->string();
-    if (!name || name->empty()) return Failure{"has a \"user\" that is not a user name"};
-    std::optional<uid_t> resolved = uidOfUser(*name);
-    if (!resolved) return Failure{"names an unknown user \"" + *name + "\""};
-    entry.uid = *resolved;
-  }
-  if (const Value* label = parsed->find("label")) {
-    if (!label->string() || label->string()->empty()) return Failure{"has a \"label\" that is not a non-empty string"};
-    entry.label = *label->string();
-  }
-  if (const Value* executable = parsed->find("executable")) {
-    const std::string* path = executable->string();
-    if (!path || !path->starts_with("/")) return Failure{"has an \"executable\" that is not an absolute path"};
-    // Compare against the resolved path the kernel reports for a running executable.
-    std::error_code ec;
-    std::filesystem::path canonical = std::filesystem::canonical(*path, ec);
-    entry.executable = ec ? *path : canonical.string();
-  }
+  Result<uid_t> uid = pinnedUser(*parsed);
+  if (!uid) return Failure{uid.error()};
+  entry.uid = *uid;
+  Result<std::optional<std::string>> label = pinnedLabel(*parsed);
+  if (!label) return Failure{label.error()};
+  entry.label = *std::move(label);
+  Result<std::optional<std::string>> executable = pinnedExecutable(*parsed);
+  if (!executable) return Failure{executable.error()};
+  entry.executable = *std::move(executable);
   const Value* entitlements = parsed->find("entitlements");
   if (!entitlements || !entitlements->dictionary()) return Failure{"has no \"entitlements\" object"};
   entry.entitlements = *entitlements->dictionary();

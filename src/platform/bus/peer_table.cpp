@@ -85,44 +85,82 @@ void PeerTable::identify(Peer& peer, sd_bus_message* credentialsReply, const std
   pump(peer);
 }
 
+namespace {
+
+// The credentials read so far; a peer is known only by both its user id and its process id.
+struct CredentialsSeen {
+  PeerCredentials credentials;
+  bool uid = false;
+  bool pid = false;
+};
+
+void readUserID(sd_bus_message* reply, CredentialsSeen& seen) {
+  uint32_t v = 0;
+  seen.uid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
+  seen.credentials.uid = v;
+}
+
+void readProcessID(sd_bus_message* reply, CredentialsSeen& seen) {
+  uint32_t v = 0;
+  seen.pid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
+  seen.credentials.pid = static_cast<pid_t>(v);
+}
+
+// The bus hands the label over with its C string's trailing NUL.
+void readSecurityLabel(sd_bus_message* reply, CredentialsSeen& seen) {
+  const void* bytes = nullptr;
+  size_t size = 0;
+  if (sd_bus_message_read_array(reply, 'y', &bytes, &size) <= 0) return;
+  std::string label(static_cast<const char*>(bytes), size);
+  while (!label.empty() && label.back() == '\0') label.pop_back();
+  if (!label.empty()) seen.credentials.label = std::move(label);
+}
+
+// The message owns its descriptor: a copy is kept.
+void readProcessFD(sd_bus_message* reply, CredentialsSeen& seen) {
+  int fd = -1;
+  if (sd_bus_message_read_basic(reply, 'h', &fd) > 0 && fd >= 0)
+    seen.credentials.pidfd.reset(fcntl(fd, F_DUPFD_CLOEXEC, 3));
+}
+
+struct CredentialsKey {
+  const char* name;
+  const char* type;  // of the variant's value; a value of another type is passed over
+  void (*read)(sd_bus_message* reply, CredentialsSeen& seen);
+};
+
+const CredentialsKey kCredentialsKeys[] = {
+    {"UnixUserID", "u", readUserID},
+    {"ProcessID", "u", readProcessID},
+    {"LinuxSecurityLabel", "ay", readSecurityLabel},
+    {"ProcessFD", "h", readProcessFD},
+};
+
+// Reads the variant of one entry when its key is one of ours with the expected type, else skips it.
+void readCredentialsValue(sd_bus_message* reply, std::string_view key, CredentialsSeen& seen) {
+  for (const CredentialsKey& known : kCredentialsKeys) {
+    if (key == known.name && sd_bus_message_enter_container(reply, 'v', known.type) > 0) {
+      known.read(reply, seen);
+      sd_bus_message_exit_container(reply);
+      return;
+    }
+  }
+  sd_bus_message_skip(reply, "v");
+}
+
+}  // namespace
+
 std::optional<PeerCredentials> PeerTable::parseCredentials(sd_bus_message* reply) {
-  PeerCredentials c;
-  bool haveUid = false, havePid = false;
+  CredentialsSeen seen;
   if (sd_bus_message_enter_container(reply, 'a', "{sv}") <= 0) return std::nullopt;
   while (sd_bus_message_enter_container(reply, 'e', "sv") > 0) {
     const char* key = nullptr;
     if (sd_bus_message_read_basic(reply, 's', &key) <= 0) return std::nullopt;
-    std::string_view k = key;
-    if (k == "UnixUserID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
-      uint32_t v = 0;
-      haveUid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
-      c.uid = v;
-      sd_bus_message_exit_container(reply);
-    } else if (k == "ProcessID" && sd_bus_message_enter_container(reply, 'v', "u") > 0) {
-      uint32_t v = 0;
-      havePid = sd_bus_message_read_basic(reply, 'u', &v) > 0;
-      c.pid = static_cast<pid_t>(v);
-      sd_bus_message_exit_container(reply);
-    } else if (k == "LinuxSecurityLabel" && sd_bus_message_enter_container(reply, 'v', "ay") > 0) {
-      const void* bytes = nullptr;
-      size_t size = 0;
-      if (sd_bus_message_read_array(reply, 'y', &bytes, &size) > 0) {
-        std::string label(static_cast<const char*>(bytes), size);
-        while (!label.empty() && label.back() == '\0') label.pop_back();
-        if (!label.empty()) c.label = std::move(label);
-      }
-      sd_bus_message_exit_container(reply);
-    } else if (k == "ProcessFD" && sd_bus_message_enter_container(reply, 'v', "h") > 0) {
-      int fd = -1;
-      if (sd_bus_message_read_basic(reply, 'h', &fd) > 0 && fd >= 0) c.pidfd.reset(fcntl(fd, F_DUPFD_CLOEXEC, 3));
-      sd_bus_message_exit_container(reply);
-    } else {
-      sd_bus_message_skip(reply, "v");
-    }
+    readCredentialsValue(reply, key, seen);
     sd_bus_message_exit_container(reply);
   }
-  if (!haveUid || !havePid) return std::nullopt;
-  return c;
+  if (!seen.uid || !seen.pid) return std::nullopt;
+  return std::move(seen.credentials);
 }
 
 void PeerTable::pump(Peer& peer) {

@@ -7,6 +7,7 @@
 #include <mutex>
 
 #include "platform/config/readable_file.h"
+#include "platform/values/result.h"
 
 namespace platform {
 
@@ -110,6 +111,65 @@ void collectUnknownKeys(const toml::table& table, const std::string& prefix, std
   }
 }
 
+// toml++ reports a syntax error by throwing: it becomes the file, line and description.
+Result<toml::table> parseTOML(const std::filesystem::path& path) {
+  try {
+    return toml::parse_file(path.string());
+  } catch (const toml::parse_error& e) {
+    return Failure{path.string() + ":" + std::to_string(e.source().begin.line) + ": " + std::string(e.description())};
+  }
+}
+
+bool readDevice(Reader& r, Configuration& c) {
+  std::string deviceClass;
+  bool ok = r.boolean("device.internal_build", c.device.internalBuild, true) &&
+            r.string("device.device_class", deviceClass, true);
+  c.device.deviceClass = deviceClass;
+  return ok;
+}
+
+// "prod" is required; the other environments are optional, but complete when given.
+bool readServers(Reader& r, Configuration& c) {
+  for (const char* env : {"prod", "it", "ut", "maint"}) {
+    std::string prefix = std::string("servers.") + env;
+    const toml::node* table = r.node(prefix);
+    if (!table && std::string_view(env) != "prod") continue;
+    if (!table || !table->is_table()) return r.fail(prefix, "missing table (expected static_content and api)");
+    ServerEnvironment e;
+    bool ok = r.url(prefix + ".static_content", e.staticContent) && r.url(prefix + ".api", e.api);
+    c.servers.emplace(env, e);
+    if (!ok) return false;
+  }
+  return true;
+}
+
+// The files and directories the daemon reads: the CA bundle, the trust anchor, the settings suite
+// and the entitlement manifests.
+bool readFiles(Reader& r, Configuration& c) {
+  std::string trustAnchor;
+  if (!r.string("tls.ca_file", c.caFile, false) || !r.string("sap.trust_anchor", trustAnchor, true)) return false;
+  if (trustAnchor.empty()) return r.fail("sap.trust_anchor", "must name a PEM file");
+  c.trustAnchor = trustAnchor;
+  std::string settingsDir = c.settingsDirectory.string();
+  std::string entitlementsDir = c.entitlementsDirectory.string();
+  if (!r.string("settings.suite_dir", settingsDir, false) || !r.string("entitlements.dir", entitlementsDir, false))
+    return false;
+  if (settingsDir.empty()) return r.fail("settings.suite_dir", "must not be empty");
+  if (entitlementsDir.empty()) return r.fail("entitlements.dir", "must not be empty");
+  c.settingsDirectory = settingsDir;
+  c.entitlementsDirectory = entitlementsDir;
+  return true;
+}
+
+bool readLog(Reader& r, Configuration& c) {
+  std::string level(logLevelName(c.logLevel));
+  if (!r.string("log.level", level, false) || !r.boolean("log.private_data", c.privateData, false)) return false;
+  std::optional<LogLevel> parsed = logLevelFromName(level);
+  if (!parsed) return r.fail("log.level", "'" + level + "' is not one of debug, info, default, error, fault");
+  c.logLevel = *parsed;
+  return true;
+}
+
 std::mutex gCurrentMutex;
 std::shared_ptr<const Configuration> gCurrent;
 
@@ -135,58 +195,20 @@ std::optional<Configuration> loadConfiguration(const std::filesystem::path& path
   };
   if (std::optional<std::string> why = unreadableFileReason(path))
     return failWith(path.string() + ": cannot read the configuration file: " + *why);
-  toml::table root;
-  try {
-    root = toml::parse_file(path.string());
-  } catch (const toml::parse_error& e) {
-    return failWith(path.string() + ":" + std::to_string(e.source().begin.line) + ": " + std::string(e.description()));
-  }
+  Result<toml::table> root = parseTOML(path);
+  if (!root) return failWith(root.error());
 
   Configuration c;
   c.path = path;
-  Reader r(root, path.string());
-  std::string deviceClass, level, trustAnchor, settingsDir, entitlementsDir;
-  bool ok = r.boolean("device.internal_build", c.device.internalBuild, true) &&
-            r.string("device.device_class", deviceClass, true);
-  c.device.deviceClass = deviceClass;
-  for (const char* env : {"prod", "it", "ut", "maint"}) {
-    if (!ok) break;
-    std::string prefix = std::string("servers.") + env;
-    const toml::node* table = r.node(prefix);
-    if (!table && std::string_view(env) != "prod") continue;
-    if (!table || !table->is_table()) {
-      ok = r.fail(prefix, "missing table (expected static_content and api)");
-      break;
-    }
-    ServerEnvironment e;
-    ok = r.url(prefix + ".static_content", e.staticContent) && r.url(prefix + ".api", e.api);
-    c.servers.emplace(env, e);
-  }
-  ok = ok && r.string("tls.ca_file", c.caFile, false) && r.string("sap.trust_anchor", trustAnchor, true);
-  if (ok && trustAnchor.empty()) ok = r.fail("sap.trust_anchor", "must name a PEM file");
-  c.trustAnchor = trustAnchor;
-  settingsDir = c.settingsDirectory.string();
-  entitlementsDir = c.entitlementsDirectory.string();
-  ok = ok && r.string("settings.suite_dir", settingsDir, false) && r.string("entitlements.dir", entitlementsDir, false);
-  if (ok && settingsDir.empty()) ok = r.fail("settings.suite_dir", "must not be empty");
-  if (ok && entitlementsDir.empty()) ok = r.fail("entitlements.dir", "must not be empty");
-  c.settingsDirectory = settingsDir;
-  c.entitlementsDirectory = entitlementsDir;
-  level = std::string(logLevelName(c.logLevel));
-  ok = ok && r.string("log.level", level, false) && r.boolean("log.private_data", c.privateData, false);
-  if (ok) {
-    auto parsed = logLevelFromName(level);
-    if (!parsed)
-      ok = r.fail("log.level", "'" + level + "' is not one of debug, info, default, error, fault");
-    else
-      c.logLevel = *parsed;
-  }
-  // Each connection worker costs a thread; past a few thousand the bound no longer protects anything.
-  ok = ok && r.count("service.max_workers", c.maxWorkers, 2, 4096);
+  Reader r(*root, path.string());
+  // Each section stops at its first problem, and the reader keeps only the first one.
+  bool ok = readDevice(r, c) && readServers(r, c) && readFiles(r, c) && readLog(r, c) &&
+            // Each connection worker costs a thread; past a few thousand the bound no longer protects anything.
+            r.count("service.max_workers", c.maxWorkers, 2, 4096);
   if (!ok) return failWith(r.error());
 
   std::vector<std::string> unknown;
-  collectUnknownKeys(root, "", unknown);
+  collectUnknownKeys(*root, "", unknown);
   for (const auto& key : unknown) c.warnings.push_back(path.string() + ": unknown key '" + key + "' ignored");
   return c;
 }

@@ -152,10 +152,55 @@ void HTTPSession::Engine::finish(const std::shared_ptr<HTTPTaskState>& task, CUR
   complete(task, std::move(outcome));
 }
 
+void HTTPSession::Engine::cancelEverything(Active& active, Tasks& adds) {
+  for (auto& [easy, task] : active) {
+    release(*task);
+    complete(task, HTTPOutcome::failure(cancelledError(task->request.URL)));
+  }
+  for (auto& task : adds) complete(task, HTTPOutcome::failure(cancelledError(task->request.URL)));
+}
+
+void HTTPSession::Engine::startAdded(Tasks& adds, Active& active) {
+  for (auto& task : adds)
+    if (!task->finished && !start(task, active))
+      complete(task, HTTPOutcome::failure(transportError(CURLE_FAILED_INIT, "", task->request.URL)));
+}
+
+void HTTPSession::Engine::cancelRequested(Tasks& cancels, Active& active) {
+  for (auto& task : cancels) {
+    auto it = task->easy ? active.find(task->easy.get()) : active.end();
+    if (it != active.end()) {
+      active.erase(it);
+      release(*task);
+    }
+    complete(task, HTTPOutcome::failure(cancelledError(task->request.URL)));
+  }
+}
+
+void HTTPSession::Engine::collectFinished(Active& active) {
+  int left = 0;
+  while (CURLMsg* msg = curl_multi_info_read(multi_.get(), &left)) {
+    if (msg->msg != CURLMSG_DONE) continue;
+    auto it = active.find(msg->easy_handle);
+    if (it == active.end()) continue;
+    auto task = it->second;
+    CURLcode result = msg->data.result;
+    active.erase(it);
+    if (shouldResend(*task, result)) {
+      release(*task);
+      task->resent = true;
+      task->uploaded = 0;
+      task->responseHeaders.clear();
+      if (start(task, active)) continue;
+    }
+    finish(task, result);
+  }
+}
+
 void HTTPSession::Engine::run() {
   Active active;
   for (;;) {
-    std::deque<std::shared_ptr<HTTPTaskState>> adds, cancels;
+    Tasks adds, cancels;
     bool stopping;
     {
       std::lock_guard lock(mutex_);
@@ -163,44 +208,12 @@ void HTTPSession::Engine::run() {
       cancels.swap(toCancel_);
       stopping = stopping_;
     }
-    if (stopping) {
-      for (auto& [easy, task] : active) {
-        release(*task);
-        complete(task, HTTPOutcome::failure(cancelledError(task->request.URL)));
-      }
-      for (auto& task : adds) complete(task, HTTPOutcome::failure(cancelledError(task->request.URL)));
-      return;
-    }
-    for (auto& task : adds)
-      if (!task->finished && !start(task, active))
-        complete(task, HTTPOutcome::failure(transportError(CURLE_FAILED_INIT, "", task->request.URL)));
-    for (auto& task : cancels) {
-      auto it = task->easy ? active.find(task->easy.get()) : active.end();
-      if (it != active.end()) {
-        active.erase(it);
-        release(*task);
-      }
-      complete(task, HTTPOutcome::failure(cancelledError(task->request.URL)));
-    }
+    if (stopping) return cancelEverything(active, adds);
+    startAdded(adds, active);
+    cancelRequested(cancels, active);
     int running = 0;
     curl_multi_perform(multi_.get(), &running);
-    int left = 0;
-    while (CURLMsg* msg = curl_multi_info_read(multi_.get(), &left)) {
-      if (msg->msg != CURLMSG_DONE) continue;
-      auto it = active.find(msg->easy_handle);
-      if (it == active.end()) continue;
-      auto task = it->second;
-      CURLcode result = msg->data.result;
-      active.erase(it);
-      if (shouldResend(*task, result)) {
-        release(*task);
-        task->resent = true;
-        task->uploaded = 0;
-        task->responseHeaders.clear();
-        if (start(task, active)) continue;
-      }
-      finish(task, result);
-    }
+    collectFinished(active);
     curl_multi_poll(multi_.get(), nullptr, 0, 1000, nullptr);
   }
 }

@@ -47,6 +47,7 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
 
  private:
   using Active = std::unordered_map<CURL*, std::shared_ptr<HTTPTaskState>>;
+  using Tasks = std::deque<std::shared_ptr<HTTPTaskState>>;
 
   // Called with mutex_ held.
   bool startWorker();
@@ -54,13 +55,18 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
   bool start(const std::shared_ptr<HTTPTaskState>& task, Active& active);
   void release(HTTPTaskState& t);
   void finish(const std::shared_ptr<HTTPTaskState>& task, CURLcode result);
+  // The steps of one turn of the event thread's loop.
+  void cancelEverything(Active& active, Tasks& adds);
+  void startAdded(Tasks& adds, Active& active);
+  void cancelRequested(Tasks& cancels, Active& active);
+  void collectFinished(Active& active);
 
   HTTPSessionConfiguration configuration_;
   std::shared_ptr<Queue> callbackQueue_;
   std::shared_ptr<Semaphore> claims_;
   CurlMultiPtr multi_;
   std::mutex mutex_;
-  std::deque<std::shared_ptr<HTTPTaskState>> toAdd_, toCancel_;
+  Tasks toAdd_, toCancel_;
   bool stopping_ = false;
   std::thread worker_;
   std::vector<CurlEasyPtr> spareHandles_;  // the event thread's, reset and used again

@@ -3,12 +3,37 @@
 #include <algorithm>
 #include <cinttypes>
 #include <cstdio>
+#include <optional>
 
 #include "platform/log/log.h"
 
 namespace platform {
 
 namespace {
+
+bool isRealConversion(char conv) { return std::string_view("fFeEgG").find(conv) != std::string_view::npos; }
+
+double realOf(const LogArg::Storage& arg) {
+  if (auto p = std::get_if<double>(&arg)) return *p;
+  if (auto i = std::get_if<int64_t>(&arg)) return static_cast<double>(*i);
+  if (auto u = std::get_if<uint64_t>(&arg)) return static_cast<double>(*u);
+  return 0;
+}
+
+int characterOf(const LogArg::Storage& arg) {
+  if (auto i = std::get_if<int64_t>(&arg)) return static_cast<int>(*i);
+  if (auto u = std::get_if<uint64_t>(&arg)) return static_cast<int>(*u);
+  return '?';
+}
+
+// The 64 bits an integer conversion prints (a real is truncated first); nullopt for none.
+std::optional<unsigned long long> integerBitsOf(const LogArg::Storage& arg) {
+  if (auto i = std::get_if<int64_t>(&arg)) return static_cast<unsigned long long>(*i);
+  if (auto u = std::get_if<uint64_t>(&arg)) return *u;
+  if (auto d = std::get_if<double>(&arg)) return static_cast<unsigned long long>(static_cast<long long>(*d));
+  if (auto p = std::get_if<LogArg::Pointer>(&arg)) return static_cast<unsigned long long>(p->value);
+  return std::nullopt;
+}
 
 void appendNumber(std::string& out, const char* directive, const LogArg::Storage& arg) {
   char buf[128];
@@ -18,42 +43,19 @@ void appendNumber(std::string& out, const char* directive, const LogArg::Storage
   std::string base = f.substr(0, f.size() - 1);
   while (!base.empty() && std::string_view("hljztL").find(base.back()) != std::string_view::npos) base.pop_back();
   int n = 0;
-  if (conv == 'f' || conv == 'F' || conv == 'e' || conv == 'E' || conv == 'g' || conv == 'G') {
-    double d = 0;
-    if (auto p = std::get_if<double>(&arg))
-      d = *p;
-    else if (auto i = std::get_if<int64_t>(&arg))
-      d = static_cast<double>(*i);
-    else if (auto u = std::get_if<uint64_t>(&arg))
-      d = static_cast<double>(*u);
-    n = std::snprintf(buf, sizeof buf, (base + conv).c_str(), d);
+  if (isRealConversion(conv)) {
+    n = std::snprintf(buf, sizeof buf, (base + conv).c_str(), realOf(arg));
   } else if (conv == 'c') {
-    int c = '?';
-    if (auto i = std::get_if<int64_t>(&arg))
-      c = static_cast<int>(*i);
-    else if (auto u = std::get_if<uint64_t>(&arg))
-      c = static_cast<int>(*u);
-    n = std::snprintf(buf, sizeof buf, (base + 'c').c_str(), c);
+    n = std::snprintf(buf, sizeof buf, (base + 'c').c_str(), characterOf(arg));
   } else {
-    bool isSigned = conv == 'd' || conv == 'i';
-    if (auto i = std::get_if<int64_t>(&arg)) {
-      if (isSigned)
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*i));
-      else
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*i));
-    } else if (auto u = std::get_if<uint64_t>(&arg)) {
-      if (isSigned)
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*u));
-      else
-        n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(*u));
-    } else if (auto d = std::get_if<double>(&arg)) {
-      n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<long long>(*d));
-    } else if (auto p = std::get_if<LogArg::Pointer>(&arg)) {
-      n = std::snprintf(buf, sizeof buf, (base + "ll" + conv).c_str(), static_cast<unsigned long long>(p->value));
-    } else {
+    std::optional<unsigned long long> bits = integerBitsOf(arg);
+    if (!bits) {
       out += "(null)";
       return;
     }
+    std::string spec = base + "ll" + conv;
+    n = conv == 'd' || conv == 'i' ? std::snprintf(buf, sizeof buf, spec.c_str(), static_cast<long long>(*bits))
+                                   : std::snprintf(buf, sizeof buf, spec.c_str(), *bits);
   }
   if (n > 0) out.append(buf, std::min<size_t>(static_cast<size_t>(n), sizeof buf - 1));
 }
@@ -109,51 +111,84 @@ void capArgument(std::string& out, size_t start) {
   out += "... (" + std::to_string(leftOut) + " more bytes)";
 }
 
+// One directive of a format string, from its '%' up to `end`: either a conversion that takes an
+// argument, or text that is copied as it stands (a "%%", or a directive that is incomplete or
+// unknown, kept visible).
+struct Directive {
+  size_t end = 0;
+  char conv = 0;  // 0: copy `literal`
+  std::string_view literal;
+  std::string spec;  // "%", flags, width, precision, length modifiers and the conversion
+  bool isPrivate = false;
+};
+
+Directive copied(size_t end, std::string_view literal) {
+  Directive d;
+  d.end = end;
+  d.literal = literal;
+  return d;
+}
+
+Directive readDirective(std::string_view format, size_t start) {
+  size_t i = start + 1;
+  if (i >= format.size()) return copied(format.size(), "%");
+  if (format[i] == '%') return copied(i + 1, "%");
+  Directive d;
+  if (format[i] == '{') {
+    size_t close = format.find('}', i);
+    if (close == std::string_view::npos) return copied(format.size(), format.substr(start));
+    std::string_view annotation = format.substr(i + 1, close - i - 1);
+    d.isPrivate = annotation.find("private") != std::string_view::npos;
+    i = close + 1;
+  }
+  d.spec = "%";
+  while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos)
+    d.spec += format[i++];
+  while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos)
+    d.spec += format[i++];
+  if (i >= format.size()) return copied(format.size(), format.substr(start));
+  if (std::string_view("@sdiuxXocfFeEgGp").find(format[i]) == std::string_view::npos)
+    return copied(i + 1, format.substr(start, i - start + 1));
+  d.end = i + 1;
+  d.conv = format[i];
+  d.spec += d.conv;
+  return d;
+}
+
+void appendArgument(std::string& out, const Directive& directive, const LogArg::Storage& arg) {
+  switch (directive.conv) {
+    case '@':
+    case 's': {
+      size_t start = out.size();
+      appendObject(out, arg);
+      capArgument(out, start);
+      break;
+    }
+    case 'p':
+      appendPointer(out, arg);
+      break;
+    default:
+      appendNumber(out, directive.spec.c_str(), arg);
+      break;
+  }
+}
+
 }  // namespace
 
 std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate) {
   std::string out;
   out.reserve(format.size() + 32);
   size_t next = 0;
-  for (size_t i = 0; i < format.size(); ++i) {
-    char c = format[i];
-    if (c != '%') {
-      out += c;
+  size_t i = 0;
+  while (i < format.size()) {
+    if (format[i] != '%') {
+      out += format[i++];
       continue;
     }
-    size_t start = i++;
-    if (i >= format.size()) {
-      out += '%';
-      break;
-    }
-    if (format[i] == '%') {
-      out += '%';
-      continue;
-    }
-    bool isPrivate = false;
-    if (format[i] == '{') {
-      size_t close = format.find('}', i);
-      if (close == std::string_view::npos) {
-        out.append(format.substr(start));
-        break;
-      }
-      std::string_view annotation = format.substr(i + 1, close - i - 1);
-      isPrivate = annotation.find("private") != std::string_view::npos;
-      i = close + 1;
-    }
-    // flags, width, precision, length modifiers
-    std::string directive = "%";
-    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos)
-      directive += format[i++];
-    while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos)
-      directive += format[i++];
-    if (i >= format.size()) {
-      out.append(format.substr(start));
-      break;
-    }
-    char conv = format[i];
-    if (std::string_view("@sdiuxXocfFeEgGp").find(conv) == std::string_view::npos) {
-      out.append(format.substr(start, i - start + 1));  // unknown directive: keep it visible
+    const Directive directive = readDirective(format, i);
+    i = directive.end;
+    if (!directive.conv) {
+      out.append(directive.literal);
       continue;
     }
     if (next >= args.size()) {
@@ -161,26 +196,11 @@ std::string formatLogMessage(std::string_view format, std::span<const LogArg> ar
       continue;
     }
     const LogArg::Storage& arg = args[next++].storage();
-    if (isPrivate && !showPrivate) {
+    if (directive.isPrivate && !showPrivate) {
       out += "<private>";
       continue;
     }
-    directive += conv;
-    switch (conv) {
-      case '@':
-      case 's': {
-        size_t start = out.size();
-        appendObject(out, arg);
-        capArgument(out, start);
-        break;
-      }
-      case 'p':
-        appendPointer(out, arg);
-        break;
-      default:
-        appendNumber(out, directive.c_str(), arg);
-        break;
-    }
+    appendArgument(out, directive, arg);
   }
   return out;
 }
