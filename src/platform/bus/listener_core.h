@@ -32,6 +32,7 @@ struct Reply::State {
 
 class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
  public:
+  // Core serves with `options` on behalf of `owner`, which must outlive it; nothing runs until run().
   Core(ListenerOptions options, Listener& owner)
       : options_(std::move(options)), peers_(owner, options_.entitlementsForPeer, options_.maxCallsPerPeer) {}
 
