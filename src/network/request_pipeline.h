@@ -27,24 +27,31 @@ struct RequestPlan {
   std::function<platform::Dictionary(platform::Array encodedTokens)> requestDict;
 };
 
-// Whether the connection of the message being served holds "token-auth" in the service's
-// entitlement. Read on the delivering thread, before any hop.
+// callerIsEntitled is true when the connection of the message being served holds "token-auth" in
+// the service's entitlement; false with no current connection. Read on the delivering thread,
+// before any hop.
 bool callerIsEntitled();
 
-// The error handed to a client, logged at fault level first.
+// failure returns the ZLKATokenManagerErrorDomain error of `code` handed to a client, after one
+// fault-level log line (with the caller-refused or operation-failed MESSAGE_ID).
 platform::Error failure(int64_t code);
 
-// Token array, body, signature, request, upload. nullopt once the request is on its way (the handler
-// will run on the HTTP session's callback queue), else the code to fail with.
+// sendSignedRequest parses `token`, builds the body by `plan`, signs it, and uploads it. It returns
+// nullopt once the request is on its way (`handler` will run once, on the HTTP session's callback
+// queue), else the code to fail with: -3 for token data that does not parse, -5 or -6 when the
+// session's open failed in transport or on a bad answer, and -4 for any other failure to sign.
 std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const platform::Data& token, const RequestPlan& plan,
                                          ResponseHandler handler);
 
-// Transport error and status: nullopt when the answer may go on. 204 passes too when asked.
+// checkTransportAndStatus returns nullopt when the answer may go on (status 200, or 204 when
+// `acceptNoContent`), else -5 for a transport error, -3 for 400, -4 for 401 and -6 otherwise.
 std::optional<int64_t> checkTransportAndStatus(const std::optional<platform::Error>& taskError,
                                                const std::optional<platform::HTTPResponse>& response,
                                                const std::optional<platform::Data>& body, bool acceptNoContent);
 
-// Empty body, signature, JSON: the parsed answer or the code to fail with.
+// verifyAndParse returns the JSON answer once its "signature" header verifies over `body`, else
+// -6 for an empty body, a bad signature or JSON that does not parse, and -4 when the verification
+// ran out of time.
 std::variant<platform::Value, int64_t> verifyAndParse(ZLKANetwork& network, const platform::HTTPResponse& response,
                                                       const std::optional<platform::Data>& body);
 
