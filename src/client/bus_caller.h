@@ -41,7 +41,12 @@ class BusCaller : public std::enable_shared_from_this<BusCaller> {
   BusCaller(const BusCaller&) = delete;
   BusCaller& operator=(const BusCaller&) = delete;
 
+  // callAsync calls `method` of the service with what `write` appends and returns at once;
+  // `handler` runs once, on the event thread, with the reply or with the error: the D-Bus error,
+  // a failure to build or send the call, Cancelled when the caller closes first.
   void callAsync(std::string method, ArgumentWriter write, ReplyHandler handler);
+  // callAndWait is callAsync that returns only after `handler` has run; it borrows its arguments
+  // for that long. From the event thread itself it calls synchronously.
   void callAndWait(const std::string& method, const ArgumentWriter& write, const ReplyHandler& handler);
   // Hands `error` to `handler` on the event thread, for calls refused before they are sent.
   void failAsync(platform::Error error, ReplyHandler handler);
@@ -49,6 +54,7 @@ class BusCaller : public std::enable_shared_from_this<BusCaller> {
   // Stops the loop; calls not yet answered get Cancelled. Waits for the thread to end, unless
   // called on it (from a handler), in which case the thread ends once the handler returns.
   void close();
+  // onEventThread is true when called from the thread that runs the handlers.
   bool onEventThread() const { return std::this_thread::get_id() == threadId_; }
 
  private:

@@ -27,6 +27,7 @@ using zlka::kOperationErrorDomain;
 inline constexpr char kBusErrorNameKey[] = "DBusErrorName";
 inline constexpr char kBusErrorMessageKey[] = "DBusErrorMessage";
 
+// clientError makes the kClientErrorDomain error of `code` with `description` as its message.
 platform::Error clientError(ClientErrorCode code, std::string description);
 
 // The error for a D-Bus error reply (name and message as received).

@@ -22,9 +22,13 @@ struct MetadataReply {
 // ConfirmActivationForToken answers with nothing.
 struct Confirmation {};
 
+// decodeMetadataReply reads "sss" and parses the metadata JSON; MalformedReply when the reply has
+// another form or the text is not JSON. `reply` is borrowed.
 Result<MetadataReply> decodeMetadataReply(sd_bus_message* reply);
-Result<platform::Data> decodeActivationReply(sd_bus_message* reply);  // "ay": the new token
-Result<Confirmation> decodeConfirmationReply(sd_bus_message* reply);  // ""
+// decodeActivationReply reads "ay", the new token; MalformedReply otherwise.
+Result<platform::Data> decodeActivationReply(sd_bus_message* reply);
+// decodeConfirmationReply succeeds for an empty reply; MalformedReply otherwise.
+Result<Confirmation> decodeConfirmationReply(sd_bus_message* reply);
 // Any answer: each out argument read as a Value (variants unwrapped, byte arrays as Data).
 Result<platform::Array> decodeAnyReply(sd_bus_message* reply);
 

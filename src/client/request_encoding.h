@@ -39,19 +39,27 @@ struct MetadataArguments {
 // Containers (dictionaries and arrays) nested inside the request info, which counts as the first.
 inline constexpr int kMaxRequestInfoDepth = 16;
 
-// Why `value` cannot be sent, naming it by `path` ("requestInfo.items[2]"); nullopt when it can.
+// unsendableReason says why `value` cannot be sent, naming it by `path` ("requestInfo.items[2]"):
+// a null, an opaque value, a string or key that is not a D-Bus string, or containers nested deeper
+// than kMaxRequestInfoDepth; nullopt when it can.
 std::optional<std::string> unsendableReason(const platform::Value& value, const std::string& path);
+// unsendableReason says why the arguments cannot be sent (a uuid that is not a D-Bus string);
+// nullopt when they can.
 std::optional<std::string> unsendableReason(const TokenArguments& arguments);
+// unsendableReason says the same of the metadata arguments, requestedLocale and request info
+// included.
 std::optional<std::string> unsendableReason(const MetadataArguments& arguments);
 
 using platform::isBusString;
 
-// Write the a{sv} argument of a call. Negative errno on failure (check unsendableReason first).
+// appendArguments writes the a{sv} argument of a call, only the keys given. It returns 0, or a
+// negative errno when sd-bus refuses a value (check unsendableReason first).
 int appendArguments(sd_bus_message* message, const TokenArguments& arguments);
 int appendArguments(sd_bus_message* message, const MetadataArguments& arguments);
 
-// Write one value as a variant ("v" and its contents), or a dictionary as a{sv}.
+// appendVariant writes one value as a variant ("v" and its contents); 0 or a negative errno.
 int appendVariant(sd_bus_message* message, const platform::Value& value);
+// appendDictionary writes a dictionary as a{sv}; 0 or a negative errno.
 int appendDictionary(sd_bus_message* message, const platform::Dictionary& dictionary);
 
 }  // namespace zlka_client

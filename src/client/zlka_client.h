@@ -53,21 +53,30 @@ class ZLKAClient {
   ZLKAClient(const ZLKAClient&) = delete;
   ZLKAClient& operator=(const ZLKAClient&) = delete;
 
-  // RequestMetadataForToken: ppid, locale identifier and metadata.
+  // requestMetadata calls RequestMetadataForToken and waits for the ppid, locale identifier and
+  // metadata, or fails with the operation's error or a client error (InvalidRequest for arguments
+  // that cannot be sent, ServiceUnavailable, Refused, MalformedReply).
   Result<MetadataReply> requestMetadata(const MetadataArguments& arguments);
+  // requestMetadataAsync returns at once; `callback` runs once, on the client's event thread, with
+  // what requestMetadata would return. The same holds for each *Async below.
   void requestMetadataAsync(const MetadataArguments& arguments, MetadataCallback callback);
 
-  // RequestActivationForToken: the new token.
+  // requestActivation calls RequestActivationForToken and waits for the new token, or fails as
+  // requestMetadata does.
   Result<platform::Data> requestActivation(const TokenArguments& arguments);
+  // requestActivationAsync is requestActivation with a callback on the event thread.
   void requestActivationAsync(const TokenArguments& arguments, ActivationCallback callback);
 
-  // ConfirmActivationForToken: nothing but success.
+  // confirmActivation calls ConfirmActivationForToken and waits for its empty success, or fails as
+  // requestMetadata does.
   Result<Confirmation> confirmActivation(const TokenArguments& arguments);
+  // confirmActivationAsync is confirmActivation with a callback on the event thread.
   void confirmActivationAsync(const TokenArguments& arguments, ConfirmationCallback callback);
 
   // Any method of the daemon's interface with arguments written by `write` (for example an a{sv}
   // with a key of the wrong type); the answer's arguments as Values.
   Result<platform::Array> callRaw(const std::string& method, const ArgumentWriter& write);
+  // callRawAsync is callRaw with a callback on the event thread.
   void callRawAsync(const std::string& method, ArgumentWriter write, RawCallback callback);
 
   // failAsync hands `error` to `callback` on the event thread, as for a call refused before it is

@@ -27,25 +27,32 @@ struct RequestPlan {
   std::function<platform::Dictionary(platform::Array encodedTokens)> requestDict;
 };
 
-// Whether the connection of the message being served holds "token-auth" in the service's
-// entitlement. Read on the delivering thread, before any hop.
+// callerIsEntitled is true when the connection of the message being served holds "token-auth" in
+// the service's entitlement; false with no current connection. Read on the delivering thread,
+// before any hop.
 bool callerIsEntitled();
 
-// The error handed to a client, logged at fault level first.
+// failure returns the ZLKATokenManagerErrorDomain error of `code` handed to a client, after one
+// fault-level log line (with the caller-refused or operation-failed MESSAGE_ID).
 platform::Error failure(int64_t code);
 
-// Token array, body, signature, request, upload. nullopt once the request is on its way (the handler
-// will run on the HTTP session's callback queue), else the code to fail with.
+// sendSignedRequest parses `token`, builds the body by `plan`, signs it, and uploads it. It returns
+// nullopt once the request is on its way (`handler` will run once, on the HTTP session's callback
+// queue), else the code to fail with: -3 for token data that does not parse, -5 or -6 when the
+// session's open failed in transport or on a bad answer, and -4 for any other failure to sign.
 std::optional<int64_t> sendSignedRequest(ZLKANetwork& network, const platform::Data& token, const RequestPlan& plan,
                                          ResponseHandler handler);
 
-// Transport error, status and empty body: nullopt when the answer may go on, else the code to fail
-// with. An answer judged by its status alone also passes with 204 and needs no body.
+// checkAnswer returns nullopt when the answer may go on, else the code to fail with: -5 for a
+// transport error, -3 for status 400, -4 for 401, -6 for another status or a missing body. An
+// answer judged by its status alone also passes with 204 and needs no body.
 std::optional<int64_t> checkAnswer(const std::optional<platform::Error>& taskError,
                                    const std::optional<platform::HTTPResponse>& response,
                                    const std::optional<platform::Data>& body, bool judgedByStatusAlone);
 
-// Signature and JSON of a body that checkAnswer passed: the parsed answer or the code to fail with.
+// verifyAndParse returns the JSON answer of a body that checkAnswer passed once its "signature"
+// header verifies over it, else -6 for a bad signature or JSON that does not parse, and -4 when
+// the verification ran out of time.
 std::variant<platform::Value, int64_t> verifyAndParse(ZLKANetwork& network, const platform::HTTPResponse& response,
                                                       const platform::Data& body);
 

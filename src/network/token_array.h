@@ -10,4 +10,5 @@
 
 #include "platform/values/data.h"
 
+// parseTokenArray returns the items of `tokenData` as above.
 std::optional<std::vector<platform::Data>> parseTokenArray(const std::optional<platform::Data>& tokenData);

@@ -25,6 +25,8 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
                           public TarvexSAPSessionDelegate,
                           public std::enable_shared_from_this<ZLKANetwork> {
  public:
+  // sharedInstance is the process's one instance, made on the first call (on any thread, once) and
+  // never destroyed.
   static std::shared_ptr<ZLKANetwork> sharedInstance();
   // existingInstance is the shared instance once something has made it, else null (it never makes
   // one: monitoring must not start the session's machinery).
@@ -50,21 +52,28 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
                                                           const std::optional<platform::Data>& handshakeData,
                                                           TarvexSAPDataCompletion completion) override;
 
-  // Fault-injection switches: true only on an internal build whose suite holds true for the key.
+  // Fault-injection switches: each is true only on an internal build whose suite holds true for
+  // its key (ForceNetworkFailure, ...), read afresh at every call.
   bool forceNetworkFailure();
   bool forceTokenActivationFailure();
   bool forceTokenConfirmationFailure();
   bool forceTarvexSAPFailure();
+  // The setters store a value that the switches above never read (see the top of this file).
   void setForceNetworkFailure(bool value);
   void setForceTokenActivationFailure(bool value);
   void setForceTokenConfirmationFailure(bool value);
   void setForceTarvexSAPFailure(bool value);
 
-  // Base URLs to use now (no trailing slash).
+  // Base URLs to use now (no trailing slash): the prod environment's, or on an internal build the
+  // environment its suite names under StaticContentServer, TarvexSAPServer and Server (an unknown
+  // name falls back to prod with an error line; Server "custom" answers CustomServer, or "" when it
+  // is not set). "" when the configuration has no such server.
   std::string _selectedStaticContentServer();
   std::string _selectedTarvexSAPServer();
   std::string _selectedAPIServer();
 
+  // The parts made by sharedInstance(), shared; the setters replace them (tests) and the next use
+  // reads the new one. isInternalBuild is the device fact read at creation.
   std::shared_ptr<ZLKANetworkProtocol> exportedObject() const;
   bool isInternalBuild() const;
   void setIsInternalBuild(bool value);
@@ -75,12 +84,23 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
   std::shared_ptr<TarvexSAPSession> tarvexSAPSession() const;
   void setTarvexSAPSession(std::shared_ptr<TarvexSAPSession> value);
 
-  // The request pipeline shared by the operations.
+  // The request pipeline shared by the operations. Out-parameters may be null.
+  //
+  // _openTarvexSAPSession opens the session when it is closed and waits, without a time limit,
+  // for the open to end; nullopt when the session is open or being opened, else the open's error.
   std::optional<platform::Error> _openTarvexSAPSession();
+  // _tarvexSignatureForDataSync opens the session if needed, then waits up to 10 s for the
+  // signature of `data`. nullopt on failure, with *error the open's or signing's error, or
+  // *timedOut true when the wait ran out (a late signature is dropped).
   std::optional<platform::Data> _tarvexSignatureForDataSync(const platform::Data& data, bool* timedOut,
                                                             std::optional<platform::Error>* error);
+  // _verifyTarvexSignatureSync waits up to 10 s for the session's verdict on `signature` over
+  // `data`, without opening it; false on failure, with *error or *timedOut set as above.
   bool _verifyTarvexSignatureSync(const std::optional<platform::Data>& signature, const platform::Data& data,
                                   bool* timedOut, std::optional<platform::Error>* error);
+  // _generateTokenAuthURLRequestForEndpoint makes the JSON POST to `endpoint` on the selected API
+  // server, 60 s time-out, carrying the session identifier and the base64 signature as headers
+  // when given. It cannot fail; an unusable base URL fails the upload instead.
   platform::HTTPRequest _generateTokenAuthURLRequestForEndpoint(const std::string& endpoint,
                                                                 const std::optional<std::string>& sessionID,
                                                                 const std::optional<platform::Data>& signature);
@@ -89,6 +109,7 @@ class ZLKANetwork final : public ZLKANetworkProtocol,
   struct Private {};
 
  public:
+  // Only sharedInstance() can call this, through make_shared; the parts are made by _init().
   explicit ZLKANetwork(Private);
 
  private:

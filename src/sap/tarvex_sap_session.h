@@ -39,6 +39,8 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   using SignCompletion = std::function<void(std::optional<platform::Data>, std::optional<platform::Error>)>;
   using VerifyCompletion = std::function<void(bool, std::optional<platform::Error>)>;
 
+  // sessionWithDelegate makes a closed session over `primitives` that asks `delegate` (held weakly)
+  // for the network legs of its opens. It makes the three queues and cannot fail otherwise.
   static std::shared_ptr<TarvexSAPSession> sessionWithDelegate(
       std::weak_ptr<TarvexSAPSessionDelegate> delegate,
       TarvexSAPPrimitives primitives = TarvexSAPPrimitives::library());
@@ -46,20 +48,40 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   [[noreturn]] static std::shared_ptr<TarvexSAPSession> init();
   ~TarvexSAPSession();
 
-  void openWithCompletionHandler(OpenCompletion completion);  // an empty completion still opens
-  void close();                                               // queued; returns at once
-  // Anything but bytes is an invalid parameter. An empty completion does nothing at all.
+  // openWithCompletionHandler returns at once and opens the session: a primitive context, the
+  // certificate and handshake legs through the delegate, the exchange. `completion` gets nullopt
+  // once the session is open; otherwise the session is closed again and it gets InvalidState (-7)
+  // when the session was not closed or was closed or reopened meanwhile, Internal (-4) when a
+  // primitive fails, InvalidParameter (-3) when a leg answers no data, or the delegate's own error.
+  // An empty completion still opens.
+  void openWithCompletionHandler(OpenCompletion completion);
+  // close tears the primitive context down on the internal queue and returns at once.
+  void close();
+  // signatureForData signs `data` (bytes; anything else is InvalidParameter) with the open session
+  // and passes the signature to `completion`, or nullopt with InvalidState (-7) when the session
+  // is not open (an expired one is closed first) and InvalidParameter (-3) when the primitive fails.
+  // An empty completion does nothing at all.
   void signatureForData(const std::optional<platform::Value>& data, SignCompletion completion);
+  // As above, for bytes.
   void signatureForData(const platform::Data& data, SignCompletion completion);
+  // verifySignature passes true to `completion` when `signature` is the server's valid signature of
+  // `data` for a request this session signed; otherwise false with InvalidParameter (-3) for
+  // arguments that are not bytes or a signature the primitive refuses, or InvalidState (-7) when
+  // the session is not open. An empty completion does nothing at all.
   void verifySignature(const std::optional<platform::Value>& signature, const std::optional<platform::Value>& data,
                        VerifyCompletion completion);
+  // As above, for bytes; a missing signature is InvalidParameter.
   void verifySignature(const std::optional<platform::Data>& signature, const platform::Data& data,
                        VerifyCompletion completion);
 
+  // state is Closed, Initializing (any step of an open) or Open; an expired session is closed first.
   TarvexSAPSessionState state();
-  double TTL();  // seconds left while open (negative once past), else 0
+  // TTL is the seconds left while open (negative once past), else 0.
+  double TTL();
+  // setTTL makes the session expire `seconds` from now.
   void setTTL(double seconds);
-  std::string description();  // "TarvexSAPSession <state: [Open], TTL: 3599.998000s>"
+  // description renders the session for logs: "TarvexSAPSession <state: [Open], TTL: 3599.998000s>".
+  std::string description();
 
   // observedState and observedTTL answer at once, from any thread (the internal queue included),
   // for monitoring: the state and seconds left as the internal queue last set them. Unlike
@@ -68,6 +90,8 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   TarvexSAPSessionState observedState() const;
   double observedTTL() const;
 
+  // The session's identity, its delegate and its queues as made at construction; the references
+  // are borrowed from the session, the queues shared.
   const platform::UUID& UUID() const { return uuid_; }
   std::weak_ptr<TarvexSAPSessionDelegate> delegate() const { return delegate_; }
   const std::shared_ptr<platform::Queue>& completionQueue() const { return completionQueue_; }
@@ -93,6 +117,7 @@ class TarvexSAPSession : public std::enable_shared_from_this<TarvexSAPSession> {
   struct Private {};
 
  public:
+  // Only sessionWithDelegate() can call this, through make_shared.
   TarvexSAPSession(Private, std::weak_ptr<TarvexSAPSessionDelegate> delegate, TarvexSAPPrimitives primitives);
 
  private:

@@ -22,6 +22,8 @@ enum TarvexSAPSessionErrorCode : int64_t {
 
 // The code's fixed description; nullopt for -5, -6 and codes outside -7..-1.
 std::optional<std::string> QVSAPS_errorDescriptionForCode(int64_t code);
+
+// QVSAPS_errorWithCode makes the session-domain error of `code` with its fixed description.
 platform::Error QVSAPS_errorWithCode(int64_t code);
-// No description means no user-info at all.
+// QVSAPS_errorWithCode makes it with `description` instead; nullopt means no user-info at all.
 platform::Error QVSAPS_errorWithCode(int64_t code, const std::optional<std::string>& description);

@@ -49,6 +49,7 @@ class RuntimeControl {
   struct Private {};
 
  public:
+  // Only start() can call this, through make_shared; it exports nothing by itself.
   RuntimeControl(Private, RuntimeOptions options) : options_(std::move(options)) {}
 
  private:

@@ -11,7 +11,10 @@
 
 namespace Entitlements {
 
+// hasEntitlement is true when the peer of `connection` holds `entitlement` as above; false when it
+// does not, or when its identity is not established.
 bool hasEntitlement(const platform::Connection& connection, std::string_view entitlement);
+// hasCategory is true when the peer's value for `entitlement` grants `category` as above.
 bool hasCategory(const platform::Connection& connection, std::string_view category, std::string_view entitlement);
 
 }  // namespace Entitlements

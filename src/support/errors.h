@@ -24,6 +24,7 @@ enum ZLKAErrorCode : int64_t {
   ZLKAErrorServer = -6,
 };
 
+// errorDescription is the fixed message of `code` in `domain` (above), or nullopt when it has none.
 std::optional<std::string> errorDescription(std::string_view domain, int64_t code);
 
 // An error whose description is errorDescription(domain, code).

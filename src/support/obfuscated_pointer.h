@@ -6,4 +6,5 @@
 
 #include <cstdint>
 
+// obfuscatedPointer is `pointer` moved by the process's offset, or 0 for null; it never fails.
 uintptr_t obfuscatedPointer(const void* pointer);

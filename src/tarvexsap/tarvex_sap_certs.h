@@ -19,10 +19,13 @@
 #include <string_view>
 #include <vector>
 
+// The deleters of the owning types below.
 struct TarvexSAPKeyFree {
+  // Frees the key (EVP_PKEY_free).
   void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
 };
 struct TarvexSAPCertFree {
+  // Frees the certificate (X509_free).
   void operator()(X509* cert) const { X509_free(cert); }
 };
 using TarvexSAPKey = std::unique_ptr<EVP_PKEY, TarvexSAPKeyFree>;
@@ -39,6 +42,7 @@ struct TarvexSAPCredential {
   TarvexSAPKey key;
 };
 
+// TarvexSAPGenerateEd25519Key returns a fresh Ed25519 key, owned by the caller.
 TarvexSAPKey TarvexSAPGenerateEd25519Key();
 // Ed25519 key from 32 raw private bytes: a fixed seed gives a fixed key.
 TarvexSAPKey TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed);
@@ -52,8 +56,11 @@ TarvexSAPCredential TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& ro
                                                    const TarvexSAPValidity& validity = {},
                                                    EVP_PKEY* subjectKey = nullptr);
 
+// TarvexSAPCertToPEM and TarvexSAPCertToDER encode `cert`, which stays the caller's.
 std::string TarvexSAPCertToPEM(const X509* cert);
 std::vector<uint8_t> TarvexSAPCertToDER(const X509* cert);
+// TarvexSAPCertFromPEM and TarvexSAPCertFromDER decode one certificate (the first of a PEM text),
+// owned by the caller.
 TarvexSAPCert TarvexSAPCertFromPEM(std::string_view pem);
 TarvexSAPCert TarvexSAPCertFromDER(std::span<const uint8_t> der);
 

@@ -38,6 +38,7 @@ enum class TarvexSAPServerStatus {
   cryptoFailure,   // the crypto library failed
 };
 
+// TarvexSAPServerStatusName is the status's constant name for logs ("badSignature"); static storage.
 const char* TarvexSAPServerStatusName(TarvexSAPServerStatus status);
 
 class TarvexSAPServer {
@@ -68,14 +69,24 @@ class TarvexSAPServer {
   // The certificate to serve to devices.
   const std::vector<uint8_t>& setupCertificateDER() const { return certificate_; }
 
+  // handshake answers a device's 90-byte handshake `request` with the signed session info and keeps
+  // the association under `sessionIdentifier` for `ttl` (replacing one of that name). Its status is
+  // malformed for an empty or over-long identifier, a request that does not parse or a low-order
+  // device key, and cryptoFailure when OpenSSL fails; nothing is kept then.
   HandshakeResult handshake(std::string_view sessionIdentifier, std::span<const uint8_t> request,
                             std::chrono::seconds ttl);
+  // verifyRequest checks a device's 40-byte `signature` of `body` and, when it is good, records its
+  // seq as seen and returns it. Its status is unknownSession, expired, badSignature or replay
+  // otherwise, and nothing is recorded.
   VerifyResult verifyRequest(std::string_view sessionIdentifier, std::span<const uint8_t> signature,
                              std::span<const uint8_t> body);
+  // signResponse signs `body` as the answer to the request of sequence number `seq`. Its status is
+  // unknownSession, expired or cryptoFailure otherwise.
   SignResult signResponse(std::string_view sessionIdentifier, uint64_t seq, std::span<const uint8_t> body);
 
-  // Returns how many associations were removed.
+  // dropExpired removes the associations past their time-to-live and returns how many it removed.
   std::size_t dropExpired();
+  // associationCount counts the associations kept, expired ones not yet dropped included.
   std::size_t associationCount() const;
 
   // Identifiers longer than this are refused as malformed.

@@ -15,6 +15,7 @@
 namespace tsap {
 
 struct X509StoreFree {
+  // Frees the store and the certificates it holds (X509_STORE_free).
   void operator()(X509_STORE* store) const { X509_STORE_free(store); }
 };
 
@@ -23,7 +24,9 @@ struct DeviceConfig {
   std::string machineIDPath;
 };
 
+// configureDevice is TarvexSAPConfigure.
 int32_t configureDevice(const TarvexSAPConfig* config);
+// currentDeviceConfig is the configuration in force, shared, or null when none is.
 std::shared_ptr<const DeviceConfig> currentDeviceConfig();
 
 // First 20 bytes of SHA-256("TSAP1 hwid" || the 32 hex digits of the machine-id file); random

@@ -16,6 +16,7 @@ class DeviceContext {
  public:
   enum class State { awaitingCertificate, awaitingSessionInfo, associated, failed, tornDown };
 
+  // DeviceContext starts awaiting the setup certificate, under `config` (shared) for its whole life.
   explicit DeviceContext(std::shared_ptr<const DeviceConfig> config) : config_(std::move(config)) {}
   ~DeviceContext() { erase(); }
   DeviceContext(const DeviceContext&) = delete;
@@ -23,12 +24,17 @@ class DeviceContext {
 
   // First call: certificate in, handshake request out. Second: session info in, nothing out.
   // `returnCode` is written only on success.
+  // Statuses as TarvexSAPExchange's.
   int32_t exchange(const TarvexHWInfo_& hwInfo, Bytes in, RequestBytes& request, bool& produced, uint8_t& returnCode);
+  // sign writes the signature of `data` under the next sequence number; statuses as TarvexSAPSign's.
   int32_t sign(Bytes data, SignatureBytes& signature);
+  // verify checks a response's signature and uses its sequence number up; statuses as
+  // TarvexSAPVerify's.
   int32_t verify(Bytes signature, Bytes data);
   // Erases every secret and refuses all later calls.
   void tearDown();
 
+  // state is where the context is in its life.
   State state() const { return state_; }
   std::mutex mutex;
 

@@ -11,7 +11,9 @@ namespace tsap {
 
 class OutstandingSeqs {
  public:
+  // OutstandingSeqs starts empty and holds at most `capacity` numbers.
   explicit OutstandingSeqs(std::size_t capacity = kMaxOutstanding) : capacity_(capacity) {}
+  // add records `seq`, dropping the lowest numbers beyond the capacity.
   void add(uint64_t seq);
   // Removes seq and answers whether it was outstanding.
   bool take(uint64_t seq);

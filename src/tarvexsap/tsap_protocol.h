@@ -10,6 +10,7 @@ namespace tsap {
 struct SessionKeys {
   Secret<kKeySize> request;
   Secret<kKeySize> response;
+  // clear erases both keys.
   void clear() {
     request.clear();
     response.clear();

@@ -9,6 +9,7 @@
 
 namespace tsap {
 
+// registerContext keeps `context` under a new handle and returns it; null when the counter is spent.
 QVSAPContextOpaque_* registerContext(std::shared_ptr<DeviceContext> context);
 // Null when the handle is not live.
 std::shared_ptr<DeviceContext> findContext(const QVSAPContextOpaque_* handle);

@@ -14,6 +14,7 @@ class ReplayWindow {
  public:
   // Records seq and answers true if it had not been seen and is not below the window.
   bool accept(uint64_t seq);
+  // highest is the highest seq accepted so far; 0 before any.
   uint64_t highest() const { return highest_; }
 
  private:

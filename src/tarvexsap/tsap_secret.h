@@ -14,12 +14,15 @@ namespace tsap {
 template <std::size_t N>
 class Secret {
  public:
+  // Secret starts as N zero bytes.
   Secret() { bytes_.fill(0); }
   ~Secret() { clear(); }
   Secret(const Secret&) = delete;
   Secret& operator=(const Secret&) = delete;
 
+  // clear erases the bytes in a way the compiler cannot elide.
   void clear() { OPENSSL_cleanse(bytes_.data(), bytes_.size()); }
+  // Views of the N bytes, valid while the secret lives.
   uint8_t* data() { return bytes_.data(); }
   const uint8_t* data() const { return bytes_.data(); }
   static constexpr std::size_t size() { return N; }

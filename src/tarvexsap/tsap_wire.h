@@ -59,13 +59,16 @@ RequestBytes encodeRequest(const HandshakeRequest& request);
 // False unless: exactly 90 bytes, magic, version 1, n <= 20 and zero padding after n.
 bool parseRequest(std::span<const uint8_t> bytes, HandshakeRequest& request);
 
+// encodeSessionInfo lays out the 129-byte session info, version 1.
 SessionInfoBytes encodeSessionInfo(const SessionInfo& info);
 // False unless exactly 129 bytes with version 1.
 bool parseSessionInfo(std::span<const uint8_t> bytes, SessionInfo& info);
 
+// putSeq writes `seq` big-endian; getSeq reads it back.
 void putSeq(uint64_t seq, std::span<uint8_t, kSeqSize> out);
 uint64_t getSeq(std::span<const uint8_t, kSeqSize> in);
 
+// labelBytes views the characters of `label`, without its NUL, as bytes; it borrows them.
 inline std::span<const uint8_t> labelBytes(std::string_view label) {
   return {reinterpret_cast<const uint8_t*>(label.data()), label.size()};
 }

@@ -37,6 +37,7 @@ struct BusKey {
 // that value). Returns nullopt when every entry was taken; unknown keys, repeated keys, values of
 // another type or too long, and a negative `take` are InvalidArgs errors naming the key.
 using BusDictionaryReader = std::function<int(const std::string& key, sd_bus_message* message)>;
+// readKnownDictionary reads an a{sv} argument as above.
 std::optional<BusError> readKnownDictionary(sd_bus_message* message, const std::map<std::string, BusKey>& keys,
                                             const BusDictionaryReader& take);
 

@@ -22,9 +22,11 @@ using EntitlementLookup = std::function<std::optional<Value>(std::string_view en
 
 class Connection : public std::enable_shared_from_this<Connection> {
  public:
+  // Connection represents the peer of unique name `peerName`; a null `entitlements` grants nothing.
   explicit Connection(std::string peerName, EntitlementLookup entitlements = nullptr);
   virtual ~Connection() = default;
 
+  // peerName is the peer's unique bus name (":1.42"), borrowed from the connection.
   const std::string& peerName() const { return peerName_; }
   // valueForEntitlement answers the peer's value for an entitlement, or nullopt when the peer does
   // not hold it or its identity is not (yet) established.
@@ -32,12 +34,15 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // setEntitlementLookup installs how the peer's entitlements are read; null grants nothing.
   void setEntitlementLookup(EntitlementLookup lookup);
 
-  // Set up by the listener's delegate before resume(); calls arrive only once resumed.
+  // The interface and the object the peer's calls go to, set by the listener's delegate before
+  // resume() and shared with the connection; the getters answer null until they are set.
   void setExportedInterface(std::shared_ptr<const Interface> interface);
   void setExportedObject(std::shared_ptr<void> object);
+  // resume lets the peer's calls through; until then the listener refuses them (AccessDenied).
   void resume();
   std::shared_ptr<const Interface> exportedInterface() const;
   std::shared_ptr<void> exportedObject() const;
+  // isResumed is true once resume() has been called.
   bool isResumed() const;
 
   // The serial queue this peer's calls run on (made on first use).
@@ -49,6 +54,8 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // Makes a connection current on this thread for the lifetime of the scope.
   class CurrentScope {
    public:
+    // CurrentScope makes `connection` (borrowed, may be null) current until the scope ends, then
+    // restores the previous one.
     explicit CurrentScope(Connection* connection);
     ~CurrentScope();
     CurrentScope(const CurrentScope&) = delete;

@@ -62,7 +62,9 @@ Result<ManifestEntry> parseManifestEntry(std::string_view text);
 
 class EntitlementManifests {
  public:
+  // EntitlementManifests reads `directory` only on reload(); until then no entry is in force.
   explicit EntitlementManifests(std::filesystem::path directory);
+  // directory is the manifest directory given, borrowed.
   const std::filesystem::path& directory() const { return directory_; }
 
   // reload reads the directory again (start-up and SIGHUP), logging every file it ignores, and

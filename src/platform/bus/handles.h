@@ -14,6 +14,7 @@ namespace platform {
 
 template <typename T, auto Release>
 struct HandleReleaser {
+  // Releases `p` with the library's own function for it.
   void operator()(T* p) const { Release(p); }
 };
 
@@ -37,6 +38,7 @@ struct BusErrorGuard {
 class UniqueFd {
  public:
   UniqueFd() = default;
+  // UniqueFd takes ownership of `fd` (-1 for none).
   explicit UniqueFd(int fd) : fd_(fd) {}
   UniqueFd(UniqueFd&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
   UniqueFd& operator=(UniqueFd&& other) noexcept {
@@ -45,6 +47,7 @@ class UniqueFd {
   }
   ~UniqueFd() { reset(); }
 
+  // get borrows the descriptor (-1 when none); the conversion is true when one is held.
   int get() const { return fd_; }
   explicit operator bool() const { return fd_ >= 0; }
   // Closes the descriptor held, if any, and holds `fd` instead.
@@ -52,6 +55,7 @@ class UniqueFd {
     if (fd_ >= 0) ::close(fd_);
     fd_ = fd;
   }
+  // release hands the descriptor (or -1) to the caller, who must close it; none is held after.
   int release() { return std::exchange(fd_, -1); }
 
  private:

@@ -45,11 +45,17 @@ struct ListenerOptions {
 
 class Listener {
  public:
+  // configure stores the options the next resume() serves with; it checks nothing (resume does).
   static void configure(ListenerOptions options);
+  // serviceListener is the process's one listener, made on first use and never destroyed.
   static Listener& serviceListener();
+  // blockSignals blocks SIGTERM, SIGINT and SIGHUP on the calling thread, and so on every thread it
+  // starts afterwards, so that only the event loop receives them.
   static void blockSignals();
 
+  // setDelegate installs the delegate asked about each new peer; the listener shares it.
   void setDelegate(std::shared_ptr<ListenerDelegate> delegate);
+  // delegate is the one installed, shared, or null.
   std::shared_ptr<ListenerDelegate> delegate() const;
 
   // Runs until shutdown; returns 0 after a clean stop, non-zero when the bus could not be used.
@@ -57,6 +63,8 @@ class Listener {
   // Starts the same drain as SIGTERM, from any thread.
   void stop();
 
+  // connectionCount counts the peers connected now, callsInFlight the calls taken on and not yet
+  // answered; both are 0 before resume().
   size_t connectionCount() const;
   size_t callsInFlight() const;
 

@@ -32,6 +32,7 @@ struct Reply::State {
 
 class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
  public:
+  // Core serves with `options` on behalf of `owner`, which must outlive it; nothing runs until run().
   Core(ListenerOptions options, Listener& owner)
       : options_(std::move(options)), peers_(owner, options_.entitlementsForPeer, options_.maxCallsPerPeer) {}
 
@@ -40,7 +41,9 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   // Runs `work` on the bus thread, from any thread. Returns false, with `work` dropped unrun, once
   // the loop has ended or when memory ran out.
   bool post(LoopMailbox::Work work) noexcept { return mailbox_.post(std::move(work)); }
+  // requestStop begins the drain on the bus thread, as SIGTERM does; nothing when the loop has ended.
   void requestStop();
+  // The peers connected and the calls taken on and not yet answered; safe from any thread.
   size_t connectionCount() const { return peers_.count(); }
   size_t callsInFlight() const { return ledger_.open(); }
 

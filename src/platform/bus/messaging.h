@@ -39,7 +39,11 @@ class Reply {
   using Writer = std::function<int(sd_bus_message* reply)>;
   struct State;
 
+  // Reply shares the call's state; the listener makes one per call taken on.
   explicit Reply(std::shared_ptr<State> state) : state_(std::move(state)) {}
+  // send answers the call with what `writer` appends, fail with `error`; after the first answer
+  // both do nothing. When the bus thread can no longer take the answer, the call is answered with
+  // org.freedesktop.DBus.Error.Failed once the last copy of the Reply goes.
   void send(Writer writer) const;
   void fail(BusError error) const;
 

@@ -25,6 +25,7 @@ struct ClassDescription {
   std::set<std::string, std::less<>> instanceMethods;
   std::set<std::string, std::less<>> classMethods;
 
+  // instancesRespondToSelector is true when `method` is one of the instance methods.
   bool instancesRespondToSelector(const std::string& method) const { return instanceMethods.count(method) != 0; }
 };
 

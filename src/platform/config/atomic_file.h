@@ -10,6 +10,8 @@
 
 namespace platform {
 
+// writeFileAtomically replaces the file at `path` with `contents`, with permissions `mode`. It
+// returns false, leaving the old file and no temporary behind, when any step fails.
 bool writeFileAtomically(const std::filesystem::path& path, std::string_view contents, mode_t mode = 0644);
 
 }  // namespace platform

@@ -40,15 +40,19 @@ struct Configuration {
   static constexpr char kDefaultPath[] = "/etc/zlka/zlkad.toml";
 };
 
-// nullopt with *error set ("<file>: <key>: <problem>") when the file cannot be used.
+// loadConfiguration reads and checks the file at `path`; it returns nullopt with *error set
+// ("<file>: <key>: <problem>") when the file cannot be used.
 std::optional<Configuration> loadConfiguration(const std::filesystem::path& path, std::string* error);
 
-// The configuration in force for this process (set once at start-up; tests set their own).
+// setCurrentConfiguration makes `configuration` the one in force for this process (set once at
+// start-up; tests set their own). Holders of the previous one keep it.
 void setCurrentConfiguration(Configuration configuration);
+// currentConfiguration is the configuration in force, shared and never null: the defaults (no
+// servers) until one is set.
 std::shared_ptr<const Configuration> currentConfiguration();
 
-// An absolute https URL with a host and no path, query or fragment; returns it without a trailing
-// slash, or nullopt.
+// normalizedBaseURL returns `url` without a trailing slash when it is an absolute https URL with a
+// host and no path, query or fragment, else nullopt.
 std::optional<std::string> normalizedBaseURL(const std::string& url);
 
 }  // namespace platform

@@ -15,13 +15,15 @@ struct DeviceFacts {
   std::optional<std::string> deviceClass;
 };
 
-// The file to read; takes effect if called before the first query.
+// setDeviceConfigPath names the file to read; it takes effect only before the first query.
 void setDeviceConfigPath(std::filesystem::path path);
-// Replaces the facts (tools and tests that run without a configuration file).
+// setDeviceFacts replaces the facts, read or not (tools and tests that run without a file).
 void setDeviceFacts(DeviceFacts facts);
 
-// nullopt for a fact this device does not know.
+// deviceAnswerBool answers "InternalBuild"; nullopt for any other fact.
 std::optional<bool> deviceAnswerBool(std::string_view fact);
+// deviceAnswerString answers "DeviceClass" (nullopt when the file names none); nullopt for any
+// other fact.
 std::optional<std::string> deviceAnswerString(std::string_view fact);
 
 }  // namespace platform

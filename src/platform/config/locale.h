@@ -10,7 +10,9 @@ namespace platform {
 
 class Locale {
  public:
+  // Locale names `identifier` as given: it is not checked against the available list.
   explicit Locale(std::string identifier) : identifier_(std::move(identifier)) {}
+  // The identifier as given, borrowed from the locale; description() copies it for log lines.
   const std::string& localeIdentifier() const { return identifier_; }
   std::string description() const { return identifier_; }
   friend bool operator==(const Locale&, const Locale&) = default;
@@ -19,7 +21,9 @@ class Locale {
   std::string identifier_;
 };
 
+// availableLocaleIdentifiers is ICU's list, read on first use; it lives as long as the process.
 const std::vector<std::string>& availableLocaleIdentifiers();
+// isAvailableLocaleIdentifier is true when `identifier` is exactly one of that list.
 bool isAvailableLocaleIdentifier(std::string_view identifier);
 
 }  // namespace platform

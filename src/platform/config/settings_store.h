@@ -20,21 +20,29 @@ namespace platform {
 
 class SettingsStore {
  public:
+  // SettingsStore reads and writes <directory>/<suiteName>.json; nothing is touched until used.
   SettingsStore(std::string suiteName, std::filesystem::path directory);
-  // The suite in the directory of the current configuration ([settings] suite_dir).
+  // openSuite makes the store of `suiteName` in the directory of the current configuration
+  // ([settings] suite_dir).
   static std::shared_ptr<SettingsStore> openSuite(std::string suiteName);
 
+  // The suite's name and its file, borrowed from the store.
   const std::string& suiteName() const { return suite_; }
   const std::filesystem::path& filePath() const { return path_; }
 
+  // objectForKey is the value under `key` in the file as it is now, or nullopt when there is none.
   std::optional<Value> objectForKey(std::string_view key);
-  // true, a non-zero number, or "YES", "true" or "1" in any letter case.
+  // boolForKey is true for true, a non-zero number, or "YES", "true" or "1" in any letter case.
   bool boolForKey(std::string_view key);
-  // Strings only; anything else is nullopt.
+  // stringForKey is the string under `key`; anything else, or nothing, is nullopt.
   std::optional<std::string> stringForKey(std::string_view key);
+  // dictionaryRepresentation is every setting in the file as it is now (empty when unreadable).
   Dictionary dictionaryRepresentation();
 
-  // Read-modify-write under a lock file, so that concurrent writers lose nothing.
+  // setObject stores `value` under `key` and removeObject removes the key (absent is success).
+  // Both read, modify and replace the file under a lock file, so that concurrent writers lose
+  // nothing, creating the directory if needed; they return false when the value cannot be written
+  // as JSON or the file cannot be locked or written, leaving the file as it was.
   bool setObject(std::string_view key, const Value& value);
   bool removeObject(std::string_view key);
 

@@ -40,19 +40,26 @@ class Queue {
   Queue& operator=(const Queue&) = delete;
   ~Queue();
 
+  // label is the name given at creation, borrowed from the queue (thread names, log lines).
   const std::string& label() const noexcept { return label_; }
+  // isSerial is true for a queue made by serial().
   bool isSerial() const noexcept { return serial_; }
 
-  // Each throws std::invalid_argument if `work` is empty.
+  // async submits `work` and returns at once; the queue keeps `work` until it has run. It throws
+  // std::invalid_argument if `work` is empty.
   void async(std::function<void()> work);
+  // sync submits `work` and returns once it has run; it throws std::invalid_argument if `work` is
+  // empty and aborts when called from this queue's own work.
   void sync(std::function<void()> work);
-  // On a serial queue these are async() and sync().
+  // barrierAsync is async() for a barrier item: on a concurrent queue it runs alone; on a serial
+  // queue it is async().
   void barrierAsync(std::function<void()> work);
+  // barrierSync is sync() for a barrier item; on a serial queue it is sync().
   void barrierSync(std::function<void()> work);
 
-  // Whether the calling thread is running work of this queue.
+  // isCurrent is true when the calling thread is running work of this queue.
   bool isCurrent() const noexcept { return current() == this; }
-  // The queue whose work the calling thread is running, or null.
+  // current is the queue whose work the calling thread is running, or null; not owned.
   static const Queue* current() noexcept;
 
  private:

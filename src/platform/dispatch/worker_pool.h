@@ -53,6 +53,7 @@ class WorkerPool {
   // setMaximum changes how many workers the pool may grow to (at least its minimum).
   void setMaximum(unsigned maximum);
 
+  // name is the name given at construction, borrowed from the pool.
   const std::string& name() const { return name_; }
   // threads counts the workers alive now.
   size_t threads() const;
@@ -62,14 +63,17 @@ class WorkerPool {
   // while `refuse` holds (tests).
   void refuseThreadStarts(bool refuse);
 
-  // The process-wide pools; never destroyed, since their workers may still be blocked at exit.
+  // shared is the pool of the daemon's own queues, made on first use; never destroyed, since its
+  // workers may still be blocked at exit.
   static WorkerPool& shared();
+  // connections is the pool of the peers' queues, made on first use and never destroyed likewise.
   static WorkerPool& connections();
 
   // What a blocked worker of a helping pool waits on: the pool calls wakeToHelp() (with the pool's
   // lock held, so it must take no lock but its own) when work waits that no worker can take.
   class HelpWaker {
    public:
+    // wakeToHelp wakes the blocked worker so that it calls Blocking::help(); it must not block.
     virtual void wakeToHelp() = 0;
 
    protected:
@@ -80,6 +84,8 @@ class WorkerPool {
   // a `waker`, a helping pool wakes it when there is work to help with.
   class Blocking {
    public:
+    // Blocking marks the thread blocked, and registers `waker` (borrowed for the object's life) with
+    // a helping pool; on a thread that is no pool's worker it does nothing.
     explicit Blocking(HelpWaker* waker = nullptr);
     ~Blocking();
     Blocking(const Blocking&) = delete;

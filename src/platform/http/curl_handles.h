@@ -9,14 +9,18 @@
 
 namespace platform {
 
-// libcurl's handle types are all `void` to C++, so each kind gets its own deleter.
+// libcurl's handle types are all `void` to C++, so each kind gets its own deleter. Each call
+// releases the object with libcurl's own function for it.
 struct CurlEasyCleanup {
+  // Releases an easy handle (curl_easy_cleanup).
   void operator()(CURL* easy) const { curl_easy_cleanup(easy); }
 };
 struct CurlMultiCleanup {
+  // Releases a multi handle (curl_multi_cleanup).
   void operator()(CURLM* multi) const { curl_multi_cleanup(multi); }
 };
 struct CurlSlistFree {
+  // Releases a header list and its copies of the lines (curl_slist_free_all).
   void operator()(curl_slist* list) const { curl_slist_free_all(list); }
 };
 

@@ -22,6 +22,8 @@ namespace platform {
 
 class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Engine> {
  public:
+  // Engine makes the session's callback queue, connection claims and multi handle; the event thread
+  // starts with prepare() or the first task.
   explicit Engine(HTTPSessionConfiguration configuration);
   // Stops the event thread; every task still running completes with HTTPErrorCancelled.
   ~Engine();
@@ -31,6 +33,7 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
 
   // claimConnection waits, as blocking work, for one of the session's connection claims.
   std::shared_ptr<ConnectionClaim> claimConnection();
+  // callbackQueue is the serial queue the completions run on, shared with the session.
   const std::shared_ptr<Queue>& callbackQueue() const { return callbackQueue_; }
 
   // submit hands a resumed task to the event thread; the task completes with an error when the

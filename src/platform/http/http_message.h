@@ -22,13 +22,19 @@ struct HTTPRequest {
   int cachePolicy = 0;            // the protocol's own caching rules (nothing is cached here)
 
   HTTPRequest() = default;
+  // HTTPRequest makes a GET of `url` with no headers, the given cache policy and time-out (seconds).
   HTTPRequest(std::string url, int cachePolicy, double timeoutInterval)
       : URL(std::move(url)), timeoutInterval(timeoutInterval), cachePolicy(cachePolicy) {}
 
-  void setValueForHTTPHeaderField(std::string value, std::string_view field);  // replaces an existing one
+  // setValueForHTTPHeaderField sets the header `field` to `value`, in the place of an existing one
+  // of that name, else at the end.
+  void setValueForHTTPHeaderField(std::string value, std::string_view field);
+  // valueForHTTPHeaderField is the value of the header `field`, or nullopt when it is not set.
   std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;
+  // allHTTPHeaderFields is a copy of the headers, name to value, names as they were set.
   Dictionary allHTTPHeaderFields() const;
-  std::string description() const;  // "<HTTPRequest: POST https://host/path>"
+  // description renders the request for logs: "<HTTPRequest: POST https://host/path>".
+  std::string description() const;
 };
 
 struct HTTPResponse {
@@ -36,11 +42,15 @@ struct HTTPResponse {
   long statusCode = 0;
   HTTPHeaderFields headerFields;  // as received, last value wins on lookup
 
+  // valueForHTTPHeaderField is the last value received for `field`, or nullopt when there is none.
   std::optional<std::string> valueForHTTPHeaderField(std::string_view field) const;
+  // allHeaderFields is a copy of the headers, name (as received) to its last value.
   Dictionary allHeaderFields() const;
-  std::string description() const;  // "<HTTPResponse: 200 https://host/path> {headers}"
+  // description renders the response for logs: "<HTTPResponse: 200 https://host/path> {headers}".
+  std::string description() const;
 };
 
+// headerNameEquals is true when `a` and `b` are the same header name, ignoring ASCII case.
 bool headerNameEquals(std::string_view a, std::string_view b);
 
 }  // namespace platform

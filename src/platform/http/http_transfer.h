@@ -20,6 +20,8 @@ namespace platform {
 
 class ConnectionClaim {
  public:
+  // ConnectionClaim holds one of the claims already taken from `claims` and gives it back, with a
+  // signal, when destroyed.
   explicit ConnectionClaim(std::shared_ptr<Semaphore> claims) : claims_(std::move(claims)) {}
   ConnectionClaim(const ConnectionClaim&) = delete;
   ConnectionClaim& operator=(const ConnectionClaim&) = delete;

@@ -29,9 +29,12 @@ namespace platform {
 
 enum class LogLevel { Debug = 0, Info = 1, Default = 2, Error = 3, Fault = 4 };
 
-std::string_view logLevelName(LogLevel level);  // "debug", "info", "default", "error", "fault"
+// logLevelName is the level's name: "debug", "info", "default", "error" or "fault".
+std::string_view logLevelName(LogLevel level);
+// logLevelFromName is the level of one of those names, exactly as written, else nullopt.
 std::optional<LogLevel> logLevelFromName(std::string_view name);
-int journalPriority(LogLevel level);  // fault 2, error 3, default 5, info 6, debug 7
+// journalPriority is the level's syslog priority: fault 2, error 3, default 5, info 6, debug 7.
+int journalPriority(LogLevel level);
 
 enum class LogBackend { Auto, Journal, Stderr };
 
@@ -46,7 +49,10 @@ struct LogSettings {
   LogBackend backend = LogBackend::Auto;  // Auto: the journal when stderr is connected to it
   std::string identifier = "zlkad";       // SYSLOG_IDENTIFIER and stderr prefix
 };
+// configureLog replaces the process's log settings; it takes effect for the next entry on every
+// thread and cannot fail.
 void configureLog(const LogSettings& settings);
+// currentLogSettings is a copy of the settings last given to configureLog (the defaults before).
 LogSettings currentLogSettings();
 // logGoesToJournal is true when entries go to the journal now (the backend, resolved).
 bool logGoesToJournal();
@@ -55,6 +61,7 @@ bool logGoesToJournal();
 // names the caller's file, line and function rather than the log back end's. (The builtins rather
 // than std::source_location, which the clang of Debian 12 cannot use with its libstdc++.)
 struct LogFormat {
+  // LogFormat borrows `text` (a literal, in practice) and records where the call is.
   template <class S>
   requires std::is_convertible_v<const S&, std::string_view> LogFormat(const S& text,
                                                                        const char* file = __builtin_FILE(),
@@ -79,23 +86,30 @@ struct LogEntry {
   std::string messageID;  // empty for most entries
 };
 
+// The subsystem of the default log's entries in the journal.
+inline constexpr char kDefaultSubsystem[] = "com.kestro.ZLKAuthentication";
 // journalFields gives the fields an entry is sent to the journal with, each "NAME=value":
 // MESSAGE, PRIORITY, SYSLOG_IDENTIFIER, ZLKA_SUBSYSTEM, ZLKA_CATEGORY, CODE_FILE, CODE_LINE,
 // CODE_FUNC and MESSAGE_ID when the entry has one. The default log's entries get the subsystem
 // kDefaultSubsystem and, as category, the module (source directory) of the call.
-inline constexpr char kDefaultSubsystem[] = "com.kestro.ZLKAuthentication";
 std::vector<std::string> journalFields(const LogEntry& entry, const std::string& identifier);
 using LogSink = std::function<void(const LogEntry&)>;
-void setLogSink(LogSink sink);  // an empty function restores the backend
+// setLogSink sends every later entry to `sink`, called on the writing thread, instead of the
+// backend; an empty function restores the backend.
+void setLogSink(LogSink sink);
 
 class Log {
  public:
-  static const Log& defaultLog();  // no subsystem, no category
-  // Null when a name is empty or holds control characters.
+  // defaultLog is the process's log without subsystem or category; it lives as long as the process.
+  static const Log& defaultLog();
+  // create makes a log for `subsystem` and `category`, or returns null when a name is empty or
+  // holds control characters.
   static std::shared_ptr<const Log> create(std::string subsystem, std::string category);
 
+  // The names given to create(), borrowed from this log; empty for the default log.
   const std::string& subsystem() const { return subsystem_; }
   const std::string& category() const { return category_; }
+  // enabled is true when entries of `level` are written now (at or above the configured minimum).
   static bool enabled(LogLevel level);
 
  private:
@@ -112,8 +126,11 @@ class LogArg {
   struct Nil {};
   using Storage = std::variant<int64_t, uint64_t, double, Pointer, std::string, Nil>;
 
+  // LogArg copies what the directive will print: the number, the text, the pointer's address, or
+  // the object's description(); an empty optional or null pointer-like object becomes Nil.
   template <class T>
   requires(!std::is_same_v<T, LogArg>) LogArg(const T& v) : v_(convert(v)) {}
+  // storage is the converted argument, borrowed from this LogArg.
   const Storage& storage() const { return v_; }
 
  private:
@@ -151,11 +168,16 @@ class LogArg {
   Storage v_;
 };
 
+// formatLogMessage expands the directives of `format` with `args` in order; it never fails: an
+// unknown directive stays as written, a missing argument prints "<missing>", and a private one
+// prints "<private>" unless `showPrivate`.
 std::string formatLogMessage(std::string_view format, std::span<const LogArg> args, bool showPrivate);
-// writeLog formats and writes one entry (when its level is enabled); `id` may be null.
+// writeLog formats and writes one entry (when its level is enabled) to the sink, else the journal,
+// else stderr when the journal refuses it; `id` may be null. It reports no failure.
 void writeLog(const Log& log, LogLevel level, const MessageID* id, const LogFormat& format,
               std::span<const LogArg> args);
 
+// log writes one entry on `target` when `level` is enabled; the arguments are converted only then.
 template <class... A>
 void log(const Log& target, LogLevel level, LogFormat format, const A&... args) {
   if (!Log::enabled(level)) return;
@@ -167,6 +189,7 @@ void log(const Log& target, LogLevel level, LogFormat format, const A&... args) 
   }
 }
 
+// log writes one entry on the default log.
 template <class... A>
 void log(LogLevel level, LogFormat format, const A&... args) {
   log(Log::defaultLog(), level, format, args...);

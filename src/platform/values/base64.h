@@ -11,7 +11,9 @@
 
 namespace platform {
 
+// base64Encode returns `bytes` in base64 with padding; the empty span gives "".
 std::string base64Encode(std::span<const uint8_t> bytes);
+// base64DecodeStrict returns the bytes `text` encodes, or nullopt when it is not strict base64.
 std::optional<Data> base64DecodeStrict(std::string_view text);
 
 }  // namespace platform

@@ -15,9 +15,11 @@ inline constexpr char LocalizedDescriptionKey[] = "LocalizedDescription";
 
 class Error {
  public:
+  // Error makes an error of `domain` and `code`; `userInfo` nullopt means none at all.
   Error(std::string domain, int64_t code, std::optional<Dictionary> userInfo = std::nullopt)
       : domain_(std::move(domain)), code_(code), userInfo_(std::move(userInfo)) {}
 
+  // The parts given at construction, borrowed from this error.
   const std::string& domain() const { return domain_; }
   int64_t code() const { return code_; }
   const std::optional<Dictionary>& userInfo() const { return userInfo_; }

@@ -16,12 +16,15 @@ namespace platform::json {
 
 inline constexpr int kMaxDepth = 256;
 
+// isValidJSONObject is true when `value` is valid for writing (above).
 bool isValidJSONObject(const Value& value);
 
-// nullopt (with a reason in *error) when the value is not valid for JSON.
+// serialize returns `value` as JSON text, compact unless `pretty`, or nullopt (with a reason in
+// *error when `error` is not null) when the value is not valid for writing.
 std::optional<std::string> serialize(const Value& value, bool pretty = false, std::string* error = nullptr);
 
-// nullopt (with the parser's message in *error) for anything but a well-formed object or array.
+// parse returns the value `text` holds, or nullopt (with the parser's message in *error when
+// `error` is not null) for anything but a well-formed object or array within kMaxDepth.
 std::optional<Value> parse(std::string_view text, std::string* error = nullptr);
 
 }  // namespace platform::json

@@ -10,8 +10,11 @@ namespace platform {
 
 class UUID {
  public:
-  UUID();  // a fresh random UUID
+  // UUID makes a fresh random one from OpenSSL's generator, or the kernel's should that fail.
+  UUID();
+  // bytes are the 16 bytes in network order, borrowed from this UUID.
   const std::array<uint8_t, 16>& bytes() const { return bytes_; }
+  // UUIDString is the canonical upper-case form, 36 characters with hyphens.
   std::string UUIDString() const;
   friend bool operator==(const UUID&, const UUID&) = default;
 

@@ -26,6 +26,7 @@ using Array = std::vector<Value>;
 using Dictionary = std::map<std::string, Value, std::less<>>;
 
 struct Null {
+  // Null equals only itself.
   friend bool operator==(Null, Null) { return true; }
 };
 
@@ -38,6 +39,9 @@ struct Opaque {
 class Value {
  public:
   Value() = default;  // null
+  // Each constructor makes a value of its argument's kind: integers widen to int64_t or uint64_t by
+  // signedness, strings, bytes and Opaque are copied or moved in, and an Array or Dictionary moves
+  // into storage that every copy of the value then shares. None fails.
   Value(Null) {}
   Value(bool b) : v_(b) {}
   template <std::signed_integral T>
@@ -53,16 +57,19 @@ class Value {
   Value(Dictionary d) : v_(std::make_shared<const Dictionary>(std::move(d))) {}
   Value(Opaque o) : v_(std::move(o)) {}
 
+  // Each is true when the value is of that kind; isNumber() is true for integers, reals and Booleans.
   bool isNull() const { return std::holds_alternative<Null>(v_); }
   bool isBool() const { return std::holds_alternative<bool>(v_); }
-  bool isNumber() const;  // integers, reals and Booleans
+  bool isNumber() const;
   bool isString() const { return std::holds_alternative<std::string>(v_); }
   bool isData() const { return std::holds_alternative<Data>(v_); }
   bool isArray() const { return std::holds_alternative<ArrayPtr>(v_); }
   bool isDictionary() const { return std::holds_alternative<DictionaryPtr>(v_); }
   bool isOpaque() const { return std::holds_alternative<Opaque>(v_); }
 
-  // Typed access: null when the value is of another kind.
+  // Typed access: a pointer into the value (valid while the value lives), or null when the value
+  // is of another kind. integer() answers only signed integers and unsignedInteger() only unsigned
+  // ones; neither answers Booleans or reals.
   const std::string* string() const { return std::get_if<std::string>(&v_); }
   const Data* data() const { return std::get_if<Data>(&v_); }
   const Array* array() const;
@@ -72,12 +79,15 @@ class Value {
   const uint64_t* unsignedInteger() const { return std::get_if<uint64_t>(&v_); }
   const Opaque* opaque() const { return std::get_if<Opaque>(&v_); }
 
-  std::optional<double> numberValue() const;  // for isNumber() values
-  bool boolValue() const;                     // a number other than 0; false for non-numbers
+  // numberValue is the value as a double when isNumber() (true is 1, false 0), else nullopt.
+  std::optional<double> numberValue() const;
+  // boolValue is true for true and for a number other than 0; false for everything else.
+  bool boolValue() const;
 
-  // Dictionary member, or null when this is not a dictionary or has no such key.
+  // find returns the dictionary member under `key` (borrowed from this value), or null when this
+  // is not a dictionary or has no such key.
   const Value* find(std::string_view key) const;
-  // Number of members of an array or dictionary; 0 for anything else.
+  // count is the number of members of an array or dictionary; 0 for anything else.
   size_t count() const;
 
   // Numbers compare by value across integer and real; Booleans equal only Booleans.

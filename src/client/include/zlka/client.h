@@ -57,9 +57,11 @@ struct Error {
 template <class T>
 class Result {
  public:
+  // A Result converts from the value on success and from the Error on failure.
   Result(T value) : v_(std::in_place_index<0>, std::move(value)) {}
   Result(Error error) : v_(std::in_place_index<1>, std::move(error)) {}
 
+  // ok, and the conversion to bool, are true on success.
   bool ok() const { return v_.index() == 0; }
   explicit operator bool() const { return ok(); }
   // value() only on success, error() only on failure (std::bad_variant_access otherwise).
