@@ -69,7 +69,6 @@ const CallRow kCalls[] = {
   {"SessionRefusedByThePrimitives", {}, {{"endpoint", "sapSession"}, {"session_info", "AAAA"}}, {}, ZLKAErrorInternal, kErr, kSigning},
   // Requests that cannot be built are never sent.
   {"TokenNotDER", {}, nullptr, {.token = Data::fromString("plain text")}, ZLKAErrorInvalidParameter, LogLevel::Info, "[#TokenAuth] tokenArray.count: 0"},
-  {"TokenNotDERStillLogsItsArray", {}, nullptr, {.token = Data::fromString("plain text")}, ZLKAErrorInvalidParameter, LogLevel::Debug, "[#TokenAuth] tokenArray: "},
   {"RequestInfoNotJSON", {}, nullptr, {.requestInfo = platform::Dictionary{{"ratio", NAN}}}, ZLKAErrorInternal, kErr, "[#TokenAuth] isValidJSONObject (requestDict) = NO!"},
   // Answers, properly signed, that the operation cannot take.
   {"QueryAnswerIsAnArray", {}, {{"body", R"(["PP-1","en_US",{}])"}}, {}, ZLKAErrorServer, kErr, kBadMetadata},
