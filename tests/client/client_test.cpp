@@ -264,19 +264,12 @@ TEST(ClientErrors, BusErrorsMapBackToDomainAndCode) {
             Error(kOperation, -6));  // the description is the error's own
   // Any other name stays in the client domain with its name and message: a refusal (4) or, where
   // nothing answered, the service unreachable (2).
-  const std::pair<std::string, int64_t> otherErrors[] = {{op + "Bogus", 4},
-                                                         {op, 4},
-                                                         {bus + "InvalidArgs", 4},
-                                                         {bus + "AccessDenied", 4},
-                                                         {bus + "ServiceUnknown", 2},
-                                                         {bus + "NameHasNoOwner", 2},
-                                                         {bus + "NoReply", 2},
-                                                         {bus + "Timeout", 2},
-                                                         {bus + "TimedOut", 2},
-                                                         {bus + "Disconnected", 2},
-                                                         {bus + "NoServer", 2},
-                                                         {bus + "NoNetwork", 2},
-                                                         {bus + "Spawn.ExecFailed", 2}};
+  // clang-format off
+  const std::pair<std::string, int64_t> otherErrors[] = {
+      {op + "Bogus", 4}, {op, 4}, {bus + "InvalidArgs", 4}, {bus + "AccessDenied", 4}, {bus + "ServiceUnknown", 2},
+      {bus + "NameHasNoOwner", 2}, {bus + "NoReply", 2}, {bus + "Timeout", 2}, {bus + "TimedOut", 2},
+      {bus + "Disconnected", 2}, {bus + "NoServer", 2}, {bus + "NoNetwork", 2}, {bus + "Spawn.ExecFailed", 2}};
+  // clang-format on
   for (const auto& [name, code] : otherErrors) {
     Error e = zlka_client::errorFromBusError(name, "m");
     EXPECT_THAT(shown(e),
@@ -306,16 +299,11 @@ TEST(ClientErrors, BusStringsAreWellFormedUTF8WithoutNUL) {
 
 TEST_F(ClientTest, CallsSendExactlyTheirArgumentsAndDecodeTheAnswer) {
   const uint64_t int64Max = std::numeric_limits<int64_t>::max();
-  const Dictionary info{{"flag", true},
-                        {"name", "x"},
-                        {"count", int64_t{-3}},
-                        {"small", uint64_t{5}},
-                        {"int64max", int64Max},
-                        {"above", int64Max + 1},
-                        {"ratio", 1.5},
-                        {"blob", Data::fromString("\x01\x02")},
-                        {"list", Array{Value(1), Value("a")}},
-                        {"nested", Dictionary{{"n", Array{}}}}};
+  // clang-format off
+  const Dictionary info{{"flag", true}, {"name", "x"}, {"count", int64_t{-3}}, {"small", uint64_t{5}}, {"int64max", int64Max},
+                        {"above", int64Max + 1}, {"ratio", 1.5}, {"blob", Data::fromString("\x01\x02")},
+                        {"list", Array{Value(1), Value("a")}}, {"nested", Dictionary{{"n", Array{}}}}};
+  // clang-format on
   std::string deepest = "s:\"leaf\"=<b:true>", tooDeep = "requestInfo";
   for (int i = 0; i < zlka_client::kMaxRequestInfoDepth; ++i) tooDeep += ".in";
   for (int i = 1; i < zlka_client::kMaxRequestInfoDepth; ++i) deepest = "s:\"in\"=<a{sv}[" + deepest + "]>";
