@@ -61,8 +61,6 @@ const CallRow kCalls[] = {
   {"ConnectionDropped", {}, {{"drop", true}, {"remaining", 1}}, {}, ZLKAErrorNetwork, LogLevel::Fault, kTask},
   // Optional white space around a header value is not part of it.
   {"SignatureHeaderPadded", {}, {{"signature", "padded"}}, {}, 0, kDef, ""},
-  // The log line keeps a hostile body whole; the stderr back end shows its control bytes escaped.
-  {"ErrorBodyWithControlBytes", {}, {{"status", 500}, {"body", "a\r\x1b[31mforged"}}, {}, ZLKAErrorServer, kErr, kStatus + "500!\nresponseData (string): a\r\x1b[31mforged"},
   // A session that cannot open: its transport and bad-answer codes keep their meaning, the rest is internal.
   {"SessionTransportFails", {}, {{"endpoint", "setup.crt"}, {"drop", true}}, {}, ZLKAErrorNetwork, kErr, kSigning},
   {"SessionAnswerBad", {}, {{"endpoint", "sapSession"}, {"status", 503}}, {}, ZLKAErrorServer, kErr, kSigning},
