@@ -264,19 +264,12 @@ TEST(ClientErrors, BusErrorsMapBackToDomainAndCode) {
             Error(kOperation, -6));  // the description is the error's own
   // Any other name stays in the client domain with its name and message: a refusal (4) or, where
   // nothing answered, the service unreachable (2).
-  const std::pair<std::string, int64_t> otherErrors[] = {{op + "Bogus", 4},
-                                                         {op, 4},
-                                                         {bus + "InvalidArgs", 4},
-                                                         {bus + "AccessDenied", 4},
-                                                         {bus + "ServiceUnknown", 2},
-                                                         {bus + "NameHasNoOwner", 2},
-                                                         {bus + "NoReply", 2},
-                                                         {bus + "Timeout", 2},
-                                                         {bus + "TimedOut", 2},
-                                                         {bus + "Disconnected", 2},
-                                                         {bus + "NoServer", 2},
-                                                         {bus + "NoNetwork", 2},
-                                                         {bus + "Spawn.ExecFailed", 2}};
+  // clang-format off
+  const std::pair<std::string, int64_t> otherErrors[] = {
+      {op + "Bogus", 4}, {op, 4}, {bus + "InvalidArgs", 4}, {bus + "AccessDenied", 4}, {bus + "ServiceUnknown", 2},
+      {bus + "NameHasNoOwner", 2}, {bus + "NoReply", 2}, {bus + "Timeout", 2}, {bus + "TimedOut", 2},
+      {bus + "Disconnected", 2}, {bus + "NoServer", 2}, {bus + "NoNetwork", 2}, {bus + "Spawn.ExecFailed", 2}};
+  // clang-format on
   for (const auto& [name, code] : otherErrors) {
     Error e = zlka_client::errorFromBusError(name, "m");
     EXPECT_THAT(shown(e),
@@ -306,16 +299,11 @@ TEST(ClientErrors, BusStringsAreWellFormedUTF8WithoutNUL) {
 
 TEST_F(ClientTest, CallsSendExactlyTheirArgumentsAndDecodeTheAnswer) {
   const uint64_t int64Max = std::numeric_limits<int64_t>::max();
-  const Dictionary info{{"flag", true},
-                        {"name", "x"},
-                        {"count", int64_t{-3}},
-                        {"small", uint64_t{5}},
-                        {"int64max", int64Max},
-                        {"above", int64Max + 1},
-                        {"ratio", 1.5},
-                        {"blob", Data::fromString("\x01\x02")},
-                        {"list", Array{Value(1), Value("a")}},
-                        {"nested", Dictionary{{"n", Array{}}}}};
+  // clang-format off
+  const Dictionary info{{"flag", true}, {"name", "x"}, {"count", int64_t{-3}}, {"small", uint64_t{5}}, {"int64max", int64Max},
+                        {"above", int64Max + 1}, {"ratio", 1.5}, {"blob", Data::fromString("\x01\x02")},
+                        {"list", Array{Value(1), Value("a")}}, {"nested", Dictionary{{"n", Array{}}}}};
+  // clang-format on
   std::string deepest = "s:\"leaf\"=<b:true>", tooDeep = "requestInfo";
   for (int i = 0; i < zlka_client::kMaxRequestInfoDepth; ++i) tooDeep += ".in";
   for (int i = 1; i < zlka_client::kMaxRequestInfoDepth; ++i) deepest = "s:\"in\"=<a{sv}[" + deepest + "]>";
@@ -408,15 +396,9 @@ TEST_F(ClientTest, CallsThatCanGetNoAnswerEndAsUnreachable) {
   EXPECT_THAT(shown(client->confirmActivation({})), HasSubstr("ZLKAClientErrorDomain 2: The call could not be sent"));
 }
 
-TEST(ClientConnect, ABusThatCannotBeReachedFailsTheConnection) {
-  PrivateBus empty;
-  auto client = ZLKAClient::connect({.bus = empty.address()});
-  ASSERT_TRUE(client.ok());  // the daemon is first looked for by a call
-  EXPECT_THAT(shown(client.value()->confirmActivation({})), HasSubstr("(org.freedesktop.DBus.Error.ServiceUnknown"));
-  auto missing = ZLKAClient::connect({.bus = "unix:path=/nonexistent/zlka"});
-  EXPECT_EQ(missing.ok() ? "connected" : shown(missing.error()),
-            "ZLKAClientErrorDomain 1: Cannot connect to the bus at \"unix:path=/nonexistent/zlka\": No such file or "
-            "directory.");
+// A bus address that cannot be reached is zlkactl's table's; a bus without the daemon, the
+// installed library's test.
+TEST(ClientConnect, NoSessionBusFailsTheConnection) {
   std::map<std::string, std::string> saved;  // the session bus is found through these
   for (const char* name : {"DBUS_SESSION_BUS_ADDRESS", "XDG_RUNTIME_DIR"})
     if (const char* value = std::getenv(name)) saved[name] = value, unsetenv(name);
@@ -490,7 +472,7 @@ TEST_F(ClientTest, ClosingTheClientCancelsWhatIsUnanswered) {
 }
 
 // The installed interface: its own types in and out, and a refusal answered on the client's
-// thread like any answer.
+// thread like any answer. Its blocking calls are what zlkactl's table goes through.
 TEST_F(ClientTest, ThePublicInterfaceSpeaksOnlyItsOwnTypes) {
   auto made = zlka::Client::connect({.bus = bus->address()});
   ASSERT_TRUE(made.ok());
@@ -511,18 +493,12 @@ TEST_F(ClientTest, ThePublicInterfaceSpeaksOnlyItsOwnTypes) {
             "ZLKAClientErrorDomain 3 : Cannot send the call: requestInfo is an array, not a JSON object.");
   EXPECT_NE(refusedOn, std::this_thread::get_id());
   EXPECT_EQ(activated.get_future().get(), "deadbeef");
-  auto metadata = c.requestMetadata({.requestInfoJSON = R"({"n":1})"});
-  EXPECT_EQ(metadata ? metadata.value().ppid + " " + metadata.value().metadataJSON : text(metadata.error()),
-            R"(ppid-1 {"plan":"basic","seats":2})");
   service->answerWith(EchoService::error("org.freedesktop.DBus.Error.AccessDenied", "No."));
   auto denied = c.confirmActivation({});
   EXPECT_EQ(denied ? "confirmed" : text(denied.error()),
             "ZLKAClientErrorDomain 4 org.freedesktop.DBus.Error.AccessDenied: The call was refused with "
             "org.freedesktop.DBus.Error.AccessDenied: No.");
-  EXPECT_EQ(
-      newCalls(),
-      "RequestActivationForToken a{sv}[s:\"token\"=<ay:01>]\n"
-      "RequestMetadataForToken a{sv}[s:\"requestInfo\"=<a{sv}[s:\"n\"=<x:1>]>]\nConfirmActivationForToken a{sv}[]");
+  EXPECT_EQ(newCalls(), "RequestActivationForToken a{sv}[s:\"token\"=<ay:01>]\nConfirmActivationForToken a{sv}[]");
 }
 
 // Parses and runs, as main() does.
@@ -568,10 +544,6 @@ TEST_F(ClientTest, ZlkactlSendsWhatItIsGivenAndExitsByTheKindOfFailure) {
       // Under --json every error is one JSON object on standard error, with the same exit status.
       {{"--bus", b, "--json", "confirm", "--token-hex", "01", "--uuid", "U"}, EchoService::error("com.kestro.ZLKAuthentication.Error.Network", "Gone."), 1,
        "", R"({"code":-5,"description":"Gone.","domain":"ZLKATokenManagerErrorDomain"})" "\n", confirmed},
-      {{"--bus", "unix:path=/nonexistent/zlka", "--json", "confirm", "--token-hex", "01", "--uuid", "U"}, nullptr, 3, "",
-       R"({"code":1,"description":"Cannot connect to the bus at \"unix:path=/nonexistent/zlka\": No such file or directory.","domain":"ZLKAClientErrorDomain"})" "\n", ""},
-      {{"--bus", b, "--json", "confirm", "--token-hex", "abc", "--uuid", "U"}, nullptr, 2, "",
-       R"({"code":2,"description":"--token-hex: an odd number of hex digits","domain":"zlkactl"})" "\n", ""},
       {{"--bus", b, "--json", "confirm", "--token-hex", "01"}, nullptr, 2, "", R"({"code":2,"description":"--uuid is required","domain":"zlkactl"})" "\n", ""},
       // What the daemon needs is required before anything is sent.
       {{"--bus", b, "activate", "--uuid", "U"}, nullptr, 2, "", "zlkactl: A token (--token-file, --token-hex or --token-base64) is required\n", ""},
@@ -587,8 +559,6 @@ TEST_F(ClientTest, ZlkactlSendsWhatItIsGivenAndExitsByTheKindOfFailure) {
        "zlkactl: --request-info: must be a JSON object, not an array\n", ""},
       {{"--bus", b, "metadata", "--token-hex", "01", "--uuid", "U", "--locale", "en_US", "--request-info", "{\"a\":"}, nullptr, 2, "",
        "zlkactl: --request-info: not valid JSON", ""},
-      {{"--bus", b, "metadata", "--token-hex", "01", "--uuid", "U", "--locale", "en_US", "--request-info", R"({"a":[null]})"}, nullptr, 2, "",
-       "zlkactl: --request-info: requestInfo.a[0] is null", ""},
       {{"--bus", b, "metadata", "--token-hex", "00", "--token-base64", "AA=="}, nullptr, 2, "", "zlkactl: ", ""},  // one token source
       {{"--bus", b, "activate", "--locale", "en_US"}, nullptr, 2, "", "zlkactl: ", ""},  // metadata only
       {{"--bus", "nowhere", "confirm"}, nullptr, 2, "", "zlkactl: ", ""},

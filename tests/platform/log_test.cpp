@@ -108,14 +108,9 @@ TEST(Log, JournalEntriesNameTheCallersPlaceTheirModuleAndTheirEvent) {
             (Fields{"MESSAGE=m", "PRIORITY=3", "SYSLOG_IDENTIFIER=zlkad", "ZLKA_SUBSYSTEM=com.kestro.ZLKAuthentication",
                     "ZLKA_CATEGORY=bus", "CODE_FILE=src/platform/bus/listener.cpp", "CODE_LINE=7", "CODE_FUNC=run"}));
   // A log object's own names win; the default log's category is the module of the call.
-  entry = {LogLevel::Fault,
-           "com.example.sub",
-           "cat",
-           "m",
-           "src/network/metadata_query.cpp",
-           1,
-           "f",
-           "6113ffeebbf84fa0b42d7f30bad01cc9"};
+  // clang-format off
+  entry = {LogLevel::Fault, "com.example.sub", "cat", "m", "src/network/metadata_query.cpp", 1, "f", "6113ffeebbf84fa0b42d7f30bad01cc9"};
+  // clang-format on
   EXPECT_THAT(platform::journalFields(entry, "zlkad"),
               testing::IsSupersetOf({"ZLKA_SUBSYSTEM=com.example.sub", "ZLKA_CATEGORY=cat",
                                      "MESSAGE_ID=6113ffeebbf84fa0b42d7f30bad01cc9"}));

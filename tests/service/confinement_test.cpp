@@ -55,18 +55,12 @@ TEST(CallerIdentity, TheConfinedDaemonAdmitsByTheRecordedUserWhateverTheCallerEx
   // /proc mounted the way the unit's ProtectProc, ProcSubset and ReadOnlyPaths ask, then the
   // unit's user and capabilities with no new privileges.
   const std::string ambient = setprivCapabilities("AmbientCapabilities");
-  std::vector<std::string> launcher = {
-      "/usr/bin/unshare",
-      "--mount",
-      "--propagation",
-      "private",
-      "--",
-      "/bin/sh",
-      "-c",
+  // clang-format off
+  std::vector<std::string> launcher = {"/usr/bin/unshare", "--mount", "--propagation", "private", "--", "/bin/sh", "-c",
       "mount -t proc -o hidepid=" + unitSetting("ProtectProc") + ",subset=" + unitSetting("ProcSubset") +
           " proc /proc && mount -o remount,bind," + (unitSetting("ReadOnlyPaths") == "/proc" ? "ro" : "rw") +
-          " /proc && exec \"$@\"",
-      "sh"};
+          " /proc && exec \"$@\"", "sh"};
+  // clang-format on
   for (const auto& argument : asUser(*daemonUser)) launcher.push_back(argument);
   launcher.insert(launcher.end(), {"--no-new-privs", "--inh-caps=" + ambient, "--ambient-caps=" + ambient,
                                    "--bounding-set=" + setprivCapabilities("CapabilityBoundingSet"), "--"});

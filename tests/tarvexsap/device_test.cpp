@@ -270,16 +270,11 @@ TEST_F(DeviceTest, HandlesAreLiveTokensNeverReused) {
 }
 
 TEST(StatusTest, NumbersAreStable) {
-  const char* const names[] = {"kTarvexSAPOK",
-                               "kTarvexSAPErrorBadArgument",
-                               "kTarvexSAPErrorWrongState",
-                               "kTarvexSAPErrorUnknownHandle",
-                               "kTarvexSAPErrorCertificateRejected",
-                               "kTarvexSAPErrorMalformedMessage",
-                               "kTarvexSAPErrorSignatureInvalid",
-                               "kTarvexSAPErrorCryptoFailure",
-                               "kTarvexSAPErrorNotConfigured",
-                               "unknown"};
+  // clang-format off
+  const char* const names[] = {"kTarvexSAPOK", "kTarvexSAPErrorBadArgument", "kTarvexSAPErrorWrongState",
+      "kTarvexSAPErrorUnknownHandle", "kTarvexSAPErrorCertificateRejected", "kTarvexSAPErrorMalformedMessage",
+      "kTarvexSAPErrorSignatureInvalid", "kTarvexSAPErrorCryptoFailure", "kTarvexSAPErrorNotConfigured", "unknown"};
+  // clang-format on
   for (int32_t n = 0; n < 10; ++n) EXPECT_STREQ(TarvexSAPStatusName(-n), names[n]);
 }
 
