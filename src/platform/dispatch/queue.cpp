@@ -7,7 +7,6 @@
 #include <deque>
 #include <exception>
 #include <mutex>
-#include <stdexcept>
 #include <utility>
 
 #include "platform/dispatch/semaphore.h"
@@ -266,7 +265,7 @@ std::shared_ptr<Queue> Queue::serial(std::string label, WorkerPool* pool) {
 }
 
 std::shared_ptr<Queue> Queue::concurrent(std::string label, unsigned width, WorkerPool* pool) {
-  if (width == 0) throw std::invalid_argument("Queue::concurrent: width must be at least 1");
+  if (width == 0) misuse(label, "concurrent", " with width 0 could never run its work");
   return std::shared_ptr<Queue>(new Queue(std::move(label), false, width, pool ? *pool : WorkerPool::shared()),
                                 &Queue::release);
 }
@@ -303,12 +302,12 @@ void Queue::sync(std::function<void()> work) { submitAndWait(std::move(work), fa
 void Queue::barrierSync(std::function<void()> work) { submitAndWait(std::move(work), !serial_, "barrierSync"); }
 
 void Queue::submit(std::function<void()> work, bool barrier) {
-  if (!work) throw std::invalid_argument("Queue: empty work item");
+  if (!work) misuse(label_, "empty work item submitted");
   engine_->submit(std::move(work), barrier);
 }
 
 void Queue::submitAndWait(std::function<void()> work, bool barrier, const char* operation) {
-  if (!work) throw std::invalid_argument("Queue: empty work item");
+  if (!work) misuse(label_, "empty work item submitted to ", operation);
   if (isCurrent()) {
     // Even on a concurrent queue: the item would queue behind any barrier that waits for us.
     misuse(label_, operation, " called from this queue's own work would wait for itself");

@@ -33,7 +33,7 @@ class Queue {
  public:
   // serial makes a serial queue whose work runs on `pool` (WorkerPool::shared() when null).
   static std::shared_ptr<Queue> serial(std::string label, WorkerPool* pool = nullptr);
-  // concurrent makes a concurrent queue of `width`; it throws std::invalid_argument if `width` is 0.
+  // concurrent makes a concurrent queue of `width`; it aborts if `width` is 0 (a programming error).
   static std::shared_ptr<Queue> concurrent(std::string label, unsigned width = 4, WorkerPool* pool = nullptr);
 
   Queue(const Queue&) = delete;
@@ -45,11 +45,11 @@ class Queue {
   // isSerial is true for a queue made by serial().
   bool isSerial() const noexcept { return serial_; }
 
-  // async submits `work` and returns at once; the queue keeps `work` until it has run. It throws
-  // std::invalid_argument if `work` is empty.
+  // async submits `work` and returns at once; the queue keeps `work` until it has run. It aborts
+  // if `work` is empty (a programming error).
   void async(std::function<void()> work);
-  // sync submits `work` and returns once it has run; it throws std::invalid_argument if `work` is
-  // empty and aborts when called from this queue's own work.
+  // sync submits `work` and returns once it has run; it aborts if `work` is empty or when called
+  // from this queue's own work.
   void sync(std::function<void()> work);
   // barrierAsync is async() for a barrier item: on a concurrent queue it runs alone; on a serial
   // queue it is async().

@@ -1,7 +1,8 @@
 #include "platform/dispatch/semaphore.h"
 
+#include <cstdio>
+#include <cstdlib>
 #include <limits>
-#include <stdexcept>
 #include <thread>
 
 #include "platform/dispatch/worker_pool.h"
@@ -9,7 +10,10 @@
 namespace platform {
 
 Semaphore::Semaphore(long value) : count_(value) {
-  if (value < 0) throw std::invalid_argument("Semaphore: negative initial value");
+  if (value < 0) {
+    std::fprintf(stderr, "zlkad: semaphore made with a negative count (%ld)\n", value);
+    std::abort();
+  }
 }
 
 Semaphore::~Semaphore() {

@@ -22,7 +22,7 @@ namespace platform {
 
 class Semaphore final : private WorkerPool::HelpWaker {
  public:
-  // Throws std::invalid_argument if `value` is negative.
+  // Aborts if `value` is negative (a programming error).
   explicit Semaphore(long value = 0);
   Semaphore(const Semaphore&) = delete;
   Semaphore& operator=(const Semaphore&) = delete;
