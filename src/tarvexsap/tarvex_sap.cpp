@@ -24,6 +24,21 @@ uint8_t* handOver(const std::array<uint8_t, N>& bytes) {
   return buffer;
 }
 
+// Runs `call` on the live context behind `handle`, under its lock; a handle that is not registered,
+// or whose context a teardown got to first, is unknown.
+template <class Call>
+int32_t withLiveContext(QVSAPContextOpaque_* handle, Call call) {
+  const auto ctx = tsap::findContext(handle);
+  if (!ctx) {
+    return kTarvexSAPErrorUnknownHandle;
+  }
+  std::lock_guard lock(ctx->mutex);
+  if (ctx->state() == DeviceContext::State::tornDown) {
+    return kTarvexSAPErrorUnknownHandle;
+  }
+  return call(*ctx);
+}
+
 }  // namespace
 
 const char* TarvexSAPStatusName(int32_t status) {
@@ -90,31 +105,25 @@ int32_t TarvexSAPExchange(int32_t selector, TarvexHWInfo_* hwInfo, QVSAPContextO
       returnCode == nullptr) {
     return kTarvexSAPErrorBadArgument;
   }
-  const auto ctx = tsap::findContext(context);
-  if (!ctx) {
-    return kTarvexSAPErrorUnknownHandle;
-  }
-  std::lock_guard lock(ctx->mutex);
-  if (ctx->state() == DeviceContext::State::tornDown) {
-    return kTarvexSAPErrorUnknownHandle;  // lost a race with a teardown of this handle
-  }
-  tsap::RequestBytes request{};
-  bool produced = false;
-  uint8_t code = 0;
-  const int32_t status = ctx->exchange(*hwInfo, tsap::bytesOf(in, inLen), request, produced, code);
-  if (status != kTarvexSAPOK) {
-    return status;
-  }
-  if (produced) {
-    uint8_t* buffer = handOver(request);
-    if (buffer == nullptr) {
-      return kTarvexSAPErrorCryptoFailure;
+  return withLiveContext(context, [&](DeviceContext& ctx) {
+    tsap::RequestBytes request{};
+    bool produced = false;
+    uint8_t code = 0;
+    const int32_t status = ctx.exchange(*hwInfo, tsap::bytesOf(in, inLen), request, produced, code);
+    if (status != kTarvexSAPOK) {
+      return status;
     }
-    *out = buffer;
-    *outLen = static_cast<uint32_t>(request.size());
-  }
-  *returnCode = code;
-  return kTarvexSAPOK;
+    if (produced) {
+      uint8_t* buffer = handOver(request);
+      if (buffer == nullptr) {
+        return kTarvexSAPErrorCryptoFailure;
+      }
+      *out = buffer;
+      *outLen = static_cast<uint32_t>(request.size());
+    }
+    *returnCode = code;
+    return kTarvexSAPOK;
+  });
 }
 
 int32_t TarvexSAPSign(QVSAPContextOpaque_* context, const uint8_t* data, size_t len, uint8_t** signature,
@@ -122,26 +131,20 @@ int32_t TarvexSAPSign(QVSAPContextOpaque_* context, const uint8_t* data, size_t 
   if (context == nullptr || (data == nullptr && len != 0) || signature == nullptr || signatureLen == nullptr) {
     return kTarvexSAPErrorBadArgument;
   }
-  const auto ctx = tsap::findContext(context);
-  if (!ctx) {
-    return kTarvexSAPErrorUnknownHandle;
-  }
-  std::lock_guard lock(ctx->mutex);
-  if (ctx->state() == DeviceContext::State::tornDown) {
-    return kTarvexSAPErrorUnknownHandle;
-  }
-  tsap::SignatureBytes bytes{};
-  const int32_t status = ctx->sign(tsap::bytesOf(data, len), bytes);
-  if (status != kTarvexSAPOK) {
-    return status;
-  }
-  uint8_t* buffer = handOver(bytes);
-  if (buffer == nullptr) {
-    return kTarvexSAPErrorCryptoFailure;
-  }
-  *signature = buffer;
-  *signatureLen = static_cast<uint32_t>(bytes.size());
-  return kTarvexSAPOK;
+  return withLiveContext(context, [&](DeviceContext& ctx) {
+    tsap::SignatureBytes bytes{};
+    const int32_t status = ctx.sign(tsap::bytesOf(data, len), bytes);
+    if (status != kTarvexSAPOK) {
+      return status;
+    }
+    uint8_t* buffer = handOver(bytes);
+    if (buffer == nullptr) {
+      return kTarvexSAPErrorCryptoFailure;
+    }
+    *signature = buffer;
+    *signatureLen = static_cast<uint32_t>(bytes.size());
+    return kTarvexSAPOK;
+  });
 }
 
 int32_t TarvexSAPVerify(QVSAPContextOpaque_* context, const uint8_t* signature, size_t signatureLen, uint8_t* data,
@@ -149,15 +152,9 @@ int32_t TarvexSAPVerify(QVSAPContextOpaque_* context, const uint8_t* signature, 
   if (context == nullptr || (signature == nullptr && signatureLen != 0) || (data == nullptr && len != 0)) {
     return kTarvexSAPErrorBadArgument;
   }
-  const auto ctx = tsap::findContext(context);
-  if (!ctx) {
-    return kTarvexSAPErrorUnknownHandle;
-  }
-  std::lock_guard lock(ctx->mutex);
-  if (ctx->state() == DeviceContext::State::tornDown) {
-    return kTarvexSAPErrorUnknownHandle;
-  }
-  return ctx->verify(tsap::bytesOf(signature, signatureLen), tsap::bytesOf(data, len));
+  return withLiveContext(context, [&](DeviceContext& ctx) {
+    return ctx.verify(tsap::bytesOf(signature, signatureLen), tsap::bytesOf(data, len));
+  });
 }
 
 int32_t TarvexSAPTeardown(QVSAPContextOpaque_* context) {

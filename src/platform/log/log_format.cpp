@@ -53,9 +53,9 @@ void appendNumber(std::string& out, const char* directive, const LogArg::Storage
       out += "(null)";
       return;
     }
-    std::string spec = base + "ll" + conv;
-    n = conv == 'd' || conv == 'i' ? std::snprintf(buf, sizeof buf, spec.c_str(), static_cast<long long>(*bits))
-                                   : std::snprintf(buf, sizeof buf, spec.c_str(), *bits);
+    std::string pattern = base + "ll" + conv;
+    n = conv == 'd' || conv == 'i' ? std::snprintf(buf, sizeof buf, pattern.c_str(), static_cast<long long>(*bits))
+                                   : std::snprintf(buf, sizeof buf, pattern.c_str(), *bits);
   }
   if (n > 0) out.append(buf, std::min<size_t>(static_cast<size_t>(n), sizeof buf - 1));
 }
@@ -118,7 +118,7 @@ struct Directive {
   size_t end = 0;
   char conv = 0;  // 0: copy `literal`
   std::string_view literal;
-  std::string spec;  // "%", flags, width, precision, length modifiers and the conversion
+  std::string pattern;  // "%", flags, width, precision, length modifiers and the conversion
   bool isPrivate = false;
 };
 
@@ -141,17 +141,17 @@ Directive readDirective(std::string_view format, size_t start) {
     d.isPrivate = annotation.find("private") != std::string_view::npos;
     i = close + 1;
   }
-  d.spec = "%";
+  d.pattern = "%";
   while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos)
-    d.spec += format[i++];
+    d.pattern += format[i++];
   while (i < format.size() && std::string_view("hljztL").find(format[i]) != std::string_view::npos)
-    d.spec += format[i++];
+    d.pattern += format[i++];
   if (i >= format.size()) return copied(format.size(), format.substr(start));
   if (std::string_view("@sdiuxXocfFeEgGp").find(format[i]) == std::string_view::npos)
     return copied(i + 1, format.substr(start, i - start + 1));
   d.end = i + 1;
   d.conv = format[i];
-  d.spec += d.conv;
+  d.pattern += d.conv;
   return d;
 }
 
@@ -168,7 +168,7 @@ void appendArgument(std::string& out, const Directive& directive, const LogArg::
       appendPointer(out, arg);
       break;
     default:
-      appendNumber(out, directive.spec.c_str(), arg);
+      appendNumber(out, directive.pattern.c_str(), arg);
       break;
   }
 }
