@@ -28,9 +28,8 @@ BenchWorld::BenchWorld() {
   server_ = std::make_unique<devserver::DevServer>(options);
   if (auto error = server_->start()) throw std::runtime_error("zlka-devserver did not start: " + *error);
 
-  std::string error;
-  auto configuration = platform::loadConfiguration(stateDir_ / "zlkad.toml", &error);
-  if (!configuration) throw std::runtime_error(error);
+  auto configuration = platform::loadConfiguration(stateDir_ / "zlkad.toml");
+  if (!configuration) throw std::runtime_error(configuration.error());
   platform::setCurrentConfiguration(*configuration);
   platform::setDeviceFacts(configuration->device);
 

@@ -32,10 +32,9 @@ zlka_client::TokenArguments toInternal(const TokenArguments& arguments) {
 zlka_client::Result<zlka_client::MetadataArguments> toInternal(const MetadataArguments& arguments) {
   zlka_client::MetadataArguments out{toData(arguments.token), arguments.uuid, arguments.requestedLocale, std::nullopt};
   if (!arguments.requestInfoJSON) return out;
-  std::string problem;
-  std::optional<platform::Value> info = platform::json::parse(*arguments.requestInfoJSON, &problem);
+  platform::Result<platform::Value> info = platform::json::parse(*arguments.requestInfoJSON);
   if (!info || !info->dictionary()) {
-    std::string reason = info ? "an array" : "not JSON (" + problem + ")";
+    std::string reason = info ? "an array" : "not JSON (" + info.error() + ")";
     return zlka_client::clientError(ClientErrorCode::InvalidRequest,
                                     "Cannot send the call: requestInfo is " + reason + ", not a JSON object.");
   }

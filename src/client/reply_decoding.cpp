@@ -29,9 +29,8 @@ Result<MetadataReply> decodeMetadataReply(sd_bus_message* reply) {
   const char* locale = nullptr;
   const char* json = nullptr;
   if (sd_bus_message_read(reply, "sss", &ppid, &locale, &json) < 0) return malformed("its arguments cannot be read");
-  std::string problem;
-  std::optional<platform::Value> metadata = platform::json::parse(json ? json : "", &problem);
-  if (!metadata) return malformed("the metadata is not JSON (" + problem + ")");
+  platform::Result<platform::Value> metadata = platform::json::parse(json ? json : "");
+  if (!metadata) return malformed("the metadata is not JSON (" + metadata.error() + ")");
   return MetadataReply{ppid ? ppid : "", locale ? locale : "", std::move(*metadata)};
 }
 

@@ -51,14 +51,13 @@ std::optional<AnswerFault> checkAnswer(const Answer& answer, const AnswerRules& 
 }
 
 std::optional<platform::Value> parseAnswer(const platform::Data& body) {
-  std::string parseError;
-  std::optional<platform::Value> parsed = platform::json::parse(body.view(), &parseError);
+  platform::Result<platform::Value> parsed = platform::json::parse(body.view());
   if (!parsed) {
-    platform::log(LogLevel::Error, "[#TokenAuth] responseJSONError: %@", parseError);
+    platform::log(LogLevel::Error, "[#TokenAuth] responseJSONError: %@", parsed.error());
     return std::nullopt;
   }
-  platform::log(LogLevel::Debug, "[#TokenAuth] responseDict: %{private}@", parsed);
-  return parsed;
+  platform::log(LogLevel::Debug, "[#TokenAuth] responseDict: %{private}@", *parsed);
+  return std::move(parsed).value();
 }
 
 }  // namespace answer_check

@@ -25,10 +25,9 @@ std::optional<Data> serializeBody(const Value& requestDict) {
     platform::log(LogLevel::Error, "[#TokenAuth] isValidJSONObject (requestDict) = NO!");
     return std::nullopt;
   }
-  std::string jsonError;
-  std::optional<std::string> text = platform::json::serialize(requestDict, false, &jsonError);
+  platform::Result<std::string> text = platform::json::serialize(requestDict);
   if (!text) {
-    platform::log(LogLevel::Error, "[#TokenAuth] requestJSONError: %@", jsonError);
+    platform::log(LogLevel::Error, "[#TokenAuth] requestJSONError: %@", text.error());
     return std::nullopt;
   }
   Data body = Data::fromString(*text);

@@ -73,10 +73,9 @@ std::optional<int> setUpDaemon(int argc, char** argv) {
   configureLogFromCommandLine(cl);
 
   // Fatal problems go out at error priority through the log, where `journalctl -p err` finds them.
-  std::string error;
-  std::optional<platform::Configuration> config = platform::loadConfiguration(cl.config, &error);
+  platform::Result<platform::Configuration> config = platform::loadConfiguration(cl.config);
   if (!config) {
-    platform::log(LogLevel::Error, "%s", error);
+    platform::log(LogLevel::Error, "%s", config.error());
     return kExitConfiguration;
   }
   platform::LogSettings log = platform::currentLogSettings();

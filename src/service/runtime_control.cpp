@@ -236,10 +236,9 @@ std::optional<BusError> RuntimeControl::setLogTarget(sd_bus_message* value) {
 
 void RuntimeControl::reload() {
   if (options_.notify) notifyWithoutWaiting("RELOADING=1\nMONOTONIC_USEC=" + std::to_string(monotonicUsec()));
-  std::string error;
-  std::optional<platform::Configuration> config = platform::loadConfiguration(options_.configPath, &error);
+  platform::Result<platform::Configuration> config = platform::loadConfiguration(options_.configPath);
   if (!config) {
-    platform::log(LogLevel::Error, "Keeping the running log settings: %s", error);
+    platform::log(LogLevel::Error, "Keeping the running log settings: %s", config.error());
   } else {
     platform::LogSettings settings = platform::currentLogSettings();
     LogLevel before = settings.minimum;

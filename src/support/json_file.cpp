@@ -13,12 +13,14 @@ std::optional<platform::Value> readJSONFile(const std::optional<std::filesystem:
   std::stringstream buffer;
   buffer << in.rdbuf();
   if (in.bad()) return std::nullopt;
-  return platform::json::parse(buffer.str());
+  platform::Result<platform::Value> parsed = platform::json::parse(buffer.str());
+  if (!parsed) return std::nullopt;
+  return std::move(parsed).value();
 }
 
 bool writeJSONFile(const std::optional<platform::Value>& object, const std::optional<std::filesystem::path>& path) {
   if (!path) return false;
-  std::optional<std::string> text =
+  platform::Result<std::string> text =
       platform::json::serialize(object ? *object : platform::Value(platform::Dictionary{}), true);
   if (!text) return false;
   return platform::writeFileAtomically(*path, *text);

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cmath>
 #include <cstdio>
+#include <memory>
 #include <mutex>
 
 #include "platform/config/device_facts.h"
@@ -35,12 +36,12 @@ uint64_t systemInfo_getCurrentUnixTimeMS() { return systemInfo_detail::roundedUn
 
 // Reads /proc/self/status; the footprint is anonymous resident memory plus swapped-out memory.
 bool getMemoryUse(uint64_t* residentSize, uint64_t* virtualSize, uint64_t* footprint) {
-  std::FILE* f = std::fopen("/proc/self/status", "re");
-  if (!f) return false;
+  std::unique_ptr<std::FILE, int (*)(std::FILE*)> file(std::fopen("/proc/self/status", "re"), &std::fclose);
+  if (!file) return false;
   uint64_t resident = 0, size = 0, anonymous = 0;
   unsigned seen = 0;
   char line[256];
-  while (std::fgets(line, sizeof line, f)) {
+  while (std::fgets(line, sizeof line, file.get())) {
     unsigned long long kb = 0;
     if (std::sscanf(line, "VmRSS: %llu kB", &kb) == 1) {
       resident = kb * 1024;
@@ -52,7 +53,6 @@ bool getMemoryUse(uint64_t* residentSize, uint64_t* virtualSize, uint64_t* footp
       anonymous += kb * 1024;
     }
   }
-  std::fclose(f);
   if ((seen & 3) != 3) return false;
   if (residentSize) *residentSize = resident;
   if (virtualSize) *virtualSize = size;

@@ -71,9 +71,8 @@ void ServerWorld::SetUp() {
   server_ = std::make_unique<devserver::DevServer>(options);
   if (auto error = server_->start()) FAIL() << "zlka-devserver did not start: " << *error;
 
-  std::string error;
-  std::optional<platform::Configuration> loaded = platform::loadConfiguration(options.stateDir / "zlkad.toml", &error);
-  ASSERT_TRUE(loaded) << error;
+  platform::Result<platform::Configuration> loaded = platform::loadConfiguration(options.stateDir / "zlkad.toml");
+  ASSERT_TRUE(loaded) << loaded.error();
   configuration_ = std::move(*loaded);
   configuration_.device.internalBuild = internalBuild_;
   platform::setCurrentConfiguration(configuration_);

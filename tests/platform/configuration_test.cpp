@@ -21,17 +21,16 @@ const fs::path kFile = fs::temp_directory_path() / ("zlkad-" + std::to_string(ge
 std::string replaced(std::string text, const std::string& from, const std::string& to) {
   return text.replace(text.find(from), from.size(), to);
 }
-std::optional<platform::Configuration> load(const std::string& text, std::string* error) {
+platform::Result<platform::Configuration> load(const std::string& text) {
   std::ofstream(kFile) << text;
-  auto c = platform::loadConfiguration(kFile, error);
+  auto c = platform::loadConfiguration(kFile);
   fs::remove(kFile);
   return c;
 }
 
 TEST(Configuration, MinimalFileGetsTheDefaultsAndAFullOneWarnsOfUnknownKeys) {
-  std::string error;
-  auto c = load(kMinimal, &error);
-  ASSERT_TRUE(c) << error;
+  auto c = load(kMinimal);
+  ASSERT_TRUE(c) << c.error();
   EXPECT_EQ(std::tie(c->device.internalBuild, c->device.deviceClass), std::tuple(true, "AccessoryHub"));
   EXPECT_EQ(std::tuple(c->servers.size(), c->servers.at("prod").staticContent, c->servers.at("prod").api),
             std::tuple(1u, "https://static.example.net", "https://api.example.net:8443"));  // trailing slash dropped
@@ -41,17 +40,16 @@ TEST(Configuration, MinimalFileGetsTheDefaultsAndAFullOneWarnsOfUnknownKeys) {
             std::tuple(platform::LogLevel::Default, false, 64u, 0u));
 
   c = load(kMinimal +
-               "[servers.ut]\nstatic_content = \"https://s\"\napi = \"https://a\"\n[tls]\nca_file = \"/ca.pem\"\n"
-               "[settings]\nsuite_dir = \"/d\"\n[entitlements]\ndir = \"/e\"\n[log]\nlevel = \"debug\"\n"
-               "private_data = true\ncolour = \"blue\"\n[service]\nmax_workers = 2\n[extra]\nx = 1\n",
-           &error);
-  ASSERT_TRUE(c) << error;
+           "[servers.ut]\nstatic_content = \"https://s\"\napi = \"https://a\"\n[tls]\nca_file = \"/ca.pem\"\n"
+           "[settings]\nsuite_dir = \"/d\"\n[entitlements]\ndir = \"/e\"\n[log]\nlevel = \"debug\"\n"
+           "private_data = true\ncolour = \"blue\"\n[service]\nmax_workers = 2\n[extra]\nx = 1\n");
+  ASSERT_TRUE(c) << c.error();
   EXPECT_EQ(c->servers.at("ut").api, "https://a");
   EXPECT_EQ(std::tie(c->caFile, c->settingsDirectory, c->entitlementsDirectory), std::tuple("/ca.pem", "/d", "/e"));
   EXPECT_EQ(std::tie(c->logLevel, c->privateData, c->maxWorkers), std::tuple(platform::LogLevel::Debug, true, 2u));
   EXPECT_EQ(c->warnings, (std::vector<std::string>{kFile.string() + ": unknown key 'extra' ignored",
                                                    kFile.string() + ": unknown key 'log.colour' ignored"}));
-  EXPECT_EQ(load(kMinimal + "[service]\nmax_workers = 4096\n", &error)->maxWorkers, 4096u);
+  EXPECT_EQ(load(kMinimal + "[service]\nmax_workers = 4096\n")->maxWorkers, 4096u);
 }
 
 TEST(Configuration, EveryProblemNamesTheFileAndTheKey) {
@@ -79,14 +77,13 @@ TEST(Configuration, EveryProblemNamesTheFileAndTheKey) {
   };
   // clang-format on
   for (const auto& [text, message] : rows) {
-    std::string error;
-    EXPECT_FALSE(load(text, &error)) << message;
+    auto c = load(text);
+    ASSERT_FALSE(c) << message;
     std::string expected = kFile.string() + (message[0] == ':' ? message : ": " + message);
-    EXPECT_EQ(error.substr(0, expected.size()), expected);
+    EXPECT_EQ(c.error().substr(0, expected.size()), expected);
   }
-  std::string error;
-  EXPECT_FALSE(platform::loadConfiguration(kFile.parent_path(), &error));
-  EXPECT_EQ(error, kFile.parent_path().string() + ": cannot read the configuration file: is not a regular file");
+  EXPECT_EQ(platform::loadConfiguration(kFile.parent_path()).error(),
+            kFile.parent_path().string() + ": cannot read the configuration file: is not a regular file");
 }
 
 TEST(Configuration, BaseURLsAreAbsoluteHttpsWithoutPathQueryOrUser) {

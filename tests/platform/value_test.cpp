@@ -87,8 +87,7 @@ TEST(Json, OnlyArraysAndObjectsOfJSONKindsAreWrittenAndTheRoundTripKeepsTheKinds
   };
   // clang-format on
   for (const auto& [v, valid] : rows) EXPECT_EQ(platform::json::isValidJSONObject(v), valid) << v.description();
-  std::string error;
-  EXPECT_EQ(platform::json::serialize(Value(1), false, &error).value_or(error), "Invalid type in JSON write");
+  EXPECT_EQ(platform::json::serialize(Value(1)).error(), "Invalid type in JSON write");
   Value v(
       Dictionary{{"b", true}, {"i", -3}, {"u", kU64Max}, {"d", 0.25}, {"n", Value()}, {"s", "é"}, {"a", Array{false}}});
   auto text = platform::json::serialize(v);
@@ -114,9 +113,8 @@ TEST(Json, ParsingIsStrictAndBoundsTheNesting) {
       {"[\"\\\"" + std::string(1000, '[') + "\"]", true},  // nor after an escaped quote
   };
   // clang-format on
-  for (const auto& [text, ok] : rows) EXPECT_EQ(platform::json::parse(text).has_value(), ok) << text.substr(0, 40);
-  std::string error;
-  EXPECT_TRUE(!platform::json::parse("\"fragment\"", &error) && !error.empty());
+  for (const auto& [text, ok] : rows) EXPECT_EQ(platform::json::parse(text).ok(), ok) << text.substr(0, 40);
+  EXPECT_EQ(platform::json::parse("\"fragment\"").error(), "JSON text did not start with array or object");
 }
 
 TEST(Error, UserInfoAbsentIsDistinctFromEmptyAndCarriesTheMessage) {

@@ -30,9 +30,8 @@ int runDefaults(const Invocation& inv, std::ostream& out, std::ostream& err) {
   if (inv.command == Command::DefaultsWrite && !inv.force && !daemonReads(*inv.key))
     return fail(inv, err, kExitUsage,
                 "zlkad reads no setting '" + *inv.key + "' (it reads " + knownKeys() + "); --force writes it anyway");
-  std::string problem;
-  std::optional<platform::Configuration> configuration = platform::loadConfiguration(inv.configPath, &problem);
-  if (!configuration) return fail(inv, err, kExitUsage, problem);
+  platform::Result<platform::Configuration> configuration = platform::loadConfiguration(inv.configPath);
+  if (!configuration) return fail(inv, err, kExitUsage, configuration.error());
   platform::SettingsStore store(ZLKAUserDefaultsDomain, configuration->settingsDirectory);
   const std::string path = store.filePath().string();
 

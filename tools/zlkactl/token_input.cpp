@@ -10,6 +10,7 @@
 #include "client/request_encoding.h"
 #include "platform/values/base64.h"
 #include "platform/values/json.h"
+#include "platform/values/unique_fd.h"
 
 namespace zlkactl {
 
@@ -21,20 +22,6 @@ int hexDigit(char c) {
   if (c >= 'A' && c <= 'F') return c - 'A' + 10;
   return -1;
 }
-
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 }  // namespace
 
@@ -60,8 +47,8 @@ platform::Result<platform::Data> readTokenFile(const std::filesystem::path& path
   auto failure = [&](int e) {
     return platform::Failure{"--token-file: cannot read " + path.string() + ": " + std::strerror(e)};
   };
-  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (fd.get() < 0) return failure(errno);
+  platform::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!fd) return failure(errno);
   std::vector<uint8_t> bytes;
   uint8_t buffer[8192];
   for (;;) {
@@ -78,9 +65,8 @@ platform::Result<platform::Data> readTokenFile(const std::filesystem::path& path
 }
 
 platform::Result<platform::Dictionary> parseRequestInfo(std::string_view json) {
-  std::string problem;
-  std::optional<platform::Value> value = platform::json::parse(json, &problem);
-  if (!value) return platform::Failure{"--request-info: not valid JSON: " + problem};
+  platform::Result<platform::Value> value = platform::json::parse(json);
+  if (!value) return platform::Failure{"--request-info: not valid JSON: " + value.error()};
   if (!value->dictionary()) return platform::Failure{"--request-info: must be a JSON object, not an array"};
   if (auto reason = zlka_client::unsendableReason(*value, "requestInfo"))
     return platform::Failure{"--request-info: " + *reason};
@@ -90,7 +76,7 @@ platform::Result<platform::Dictionary> parseRequestInfo(std::string_view json) {
 platform::Value parseSettingsValue(std::string_view text) {
   // The JSON parser takes only objects and arrays at the top: wrap the text as the sole member of
   // an array, which also accepts scalars and refuses "1,2" (two members).
-  std::optional<platform::Value> wrapped = platform::json::parse("[" + std::string(text) + "]");
+  platform::Result<platform::Value> wrapped = platform::json::parse("[" + std::string(text) + "]");
   if (wrapped && wrapped->count() == 1) return wrapped->array()->front();
   return platform::Value(std::string(text));
 }

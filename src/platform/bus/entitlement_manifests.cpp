@@ -105,9 +105,8 @@ Result<std::optional<std::string>> pinnedExecutable(const Value& manifest) {
 }  // namespace
 
 Result<ManifestEntry> parseManifestEntry(std::string_view text) {
-  std::string error;
-  std::optional<Value> parsed = json::parse(text, &error);
-  if (!parsed) return Failure{"does not parse: " + error};
+  Result<Value> parsed = json::parse(text);
+  if (!parsed) return Failure{"does not parse: " + parsed.error()};
   const Dictionary* fields = parsed->dictionary();
   if (!fields) return Failure{"is not a JSON object"};
   // A misspelt key would silently widen the entry ("lable" pins no label), so it voids the entry.

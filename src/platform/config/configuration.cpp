@@ -188,15 +188,11 @@ std::optional<std::string> normalizedBaseURL(const std::string& url) {
   return out;
 }
 
-std::optional<Configuration> loadConfiguration(const std::filesystem::path& path, std::string* error) {
-  auto failWith = [&](const std::string& message) -> std::optional<Configuration> {
-    if (error) *error = message;
-    return std::nullopt;
-  };
+Result<Configuration> loadConfiguration(const std::filesystem::path& path) {
   if (std::optional<std::string> why = unreadableFileReason(path))
-    return failWith(path.string() + ": cannot read the configuration file: " + *why);
+    return Failure{path.string() + ": cannot read the configuration file: " + *why};
   Result<toml::table> root = parseTOML(path);
-  if (!root) return failWith(root.error());
+  if (!root) return Failure{root.error()};
 
   Configuration c;
   c.path = path;
@@ -205,7 +201,7 @@ std::optional<Configuration> loadConfiguration(const std::filesystem::path& path
   bool ok = readDevice(r, c) && readServers(r, c) && readFiles(r, c) && readLog(r, c) &&
             // Each connection worker costs a thread; past a few thousand the bound no longer protects anything.
             r.count("service.max_workers", c.maxWorkers, 2, 4096);
-  if (!ok) return failWith(r.error());
+  if (!ok) return Failure{r.error()};
 
   std::vector<std::string> unknown;
   collectUnknownKeys(*root, "", unknown);

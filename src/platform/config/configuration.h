@@ -16,6 +16,7 @@
 
 #include "platform/config/device_facts.h"
 #include "platform/log/log.h"
+#include "platform/values/result.h"
 
 namespace platform {
 
@@ -40,9 +41,9 @@ struct Configuration {
   static constexpr char kDefaultPath[] = "/etc/zlka/zlkad.toml";
 };
 
-// loadConfiguration reads and checks the file at `path`; it returns nullopt with *error set
-// ("<file>: <key>: <problem>") when the file cannot be used.
-std::optional<Configuration> loadConfiguration(const std::filesystem::path& path, std::string* error);
+// loadConfiguration reads and checks the file at `path`; it returns the configuration, or a failure
+// saying why ("<file>: <key>: <problem>") when the file cannot be used.
+Result<Configuration> loadConfiguration(const std::filesystem::path& path);
 
 // setCurrentConfiguration makes `configuration` the one in force for this process (set once at
 // start-up; tests set their own). Holders of the previous one keep it.

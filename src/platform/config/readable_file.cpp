@@ -7,21 +7,16 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/values/unique_fd.h"
+
 namespace platform {
 
 namespace {
 
-struct Descriptor {
-  int fd;
-  ~Descriptor() {
-    if (fd >= 0) ::close(fd);
-  }
-};
-
 std::optional<std::string> reason(const std::filesystem::path& path, bool directory) {
   // O_NONBLOCK: a FIFO named by mistake must not hang start-up.
-  Descriptor d{::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | (directory ? O_DIRECTORY : 0))};
-  if (d.fd < 0) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | (directory ? O_DIRECTORY : 0)));
+  if (!fd) {
     int e = errno;
     if (e == ENOENT) return "does not exist";
     if (e == EACCES || e == EPERM) return "permission denied";
@@ -29,7 +24,7 @@ std::optional<std::string> reason(const std::filesystem::path& path, bool direct
     return std::string(std::strerror(e));
   }
   struct stat st {};
-  if (::fstat(d.fd, &st) != 0) return std::string(std::strerror(errno));
+  if (::fstat(fd.get(), &st) != 0) return std::string(std::strerror(errno));
   if (!directory && !S_ISREG(st.st_mode)) return "is not a regular file";
   return std::nullopt;
 }

@@ -14,6 +14,7 @@
 #include "platform/config/configuration.h"
 #include "platform/log/log.h"
 #include "platform/values/json.h"
+#include "platform/values/unique_fd.h"
 
 namespace platform {
 
@@ -40,13 +41,12 @@ Dictionary SettingsStore::load() {
   std::stringstream text;
   text << in.rdbuf();
   if (!in) return cached_;
-  std::string error;
-  std::optional<Value> parsed = json::parse(text.str(), &error);
+  Result<Value> parsed = json::parse(text.str());
   if (parsed && parsed->dictionary()) {
     cached_ = *parsed->dictionary();
   } else {
     log(LogLevel::Error, "Settings suite %@ is unreadable (%@): %@; using no settings", suite_, path_.string(),
-        parsed ? std::string("not a JSON object") : error);
+        parsed ? std::string("not a JSON object") : parsed.error());
   }
   return cached_;
 }
@@ -81,19 +81,13 @@ bool SettingsStore::modify(const std::function<void(Dictionary&)>& change) {
   std::error_code ec;
   std::filesystem::create_directories(path_.parent_path(), ec);
   std::string lockPath = path_.string() + ".lock";
-  int lockFd = ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-  if (lockFd < 0) return false;
-  if (::flock(lockFd, LOCK_EX) != 0) {
-    ::close(lockFd);
-    return false;
-  }
+  // Closing the descriptor releases the lock.
+  UniqueFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+  if (!lock || ::flock(lock.get(), LOCK_EX) != 0) return false;
   Dictionary d = load();
   change(d);
-  std::optional<std::string> text = json::serialize(Value(d), true);
-  bool ok = text && writeFileAtomically(path_, *text + "\n");
-  ::flock(lockFd, LOCK_UN);
-  ::close(lockFd);
-  return ok;
+  Result<std::string> text = json::serialize(Value(d), true);
+  return text && writeFileAtomically(path_, *text + "\n");
 }
 
 bool SettingsStore::setObject(std::string_view key, const Value& value) {

@@ -101,34 +101,23 @@ bool isValidJSONObject(const Value& value) {
   return (value.isArray() || value.isDictionary()) && validMember(value, 0);
 }
 
-std::optional<std::string> serialize(const Value& value, bool pretty, std::string* error) {
-  if (!isValidJSONObject(value)) {
-    if (error) *error = "Invalid type in JSON write";
-    return std::nullopt;
-  }
+Result<std::string> serialize(const Value& value, bool pretty) {
+  if (!isValidJSONObject(value)) return Failure{"Invalid type in JSON write"};
   try {
     return toJSON(value).dump(pretty ? 2 : -1, ' ', false, json::error_handler_t::strict);
-  } catch (const json::exception& e) {
-    if (error) *error = e.what();
-    return std::nullopt;
+  } catch (const json::exception& e) {  // strings that are not UTF-8: the library's one way to say so
+    return Failure{e.what()};
   }
 }
 
-std::optional<Value> parse(std::string_view text, std::string* error) {
-  if (!depthWithinLimit(text)) {
-    if (error) *error = "JSON nesting is deeper than " + std::to_string(kMaxDepth) + " levels";
-    return std::nullopt;
-  }
+Result<Value> parse(std::string_view text) {
+  if (!depthWithinLimit(text)) return Failure{"JSON nesting is deeper than " + std::to_string(kMaxDepth) + " levels"};
   try {
     json j = json::parse(text.begin(), text.end());
-    if (!j.is_object() && !j.is_array()) {
-      if (error) *error = "JSON text did not start with array or object";
-      return std::nullopt;
-    }
+    if (!j.is_object() && !j.is_array()) return Failure{"JSON text did not start with array or object"};
     return fromJSON(j);
-  } catch (const json::exception& e) {
-    if (error) *error = e.what();
-    return std::nullopt;
+  } catch (const json::exception& e) {  // the parser's message says where the text went wrong
+    return Failure{e.what()};
   }
 }
 

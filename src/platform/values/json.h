@@ -6,10 +6,10 @@
 // so that hostile input cannot exhaust the stack.
 #pragma once
 
-#include <optional>
 #include <string>
 #include <string_view>
 
+#include "platform/values/result.h"
 #include "platform/values/value.h"
 
 namespace platform::json {
@@ -19,12 +19,12 @@ inline constexpr int kMaxDepth = 256;
 // isValidJSONObject is true when `value` is valid for writing (above).
 bool isValidJSONObject(const Value& value);
 
-// serialize returns `value` as JSON text, compact unless `pretty`, or nullopt (with a reason in
-// *error when `error` is not null) when the value is not valid for writing.
-std::optional<std::string> serialize(const Value& value, bool pretty = false, std::string* error = nullptr);
+// serialize returns `value` as JSON text, compact unless `pretty`, or a failure saying why when the
+// value is not valid for writing.
+Result<std::string> serialize(const Value& value, bool pretty = false);
 
-// parse returns the value `text` holds, or nullopt (with the parser's message in *error when
-// `error` is not null) for anything but a well-formed object or array within kMaxDepth.
-std::optional<Value> parse(std::string_view text, std::string* error = nullptr);
+// parse returns the value `text` holds, or a failure with the parser's message for anything but a
+// well-formed object or array within kMaxDepth.
+Result<Value> parse(std::string_view text);
 
 }  // namespace platform::json

@@ -1,7 +1,9 @@
-// Result<T>: what a parsing or set-up step produced, or the text that says why it failed. The
-// failure text is written to follow the name of the thing parsed ("it has no \"uid\"").
+// Result<T, E>: the value a parsing or set-up step produced, or why it failed, in the manner of
+// std::expected. The failure is a text by default, written to follow the name of the thing parsed
+// ("it has no \"uid\""); operations that fail with a platform::Error use Result<T, Error>.
 #pragma once
 
+#include <concepts>
 #include <string>
 #include <utility>
 #include <variant>
@@ -13,27 +15,38 @@ struct Failure {
   std::string message;
 };
 
-template <class T>
+template <class T, class E = std::string>
 class Result {
  public:
-  // A Result converts from the value on success and from a Failure on failure.
+  // A Result converts from the value on success.
   Result(T value) : v_(std::in_place_index<0>, std::move(value)) {}
-  Result(Failure failure) : v_(std::in_place_index<1>, std::move(failure.message)) {}
+  // A Result with a text for its failure converts from a Failure...
+  Result(Failure failure) requires std::same_as<E, std::string>
+      : v_(std::in_place_index<1>, std::move(failure.message)) {}
+  // ...and one with any other failure type from the failure itself.
+  Result(E error) requires(!std::same_as<E, std::string>) : v_(std::in_place_index<1>, std::move(error)) {}
 
   // ok, and the conversion to bool, are true when the step succeeded.
   bool ok() const { return v_.index() == 0; }
   explicit operator bool() const { return ok(); }
 
-  // The value (borrowed, or moved out of an rvalue Result); calling them on a failure throws
+  // The value, borrowed or moved out of an rvalue Result; calling these on a failure throws
   // std::bad_variant_access, a programming error.
-  const T& operator*() const& { return std::get<0>(v_); }
-  T&& operator*() && { return std::get<0>(std::move(v_)); }
-  const T* operator->() const { return &std::get<0>(v_); }
-  // error is why it failed; calling it on a success throws std::bad_variant_access.
-  const std::string& error() const { return std::get<1>(v_); }
+  const T& value() const& { return std::get<0>(v_); }
+  T& value() & { return std::get<0>(v_); }
+  T&& value() && { return std::get<0>(std::move(v_)); }
+  const T& operator*() const& { return value(); }
+  T& operator*() & { return value(); }
+  T&& operator*() && { return std::move(*this).value(); }
+  const T* operator->() const { return &value(); }
+  T* operator->() { return &value(); }
+  // value_or is a copy of the value on success, else `fallback`.
+  T value_or(T fallback) const& { return ok() ? value() : std::move(fallback); }
+  // error is why it failed, borrowed; calling it on a success throws std::bad_variant_access.
+  const E& error() const { return std::get<1>(v_); }
 
  private:
-  std::variant<T, std::string> v_;
+  std::variant<T, E> v_;
 };
 
 }  // namespace platform
