@@ -22,6 +22,7 @@ HTTPSession::Engine::Engine(HTTPSessionConfiguration configuration)
       callbackQueue_(Queue::serial(configuration_.label + ".callbackQueue")),
       claims_(std::make_shared<Semaphore>(configuration_.maximumConnectionsPerHost)) {
   globalInit();
+  // Out of memory leaves multi_ null: every task then fails with a transport error.
   multi_.reset(curl_multi_init());
   // The idle cache keeps every connection the bound allows, for each of the two servers (API and
   // static content) a session talks to: a smaller cache closes connections that the next
@@ -51,7 +52,7 @@ void HTTPSession::Engine::submit(const std::shared_ptr<HTTPTaskState>& task) {
   {
     std::lock_guard lock(mutex_);
     stopping = stopping_;
-    if (!stopping && startWorker()) {
+    if (!stopping && multi_ && startWorker()) {
       toAdd_.push_back(task);
       added = true;
     }
@@ -61,10 +62,9 @@ void HTTPSession::Engine::submit(const std::shared_ptr<HTTPTaskState>& task) {
     curl_multi_wakeup(multi_.get());
     return;
   }
+  const char* why = multi_ ? "no thread could be started for the transfer" : "libcurl could not make its multi handle";
   complete(task, HTTPOutcome::failure(stopping ? cancelledError(task->request.URL)
-                                               : transportError(CURLE_OUT_OF_MEMORY,
-                                                                "no thread could be started for the transfer",
-                                                                task->request.URL)));
+                                               : transportError(CURLE_OUT_OF_MEMORY, why, task->request.URL)));
 }
 
 void HTTPSession::Engine::cancel(const std::shared_ptr<HTTPTaskState>& task) {
@@ -77,7 +77,7 @@ void HTTPSession::Engine::cancel(const std::shared_ptr<HTTPTaskState>& task) {
 
 void HTTPSession::Engine::prepare() {
   std::lock_guard lock(mutex_);
-  startWorker();
+  if (multi_) startWorker();
 }
 
 // The event thread starts with the first task, and with a later one when it could not start

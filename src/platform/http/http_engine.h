@@ -37,7 +37,7 @@ class HTTPSession::Engine : public std::enable_shared_from_this<HTTPSession::Eng
   const std::shared_ptr<Queue>& callbackQueue() const { return callbackQueue_; }
 
   // submit hands a resumed task to the event thread; the task completes with an error when the
-  // engine is stopping or no thread can be started for it.
+  // engine is stopping, has no multi handle, or no thread can be started for it.
   void submit(const std::shared_ptr<HTTPTaskState>& task);
   // cancel has the event thread end a submitted task with HTTPErrorCancelled.
   void cancel(const std::shared_ptr<HTTPTaskState>& task);
