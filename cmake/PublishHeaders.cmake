@@ -1,5 +1,5 @@
 # Each library target publishes only its own headers: a directory of the build tree holding links
-# to them under the paths the sources include them by (platform/bus/listener.h), which becomes the
+# to them under the paths the sources include them by (platform/listener/listener.h), which becomes the
 # target's include directory. A source that includes a header of a library its target does not link
 # then fails to compile, so the links between targets must follow the layering that
 # `scripts/lint --layers` checks. Tests, benchmarks and fuzzers keep the whole tree on their path.

@@ -16,8 +16,8 @@
 #include "bench_world.h"
 #include "curl_device.h"
 #include "network/zlka_network.h"
-#include "platform/bus/connection.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/listener/connection.h"
 #include "platform/values/base64.h"
 
 namespace netbench {

@@ -3,7 +3,7 @@
 #include "network/answer_check.h"
 #include "network/signed_request.h"
 #include "network/token_array.h"
-#include "platform/bus/connection.h"
+#include "platform/listener/connection.h"
 #include "platform/log/log.h"
 #include "platform/values/base64.h"
 #include "support/base64_array.h"

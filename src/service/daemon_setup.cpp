@@ -2,11 +2,11 @@
 
 #include <CLI/CLI.hpp>
 
-#include "platform/bus/entitlement_manifests.h"
-#include "platform/bus/listener.h"
 #include "platform/config/configuration.h"
 #include "platform/config/device_facts.h"
 #include "platform/dispatch/worker_pool.h"
+#include "platform/listener/entitlement_manifests.h"
+#include "platform/listener/listener.h"
 #include "platform/log/log.h"
 #include "service/config_check.h"
 #include "service/runtime_control.h"

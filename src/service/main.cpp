@@ -2,7 +2,7 @@
 #include <malloc.h>
 #include <unistd.h>
 
-#include "platform/bus/listener.h"
+#include "platform/listener/listener.h"
 #include "service/daemon_setup.h"
 #include "service/service_delegate.h"
 

@@ -9,8 +9,8 @@
 #include <cstring>
 
 #include "network/zlka_network.h"
-#include "platform/bus/listener.h"
 #include "platform/config/configuration.h"
+#include "platform/listener/listener.h"
 #include "service/answer_counts.h"
 #include "service/zlka_network_bus_interface.h"
 

@@ -20,8 +20,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/bus/bus_properties.h"
 #include "platform/bus/handles.h"
+#include "platform/listener/bus_properties.h"
 #include "platform/log/log.h"
 
 inline constexpr char kLogControlPath[] = "/org/freedesktop/LogControl1";

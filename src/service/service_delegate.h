@@ -2,7 +2,7 @@
 // the ZLKANetworkProtocol interface. Callers are checked inside each operation, not here.
 #pragma once
 
-#include "platform/bus/listener.h"
+#include "platform/listener/listener.h"
 
 class ServiceDelegate final : public platform::ListenerDelegate {
  public:

@@ -7,7 +7,7 @@
 
 #include <string_view>
 
-#include "platform/bus/connection.h"
+#include "platform/listener/connection.h"
 
 namespace Entitlements {
 

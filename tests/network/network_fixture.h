@@ -16,8 +16,8 @@
 #include "common/server_world.h"
 #include "network/zlka_network.h"
 #include "network/zlka_network_constants.h"
-#include "platform/bus/connection.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/listener/connection.h"
 #include "support/errors.h"
 
 namespace nettest {

@@ -1,6 +1,6 @@
 // Who a manifest entry admits: the user the bus recorded is the boundary; label and executable
 // only narrow it, and anything that would silently widen an entry voids it.
-#include "platform/bus/entitlement_manifests.h"
+#include "platform/listener/entitlement_manifests.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>

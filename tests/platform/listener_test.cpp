@@ -1,5 +1,5 @@
 // The listener in-process on a private bus: working out who a peer is must never hold up anyone else.
-#include "platform/bus/listener.h"
+#include "platform/listener/listener.h"
 
 #include <gtest/gtest.h>
 

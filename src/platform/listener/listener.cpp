@@ -1,5 +1,5 @@
 // The listener's public face and its run loop: events, posted work, signals, the drain and the idle exit.
-#include "platform/bus/listener.h"
+#include "platform/listener/listener.h"
 
 #include <signal.h>
 #include <sys/signalfd.h>
@@ -7,7 +7,7 @@
 
 #include <cstring>
 
-#include "platform/bus/listener_core.h"
+#include "platform/listener/listener_core.h"
 
 namespace platform {
 

@@ -1,4 +1,4 @@
-#include "platform/bus/call_ledger.h"
+#include "platform/listener/call_ledger.h"
 
 #include <cstring>
 

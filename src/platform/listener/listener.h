@@ -16,9 +16,9 @@
 #include <optional>
 #include <string>
 
-#include "platform/bus/connection.h"
-#include "platform/bus/entitlement_manifests.h"
 #include "platform/bus/messaging.h"
+#include "platform/listener/connection.h"
+#include "platform/listener/entitlement_manifests.h"
 
 namespace platform {
 

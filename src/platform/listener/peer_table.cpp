@@ -1,11 +1,11 @@
-#include "platform/bus/peer_table.h"
+#include "platform/listener/peer_table.h"
 
 #include <fcntl.h>
 
 #include <cstring>
 
-#include "platform/bus/guarded.h"
-#include "platform/bus/listener.h"
+#include "platform/listener/guarded.h"
+#include "platform/listener/listener.h"
 #include "platform/log/log.h"
 
 namespace platform {

@@ -1,4 +1,4 @@
-#include "platform/bus/entitlement_manifests.h"
+#include "platform/listener/entitlement_manifests.h"
 
 #include <fcntl.h>
 #include <poll.h>

@@ -10,12 +10,12 @@
 #include <atomic>
 #include <vector>
 
-#include "platform/bus/call_ledger.h"
-#include "platform/bus/guarded.h"
 #include "platform/bus/handles.h"
-#include "platform/bus/listener.h"
 #include "platform/bus/loop_mailbox.h"
-#include "platform/bus/peer_table.h"
+#include "platform/listener/call_ledger.h"
+#include "platform/listener/guarded.h"
+#include "platform/listener/listener.h"
+#include "platform/listener/peer_table.h"
 #include "platform/log/log.h"
 
 struct signalfd_siginfo;

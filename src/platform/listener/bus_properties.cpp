@@ -1,4 +1,4 @@
-#include "platform/bus/bus_properties.h"
+#include "platform/listener/bus_properties.h"
 
 #include <cstring>
 

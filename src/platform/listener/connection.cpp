@@ -1,4 +1,4 @@
-#include "platform/bus/connection.h"
+#include "platform/listener/connection.h"
 
 #include "platform/dispatch/worker_pool.h"
 

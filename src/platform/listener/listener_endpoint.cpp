@@ -2,7 +2,7 @@
 // answer travels back to the bus thread and into the ledger.
 #include <cstring>
 
-#include "platform/bus/listener_core.h"
+#include "platform/listener/listener_core.h"
 
 namespace platform {
 
