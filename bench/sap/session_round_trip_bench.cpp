@@ -24,16 +24,16 @@ constexpr std::chrono::seconds kGuard{10};
 constexpr char kSessionId[] = "B3A1C0DE-0000-4000-8000-000000000001";
 
 struct Fixture {
-  TarvexSAPCredential root = TarvexSAPMakeRoot("Bench SAP Root");
-  TarvexSAPCredential setup = TarvexSAPIssueSetupCertificate(root, "Bench Setup");
-  std::vector<uint8_t> setupDER = TarvexSAPCertToDER(setup.certificate.get());
+  TarvexSAPCredential root = *TarvexSAPMakeRoot("Bench SAP Root");
+  TarvexSAPCredential setup = *TarvexSAPIssueSetupCertificate(root, "Bench Setup");
+  std::vector<uint8_t> setupDER = *TarvexSAPCertToDER(setup.certificate.get());
   std::unique_ptr<TarvexSAPServer> server;
 
   Fixture() {
-    const std::string pem = TarvexSAPCertToPEM(root.certificate.get());
+    const std::string pem = *TarvexSAPCertToPEM(root.certificate.get());
     const TarvexSAPConfig config{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
     if (TarvexSAPConfigure(&config) != kTarvexSAPOK) throw std::runtime_error("configure");
-    server = std::make_unique<TarvexSAPServer>(setupDER, setup.key.get());
+    server = *TarvexSAPServer::create(setupDER, setup.key.get());
   }
 };
 

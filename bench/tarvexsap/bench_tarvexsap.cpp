@@ -16,13 +16,13 @@
 namespace {
 
 struct Setup {
-  TarvexSAPCredential root = TarvexSAPMakeRoot("Bench SAP Root");
-  TarvexSAPCredential setup = TarvexSAPIssueSetupCertificate(root, "Bench Setup");
-  std::vector<uint8_t> setupDER = TarvexSAPCertToDER(setup.certificate.get());
-  std::unique_ptr<TarvexSAPServer> server = std::make_unique<TarvexSAPServer>(setupDER, setup.key.get());
+  TarvexSAPCredential root = *TarvexSAPMakeRoot("Bench SAP Root");
+  TarvexSAPCredential setup = *TarvexSAPIssueSetupCertificate(root, "Bench Setup");
+  std::vector<uint8_t> setupDER = *TarvexSAPCertToDER(setup.certificate.get());
+  std::unique_ptr<TarvexSAPServer> server = *TarvexSAPServer::create(setupDER, setup.key.get());
 
   Setup() {
-    const std::string pem = TarvexSAPCertToPEM(root.certificate.get());
+    const std::string pem = *TarvexSAPCertToPEM(root.certificate.get());
     const TarvexSAPConfig config{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
     if (TarvexSAPConfigure(&config) != kTarvexSAPOK) {
       throw std::runtime_error("configure");

@@ -11,16 +11,16 @@ Fixture build() {
   std::array<uint8_t, 32> setupSeed{};
   rootSeed.fill(0x52);
   setupSeed.fill(0x53);
-  const TarvexSAPKey rootKey = TarvexSAPEd25519KeyFromSeed(rootSeed);
-  const TarvexSAPKey setupKey = TarvexSAPEd25519KeyFromSeed(setupSeed);
+  const TarvexSAPKey rootKey = *TarvexSAPEd25519KeyFromSeed(rootSeed);
+  const TarvexSAPKey setupKey = *TarvexSAPEd25519KeyFromSeed(setupSeed);
   // Long validity so that stored seeds keep verifying.
   const TarvexSAPValidity validity{std::chrono::hours(-24), std::chrono::hours(24 * 365 * 50)};
   Fixture f;
-  f.root = TarvexSAPMakeRoot("Fuzz SAP Root", validity, rootKey.get());
-  f.setup = TarvexSAPIssueSetupCertificate(f.root, "Fuzz Setup", validity, setupKey.get());
-  f.setupDER = TarvexSAPCertToDER(f.setup.certificate.get());
-  f.server = std::make_unique<TarvexSAPServer>(f.setupDER, f.setup.key.get());
-  const std::string pem = TarvexSAPCertToPEM(f.root.certificate.get());
+  f.root = *TarvexSAPMakeRoot("Fuzz SAP Root", validity, rootKey.get());
+  f.setup = *TarvexSAPIssueSetupCertificate(f.root, "Fuzz Setup", validity, setupKey.get());
+  f.setupDER = *TarvexSAPCertToDER(f.setup.certificate.get());
+  f.server = *TarvexSAPServer::create(f.setupDER, f.setup.key.get());
+  const std::string pem = *TarvexSAPCertToPEM(f.root.certificate.get());
   const TarvexSAPConfig config{reinterpret_cast<const uint8_t*>(pem.data()), pem.size(), nullptr};
   if (TarvexSAPConfigure(&config) != kTarvexSAPOK) {
     violated("configure");

@@ -5,7 +5,8 @@
 // Validity is given as offsets from now, so expired or not-yet-valid certificates can be made.
 // Keys may be supplied (fixed keys give reproducible chains; a non-Ed25519 subject key makes a
 // deliberately unfit setup certificate); otherwise a fresh Ed25519 key is generated.
-// Every function throws std::runtime_error when OpenSSL fails or input does not parse.
+// Every function returns a failure, its text starting "SAP certificate tooling: ", when OpenSSL
+// fails or input does not parse.
 #pragma once
 
 #include <openssl/evp.h>
@@ -18,6 +19,8 @@
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include "tarvexsap/tarvex_sap_result.h"
 
 // The deleters of the owning types below.
 struct TarvexSAPKeyFree {
@@ -43,29 +46,34 @@ struct TarvexSAPCredential {
 };
 
 // TarvexSAPGenerateEd25519Key returns a fresh Ed25519 key, owned by the caller.
-TarvexSAPKey TarvexSAPGenerateEd25519Key();
-// Ed25519 key from 32 raw private bytes: a fixed seed gives a fixed key.
-TarvexSAPKey TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed);
+TarvexSAPResult<TarvexSAPKey> TarvexSAPGenerateEd25519Key();
+// TarvexSAPEd25519KeyFromSeed returns the Ed25519 key of 32 raw private bytes, owned by the
+// caller: a fixed seed gives a fixed key.
+TarvexSAPResult<TarvexSAPKey> TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed);
 
+// TarvexSAPMakeRoot returns a self-signed root named `commonName` (which must not be empty).
 // `key` null: a fresh Ed25519 key; otherwise the root takes a reference to it.
-TarvexSAPCredential TarvexSAPMakeRoot(std::string_view commonName, const TarvexSAPValidity& validity = {},
-                                      EVP_PKEY* key = nullptr);
-// `subjectKey` null: a fresh Ed25519 key; otherwise its public half is certified and the
+TarvexSAPResult<TarvexSAPCredential> TarvexSAPMakeRoot(std::string_view commonName,
+                                                       const TarvexSAPValidity& validity = {}, EVP_PKEY* key = nullptr);
+// TarvexSAPIssueSetupCertificate returns a setup certificate issued by `root`, which must hold
+// its key. `subjectKey` null: a fresh Ed25519 key; otherwise its public half is certified and the
 // credential takes a reference to it.
-TarvexSAPCredential TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root, std::string_view commonName,
-                                                   const TarvexSAPValidity& validity = {},
-                                                   EVP_PKEY* subjectKey = nullptr);
+TarvexSAPResult<TarvexSAPCredential> TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root,
+                                                                    std::string_view commonName,
+                                                                    const TarvexSAPValidity& validity = {},
+                                                                    EVP_PKEY* subjectKey = nullptr);
 
 // TarvexSAPCertToPEM and TarvexSAPCertToDER encode `cert`, which stays the caller's.
-std::string TarvexSAPCertToPEM(const X509* cert);
-std::vector<uint8_t> TarvexSAPCertToDER(const X509* cert);
-// TarvexSAPCertFromPEM and TarvexSAPCertFromDER decode one certificate (the first of a PEM text),
-// owned by the caller.
-TarvexSAPCert TarvexSAPCertFromPEM(std::string_view pem);
-TarvexSAPCert TarvexSAPCertFromDER(std::span<const uint8_t> der);
+TarvexSAPResult<std::string> TarvexSAPCertToPEM(const X509* cert);
+TarvexSAPResult<std::vector<uint8_t>> TarvexSAPCertToDER(const X509* cert);
+// TarvexSAPCertFromPEM and TarvexSAPCertFromDER decode one certificate (the first of a PEM text;
+// the whole of the DER bytes), owned by the caller.
+TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromPEM(std::string_view pem);
+TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromDER(std::span<const uint8_t> der);
 
-// PKCS#8, unencrypted.
-std::string TarvexSAPKeyToPEM(const EVP_PKEY* key);
-std::vector<uint8_t> TarvexSAPKeyToDER(const EVP_PKEY* key);
-TarvexSAPKey TarvexSAPKeyFromPEM(std::string_view pem);
-TarvexSAPKey TarvexSAPKeyFromDER(std::span<const uint8_t> der);
+// TarvexSAPKeyToPEM and TarvexSAPKeyToDER encode `key` as unencrypted PKCS#8; it stays the caller's.
+TarvexSAPResult<std::string> TarvexSAPKeyToPEM(const EVP_PKEY* key);
+TarvexSAPResult<std::vector<uint8_t>> TarvexSAPKeyToDER(const EVP_PKEY* key);
+// TarvexSAPKeyFromPEM and TarvexSAPKeyFromDER decode an unencrypted private key, owned by the caller.
+TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromPEM(std::string_view pem);
+TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromDER(std::span<const uint8_t> der);

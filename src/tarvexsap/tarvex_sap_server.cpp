@@ -7,7 +7,6 @@
 #include <algorithm>
 #include <limits>
 #include <mutex>
-#include <stdexcept>
 
 #include "tarvexsap/tsap_crypto.h"
 #include "tarvexsap/tsap_protocol.h"
@@ -66,29 +65,36 @@ const char* TarvexSAPServerStatusName(TarvexSAPServerStatus status) {
   return "unknown";
 }
 
-TarvexSAPServer::TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, EVP_PKEY* setupKey, Clock clock)
-    : certificate_(setupCertificateDER.begin(), setupCertificateDER.end()),
-      clock_(clock ? std::move(clock) : Clock(&std::chrono::steady_clock::now)) {
+TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
+                                                                          EVP_PKEY* setupKey, Clock clock) {
   tsap::X509Ptr cert = certificateFromDER(setupCertificateDER);
   if (!cert) {
     ERR_clear_error();
-    throw std::invalid_argument("setup certificate is not one DER certificate");
+    return TarvexSAPFailure{"setup certificate is not one DER certificate"};
   }
   if (setupKey == nullptr || EVP_PKEY_get_base_id(setupKey) != EVP_PKEY_ED25519) {
-    throw std::invalid_argument("setup key is not an Ed25519 key");
+    return TarvexSAPFailure{"setup key is not an Ed25519 key"};
   }
   if (X509_check_private_key(cert.get(), setupKey) != 1) {
     ERR_clear_error();
-    throw std::invalid_argument("setup key does not belong to the setup certificate");
+    return TarvexSAPFailure{"setup key does not belong to the setup certificate"};
   }
   EVP_PKEY_up_ref(setupKey);
-  key_.reset(setupKey);
+  std::unique_ptr<EVP_PKEY, KeyFree> key(setupKey);
+  return std::unique_ptr<TarvexSAPServer>(
+      new TarvexSAPServer({setupCertificateDER.begin(), setupCertificateDER.end()}, std::move(key), std::move(clock)));
 }
 
-TarvexSAPServer::TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, std::string_view setupKeyPEM,
-                                 Clock clock)
-    : TarvexSAPServer(setupCertificateDER, std::unique_ptr<EVP_PKEY, KeyFree>(keyFromPEM(setupKeyPEM)).get(),
-                      std::move(clock)) {}
+TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
+                                                                          std::string_view setupKeyPEM, Clock clock) {
+  const std::unique_ptr<EVP_PKEY, KeyFree> key(keyFromPEM(setupKeyPEM));
+  return create(setupCertificateDER, key.get(), std::move(clock));
+}
+
+TarvexSAPServer::TarvexSAPServer(std::vector<uint8_t> certificate, std::unique_ptr<EVP_PKEY, KeyFree> key, Clock clock)
+    : certificate_(std::move(certificate)),
+      key_(std::move(key)),
+      clock_(clock ? std::move(clock) : Clock(&std::chrono::steady_clock::now)) {}
 
 TarvexSAPServer::~TarvexSAPServer() = default;
 

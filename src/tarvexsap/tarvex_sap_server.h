@@ -28,6 +28,8 @@
 #include <unordered_map>
 #include <vector>
 
+#include "tarvexsap/tarvex_sap_result.h"
+
 enum class TarvexSAPServerStatus {
   ok,
   malformed,       // handshake request or session identifier unacceptable
@@ -58,10 +60,15 @@ class TarvexSAPServer {
     std::array<uint8_t, 40> signature{};
   };
 
-  // Throws std::invalid_argument unless the certificate parses, the key is Ed25519 and it is
-  // the certificate's key. A null clock means std::chrono::steady_clock::now.
-  TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, EVP_PKEY* setupKey, Clock clock = nullptr);
-  TarvexSAPServer(std::span<const uint8_t> setupCertificateDER, std::string_view setupKeyPEM, Clock clock = nullptr);
+  // create returns a server, owned by the caller, for the setup certificate `setupCertificateDER`
+  // (copied) and its Ed25519 `setupKey` (the server takes a reference); it fails, saying which,
+  // unless the certificate is one DER certificate, the key is Ed25519 and it is the certificate's.
+  // A null clock means std::chrono::steady_clock::now.
+  static TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> create(std::span<const uint8_t> setupCertificateDER,
+                                                                  EVP_PKEY* setupKey, Clock clock = nullptr);
+  // create with the key as unencrypted PEM text; it fails as above, and when the text holds no key.
+  static TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> create(std::span<const uint8_t> setupCertificateDER,
+                                                                  std::string_view setupKeyPEM, Clock clock = nullptr);
   ~TarvexSAPServer();
   TarvexSAPServer(const TarvexSAPServer&) = delete;
   TarvexSAPServer& operator=(const TarvexSAPServer&) = delete;
@@ -97,6 +104,9 @@ class TarvexSAPServer {
   struct KeyFree {
     void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
   };
+
+  // Takes the checked certificate and key; cannot fail.
+  TarvexSAPServer(std::vector<uint8_t> certificate, std::unique_ptr<EVP_PKEY, KeyFree> key, Clock clock);
 
   std::shared_ptr<Association> find(std::string_view sessionIdentifier, TarvexSAPServerStatus& status) const;
 

@@ -30,13 +30,13 @@ constexpr int32_t INVALID = kTarvexSAPErrorSignatureInvalid;
 class DeviceTest : public TsapTest {};
 
 Bytes issue(const TestPKI& p, const TarvexSAPValidity& validity, TarvexSAPKey key = nullptr) {
-  return TarvexSAPCertToDER(TarvexSAPIssueSetupCertificate(p.root, "Other", validity, key.get()).certificate.get());
+  return *TarvexSAPCertToDER(TarvexSAPIssueSetupCertificate(p.root, "Other", validity, key.get())->certificate.get());
 }
 
 // A setup certificate with its basicConstraints and keyUsage replaced (null: left out), for
 // shapes the tooling does not make.
 Bytes reshape(const TestPKI& p, const char* basicConstraints, const char* keyUsage) {
-  const TarvexSAPCredential leaf = TarvexSAPIssueSetupCertificate(p.root, "Reshaped");
+  const TarvexSAPCredential leaf = *TarvexSAPIssueSetupCertificate(p.root, "Reshaped");
   X509* cert = leaf.certificate.get();
   for (const auto& [nid, value] : {std::pair{NID_basic_constraints, basicConstraints}, {NID_key_usage, keyUsage}}) {
     X509_EXTENSION_free(X509_delete_ext(cert, X509_get_ext_by_NID(cert, nid, -1)));
@@ -48,7 +48,7 @@ Bytes reshape(const TestPKI& p, const char* basicConstraints, const char* keyUsa
     X509_EXTENSION_free(ext);
   }
   EXPECT_GT(X509_sign(cert, p.root.key.get(), nullptr), 0);
-  return TarvexSAPCertToDER(cert);
+  return *TarvexSAPCertToDER(cert);
 }
 
 const struct {
@@ -58,7 +58,7 @@ const struct {
 } kCertificates[] = {
     // clang-format off
     {"DER", [](const TestPKI &p) { return p.setupDER; }, OK},
-    {"PEM", [](const TestPKI &p) { return bytesOf(TarvexSAPCertToPEM(p.setup.certificate.get())); }, OK},
+    {"PEM", [](const TestPKI &p) { return bytesOf(*TarvexSAPCertToPEM(p.setup.certificate.get())); }, OK},
     {"hand-built, same shape", [](const TestPKI &p) { return reshape(p, "critical,CA:FALSE", "critical,digitalSignature"); }, OK},
     {"expired", [](const TestPKI &p) { return issue(p, {-hours(48), -hours(24)}); }, REJECTED},
     {"a CA allowed to sign", [](const TestPKI &p) { return reshape(p, "critical,CA:TRUE", "critical,digitalSignature,keyCertSign"); }, REJECTED},
@@ -68,7 +68,7 @@ const struct {
     {"another root's", [](const TestPKI &) { return TestPKI("Stranger").setupDER; }, REJECTED},
     {"empty", [](const TestPKI &) { return Bytes(); }, REJECTED},
     {"a byte after it", [](const TestPKI &p) { return p.setupDER + Bytes{0}; }, REJECTED},
-    {"PEM after a newline", [](const TestPKI &p) { return bytesOf("\n" + TarvexSAPCertToPEM(p.setup.certificate.get())); }, REJECTED},
+    {"PEM after a newline", [](const TestPKI &p) { return bytesOf("\n" + *TarvexSAPCertToPEM(p.setup.certificate.get())); }, REJECTED},
     // clang-format on
 };
 
@@ -108,7 +108,7 @@ const struct {
 } kInfos[] = {
     // clang-format off
     {"genuine", [](P, B, B g) { return g; }, OK},
-    {"signed by a sibling's key", [](P p, B r, B g) { return resign(r, g, TarvexSAPIssueSetupCertificate(p.root, "Sibling").key.get()); }, INVALID},
+    {"signed by a sibling's key", [](P p, B r, B g) { return resign(r, g, TarvexSAPIssueSetupCertificate(p.root, "Sibling")->key.get()); }, INVALID},
     {"answers another request", [](P p, B, B g) { return resign(Bytes(90, 1), g, p.setup.key.get()); }, INVALID},
     {"128 bytes", [](P, B, B g) { return Bytes(g.begin(), g.end() - 1); }, MALFORMED},
     {"130 bytes", [](P, B, B g) { return g + Bytes{0}; }, MALFORMED},

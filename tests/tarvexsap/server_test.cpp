@@ -5,8 +5,6 @@
 // targets' properties (fuzz/tarvexsap), each with its seeds.
 #include <gtest/gtest.h>
 
-#include <stdexcept>
-
 #include "tsap_test_support.h"
 
 using namespace tsaptest;
@@ -114,33 +112,47 @@ TEST_F(ServerTest, AssociationsAreReplacedExpireAndAreSwept) {
 
 TEST(ServerSetupTest, KeyMustBeTheCertificatesEd25519Key) {
   const TestPKI pki("Setup");
-  const TarvexSAPKey other = TarvexSAPGenerateEd25519Key();
+  const TarvexSAPKey other = *TarvexSAPGenerateEd25519Key();
   const TarvexSAPKey ec(EVP_PKEY_Q_keygen(nullptr, nullptr, "EC", "P-256"));
-  EXPECT_THROW(TarvexSAPServer(pki.setupDER, other.get()), std::invalid_argument);
-  EXPECT_THROW(TarvexSAPServer(pki.setupDER, ec.get()), std::invalid_argument);
-  EXPECT_THROW(TarvexSAPServer(pki.setupDER, static_cast<EVP_PKEY*>(nullptr)), std::invalid_argument);
-  EXPECT_THROW(TarvexSAPServer(pki.setupDER + Bytes{0}, pki.setup.key.get()), std::invalid_argument);
-  EXPECT_THROW(TarvexSAPServer(pki.setupDER, std::string_view("not a key")), std::invalid_argument);
+  // clang-format off
+  const std::pair<TarvexSAPResult<std::unique_ptr<TarvexSAPServer>>, const char*> refused[] = {
+      {TarvexSAPServer::create(pki.setupDER, other.get()), "setup key does not belong to the setup certificate"},
+      {TarvexSAPServer::create(pki.setupDER, ec.get()), "setup key is not an Ed25519 key"},
+      {TarvexSAPServer::create(pki.setupDER, static_cast<EVP_PKEY*>(nullptr)), "setup key is not an Ed25519 key"},
+      {TarvexSAPServer::create(pki.setupDER + Bytes{0}, pki.setup.key.get()), "setup certificate is not one DER certificate"},
+      {TarvexSAPServer::create(pki.setupDER, std::string_view("not a key")), "setup key is not an Ed25519 key"},
+  };
+  // clang-format on
+  for (const auto& [made, why] : refused) {
+    EXPECT_EQ(made ? "made" : made.error(), why);
+  }
   pki.trust();
-  TarvexSAPServer fromPEM(pki.setupDER, TarvexSAPKeyToPEM(pki.setup.key.get()));
-  EXPECT_EQ(fromPEM.setupCertificateDER(), pki.setupDER);
+  const std::unique_ptr<TarvexSAPServer> fromPEM =
+      *TarvexSAPServer::create(pki.setupDER, *TarvexSAPKeyToPEM(pki.setup.key.get()));
+  EXPECT_EQ(fromPEM->setupCertificateDER(), pki.setupDER);
   Device device;
-  EXPECT_TRUE(associate(device, fromPEM, "S", pki.setupDER));
+  EXPECT_TRUE(associate(device, *fromPEM, "S", pki.setupDER));
 }
 
 TEST(CertsToolingTest, RefusesWhatDoesNotParseAndKeepsKeysFromSeeds) {
-  const TarvexSAPCredential root = TarvexSAPMakeRoot("Tooling");
-  const Bytes der = TarvexSAPCertToDER(root.certificate.get());
-  EXPECT_THROW(TarvexSAPCertFromPEM("garbage"), std::runtime_error);
-  EXPECT_THROW(TarvexSAPCertFromDER(der + Bytes{0}), std::runtime_error);
-  EXPECT_THROW(TarvexSAPKeyFromPEM("garbage"), std::runtime_error);
-  EXPECT_THROW(TarvexSAPKeyFromDER(Bytes(10, 0)), std::runtime_error);
-  EXPECT_THROW(TarvexSAPMakeRoot(""), std::runtime_error);
-  EXPECT_EQ(TarvexSAPCertToDER(TarvexSAPCertFromPEM(TarvexSAPCertToPEM(root.certificate.get())).get()), der);
-  EXPECT_EQ(EVP_PKEY_eq(TarvexSAPKeyFromDER(TarvexSAPKeyToDER(root.key.get())).get(), root.key.get()), 1);
+  const TarvexSAPCredential root = *TarvexSAPMakeRoot("Tooling");
+  const Bytes der = *TarvexSAPCertToDER(root.certificate.get());
+  const auto why = [](const auto& result) { return result ? std::string("accepted") : result.error(); };
+  const std::pair<std::string, const char*> refused[] = {
+      {why(TarvexSAPCertFromPEM("garbage")), "certificate from PEM"},
+      {why(TarvexSAPCertFromDER(der + Bytes{0})), "certificate from DER"},
+      {why(TarvexSAPKeyFromPEM("garbage")), "key from PEM"},
+      {why(TarvexSAPKeyFromDER(Bytes(10, 0))), "key from DER"},
+      {why(TarvexSAPMakeRoot("")), "empty common name"},
+  };
+  for (const auto& [error, step] : refused) {
+    EXPECT_EQ(error, std::string("SAP certificate tooling: ") + step);
+  }
+  EXPECT_EQ(*TarvexSAPCertToDER(TarvexSAPCertFromPEM(*TarvexSAPCertToPEM(root.certificate.get()))->get()), der);
+  EXPECT_EQ(EVP_PKEY_eq(TarvexSAPKeyFromDER(*TarvexSAPKeyToDER(root.key.get()))->get(), root.key.get()), 1);
   // The fuzz targets' seed corpora rely on a fixed seed giving a fixed key.
   const std::array<uint8_t, 32> seed{7};
-  EXPECT_EQ(EVP_PKEY_eq(TarvexSAPEd25519KeyFromSeed(seed).get(), TarvexSAPEd25519KeyFromSeed(seed).get()), 1);
+  EXPECT_EQ(EVP_PKEY_eq(TarvexSAPEd25519KeyFromSeed(seed)->get(), TarvexSAPEd25519KeyFromSeed(seed)->get()), 1);
 }
 
 }  // namespace

@@ -36,10 +36,10 @@ inline Bytes fromHex(std::string_view hex) {
 // A root with one Ed25519 setup certificate under it.
 struct TestPKI {
   explicit TestPKI(const std::string& name)
-      : root(TarvexSAPMakeRoot(name + " SAP Root")),
-        setup(TarvexSAPIssueSetupCertificate(root, name + " Setup")),
-        rootPEM(TarvexSAPCertToPEM(root.certificate.get())),
-        setupDER(TarvexSAPCertToDER(setup.certificate.get())) {}
+      : root(*TarvexSAPMakeRoot(name + " SAP Root")),
+        setup(*TarvexSAPIssueSetupCertificate(root, name + " Setup")),
+        rootPEM(*TarvexSAPCertToPEM(root.certificate.get())),
+        setupDER(*TarvexSAPCertToDER(setup.certificate.get())) {}
   // Makes this root the device's only trust anchor.
   void trust(const char* machineIDPath = nullptr) const {
     const TarvexSAPConfig config{reinterpret_cast<const uint8_t*>(rootPEM.data()), rootPEM.size(), machineIDPath};
@@ -115,7 +115,7 @@ class TsapTest : public ::testing::Test {
       std::make_shared<std::chrono::steady_clock::time_point>();
   TestPKI pki_{"Test"};
   std::unique_ptr<TarvexSAPServer> server_ =
-      std::make_unique<TarvexSAPServer>(pki_.setupDER, pki_.setup.key.get(), [now = now_] { return *now; });
+      *TarvexSAPServer::create(pki_.setupDER, pki_.setup.key.get(), [now = now_] { return *now; });
 };
 
 }  // namespace tsaptest

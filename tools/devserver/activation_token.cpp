@@ -5,7 +5,6 @@
 
 #include <climits>
 #include <memory>
-#include <stdexcept>
 
 namespace devserver {
 
@@ -22,41 +21,54 @@ struct DigestContextFree {
 };
 using Sequence = std::unique_ptr<ASN1_SEQUENCE_ANY, SequenceFree>;
 
-[[noreturn]] void fail(const char* what) {
+using platform::Failure;
+using platform::Result;
+
+Failure failure(const char* what) {
   ERR_clear_error();
-  throw std::runtime_error(std::string("activation token: ") + what + " failed");
+  return Failure{std::string("activation token: ") + what + " failed"};
 }
 
-void push(ASN1_SEQUENCE_ANY* sequence, int type, void* value) {
+// Appends `value` (of ASN.1 `type`), which the sequence then owns; on failure it is freed with `release`.
+template <typename Value>
+bool push(ASN1_SEQUENCE_ANY* sequence, int type, Value* value, void (*release)(Value*)) {
   ASN1_TYPE* item = ASN1_TYPE_new();
   if (item == nullptr) {
-    fail("allocation");
+    release(value);
+    return false;
   }
   ASN1_TYPE_set(item, type, value);  // takes `value`
   if (sk_ASN1_TYPE_push(sequence, item) <= 0) {
     ASN1_TYPE_free(item);
-    fail("allocation");
+    return false;
   }
+  return true;
 }
 
-void pushUTF8(ASN1_SEQUENCE_ANY* sequence, std::string_view text) {
-  if (text.size() > static_cast<std::size_t>(INT_MAX)) {
-    fail("string length");
-  }
+ASN1_UTF8STRING* utf8String(std::string_view text) {
   ASN1_UTF8STRING* string = ASN1_UTF8STRING_new();
   if (string == nullptr || ASN1_STRING_set(string, text.data(), static_cast<int>(text.size())) != 1) {
     ASN1_UTF8STRING_free(string);
-    fail("string encoding");
+    return nullptr;
   }
-  push(sequence, V_ASN1_UTF8STRING, string);
+  return string;
+}
+
+ASN1_INTEGER* integer(int64_t value) {
+  ASN1_INTEGER* number = ASN1_INTEGER_new();
+  if (number == nullptr || ASN1_INTEGER_set_int64(number, value) != 1) {
+    ASN1_INTEGER_free(number);
+    return nullptr;
+  }
+  return number;
 }
 
 template <typename Encode>
-std::vector<uint8_t> encode(Encode encodeTo) {
+Result<std::vector<uint8_t>> encode(Encode encodeTo) {
   unsigned char* der = nullptr;
   const int length = encodeTo(&der);
   if (length <= 0 || der == nullptr) {
-    fail("DER encoding");
+    return failure("DER encoding");
   }
   std::vector<uint8_t> out(der, der + length);
   OPENSSL_free(der);
@@ -70,33 +82,44 @@ std::string stringOf(const ASN1_STRING* string) {
 
 }  // namespace
 
-std::vector<uint8_t> encodeActivationRecord(const ActivationRecord& record) {
+Result<std::vector<uint8_t>> encodeActivationRecord(const ActivationRecord& record) {
   Sequence sequence(sk_ASN1_TYPE_new_null());
   if (!sequence) {
-    fail("allocation");
+    return failure("allocation");
   }
-  pushUTF8(sequence.get(), record.uuid);
-  pushUTF8(sequence.get(), record.ppid);
-  ASN1_INTEGER* issuedAt = ASN1_INTEGER_new();
-  if (issuedAt == nullptr || ASN1_INTEGER_set_int64(issuedAt, record.issuedAt) != 1) {
-    ASN1_INTEGER_free(issuedAt);
-    fail("integer encoding");
+  for (const std::string* text : {&record.uuid, &record.ppid}) {
+    if (text->size() > static_cast<std::size_t>(INT_MAX)) {
+      return failure("string length");
+    }
+    ASN1_UTF8STRING* string = utf8String(*text);
+    if (string == nullptr) {
+      return failure("string encoding");
+    }
+    if (!push(sequence.get(), V_ASN1_UTF8STRING, string, ASN1_UTF8STRING_free)) {
+      return failure("allocation");
+    }
   }
-  push(sequence.get(), V_ASN1_INTEGER, issuedAt);
+  ASN1_INTEGER* issuedAt = integer(record.issuedAt);
+  if (issuedAt == nullptr) {
+    return failure("integer encoding");
+  }
+  if (!push(sequence.get(), V_ASN1_INTEGER, issuedAt, ASN1_INTEGER_free)) {
+    return failure("allocation");
+  }
   return encode([&](unsigned char** der) { return i2d_ASN1_SEQUENCE_ANY(sequence.get(), der); });
 }
 
-std::vector<uint8_t> signActivationRecord(std::span<const uint8_t> recordDER, EVP_PKEY* key) {
+Result<std::vector<uint8_t>> signActivationRecord(std::span<const uint8_t> recordDER, EVP_PKEY* key) {
   std::unique_ptr<EVP_MD_CTX, DigestContextFree> ctx(EVP_MD_CTX_new());
   unsigned char signature[64];
   std::size_t length = sizeof signature;
   if (!ctx || EVP_DigestSignInit(ctx.get(), nullptr, nullptr, nullptr, key) != 1 ||
       EVP_DigestSign(ctx.get(), signature, &length, recordDER.data(), recordDER.size()) != 1) {
-    fail("Ed25519 signing");
+    return failure("Ed25519 signing");
   }
   std::unique_ptr<ASN1_OCTET_STRING, OctetStringFree> octets(ASN1_OCTET_STRING_new());
   if (!octets || ASN1_OCTET_STRING_set(octets.get(), signature, static_cast<int>(length)) != 1) {
-    fail("allocation");
+    return failure("allocation");
   }
   return encode([&](unsigned char** der) { return i2d_ASN1_OCTET_STRING(octets.get(), der); });
 }

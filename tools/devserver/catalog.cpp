@@ -5,7 +5,6 @@
 #include <cctype>
 #include <fstream>
 #include <sstream>
-#include <stdexcept>
 
 namespace devserver {
 
@@ -74,45 +73,45 @@ class Reader {
  public:
   explicit Reader(std::string origin) : origin_(std::move(origin)) {}
 
-  [[noreturn]] void fail(const std::string& where, const std::string& what) const {
-    throw std::runtime_error(origin_ + ": " + (where.empty() ? "" : where + ": ") + what);
+  platform::Failure fail(const std::string& where, const std::string& what) const {
+    return platform::Failure{origin_ + ": " + (where.empty() ? "" : where + ": ") + what};
   }
 
-  ProductPlan plan(const json& value, const std::string& where) const {
+  platform::Result<ProductPlan> plan(const json& value, const std::string& where) const {
     if (!value.is_object()) {
-      fail(where, "a plan must be an object with \"ppid\", \"default_locale\" and \"metadata\"");
+      return fail(where, "a plan must be an object with \"ppid\", \"default_locale\" and \"metadata\"");
     }
     for (const auto& [key, member] : value.items()) {
       if (key != "ppid" && key != "default_locale" && key != "metadata") {
-        fail(where, "unknown member \"" + key + "\"");
+        return fail(where, "unknown member \"" + key + "\"");
       }
     }
     ProductPlan plan;
     const auto ppid = value.find("ppid");
     if (ppid == value.end() || !ppid->is_string() || ppid->get_ref<const std::string&>().empty()) {
-      fail(where + ".ppid", "must be a non-empty string");
+      return fail(where + ".ppid", "must be a non-empty string");
     }
     plan.ppid = ppid->get<std::string>();
     const auto metadata = value.find("metadata");
     if (metadata == value.end() || !metadata->is_object() || metadata->empty()) {
-      fail(where + ".metadata", "must be an object mapping at least one locale to an object");
+      return fail(where + ".metadata", "must be an object mapping at least one locale to an object");
     }
     for (const auto& [locale, entry] : metadata->items()) {
       if (!plausibleLocale(locale)) {
-        fail(where + ".metadata", "\"" + locale + "\" is not a locale identifier such as \"en_US\"");
+        return fail(where + ".metadata", "\"" + locale + "\" is not a locale identifier such as \"en_US\"");
       }
       if (!entry.is_object()) {
-        fail(where + ".metadata." + locale, "must be an object");
+        return fail(where + ".metadata." + locale, "must be an object");
       }
     }
     plan.metadata = *metadata;
     const auto defaultLocale = value.find("default_locale");
     if (defaultLocale == value.end() || !defaultLocale->is_string()) {
-      fail(where + ".default_locale", "must be a string");
+      return fail(where + ".default_locale", "must be a string");
     }
     plan.defaultLocale = defaultLocale->get<std::string>();
     if (!plan.metadata.contains(plan.defaultLocale)) {
-      fail(where + ".default_locale", "\"" + plan.defaultLocale + "\" has no entry in metadata");
+      return fail(where + ".default_locale", "\"" + plan.defaultLocale + "\" has no entry in metadata");
     }
     return plan;
   }
@@ -142,65 +141,76 @@ std::string ProductPlan::answerLocale(std::string_view requested) const {
   return defaultLocale;
 }
 
-Catalog Catalog::builtIn() {
-  Catalog catalog;
-  catalog.fallback_ = Reader("built-in catalog").plan(json::parse(kBuiltInPlan), "default");
-  return catalog;
+platform::Result<Catalog> Catalog::builtIn() {
+  return fromJSON(json{{"default", json::parse(kBuiltInPlan, nullptr, false)}}, "built-in catalog");
 }
 
-Catalog Catalog::fromFile(const std::filesystem::path& file) {
+platform::Result<Catalog> Catalog::fromFile(const std::filesystem::path& file) {
   const std::string origin = "catalog " + file.string();
   std::ifstream in(file, std::ios::binary);
   if (!in) {
-    throw std::runtime_error(origin + ": cannot be opened");
+    return platform::Failure{origin + ": cannot be opened"};
   }
   std::ostringstream text;
   text << in.rdbuf();
   if (!in) {
-    throw std::runtime_error(origin + ": cannot be read");
+    return platform::Failure{origin + ": cannot be read"};
   }
   json document;
+  // The throwing parse is the one whose error says where the text goes wrong.
   try {
     document = json::parse(std::move(text).str());
   } catch (const json::parse_error& error) {
-    throw std::runtime_error(origin + ": not valid JSON (" + error.what() + ")");
+    return platform::Failure{origin + ": not valid JSON (" + error.what() + ")"};
   }
   return fromJSON(document, origin);
 }
 
-Catalog Catalog::fromJSON(const json& document, const std::string& origin) {
+platform::Result<Catalog> Catalog::fromJSON(const json& document, const std::string& origin) {
   const Reader reader(origin);
   if (!document.is_object()) {
-    reader.fail("", "the top level must be an object with \"default\" and/or \"tokens\"");
+    return reader.fail("", "the top level must be an object with \"default\" and/or \"tokens\"");
   }
   Catalog catalog;
   for (const auto& [key, member] : document.items()) {
     if (key != "default" && key != "tokens") {
-      reader.fail("", "unknown member \"" + key + "\" (expected \"default\" and/or \"tokens\")");
+      return reader.fail("", "unknown member \"" + key + "\" (expected \"default\" and/or \"tokens\")");
     }
   }
   if (const auto fallback = document.find("default"); fallback != document.end()) {
-    catalog.fallback_ = reader.plan(*fallback, "default");
+    platform::Result<ProductPlan> plan = reader.plan(*fallback, "default");
+    if (!plan) {
+      return platform::Failure{plan.error()};
+    }
+    catalog.fallback_ = *std::move(plan);
   }
   if (const auto tokens = document.find("tokens"); tokens != document.end()) {
     if (!tokens->is_object()) {
-      reader.fail("tokens", "must be an object mapping SHA-256 hex digests to plans");
+      return reader.fail("tokens", "must be an object mapping SHA-256 hex digests to plans");
     }
-    for (const auto& [digest, plan] : tokens->items()) {
+    for (const auto& [digest, entry] : tokens->items()) {
       if (!isLowerHexDigest(digest)) {
-        reader.fail("tokens", "\"" + digest + "\" is not a lower-case hex SHA-256 digest (64 characters)");
+        return reader.fail("tokens", "\"" + digest + "\" is not a lower-case hex SHA-256 digest (64 characters)");
       }
-      catalog.byDigest_.emplace(digest, reader.plan(plan, "tokens." + digest));
+      platform::Result<ProductPlan> plan = reader.plan(entry, "tokens." + digest);
+      if (!plan) {
+        return platform::Failure{plan.error()};
+      }
+      catalog.byDigest_.emplace(digest, *std::move(plan));
     }
   }
   if (!catalog.fallback_ && catalog.byDigest_.empty()) {
-    reader.fail("", "neither a \"default\" plan nor any entry in \"tokens\"");
+    return reader.fail("", "neither a \"default\" plan nor any entry in \"tokens\"");
   }
   return catalog;
 }
 
-const ProductPlan* Catalog::mapped(std::span<const uint8_t> firstTokenItem) const {
-  const auto it = byDigest_.find(sha256Hex(firstTokenItem));
+platform::Result<const ProductPlan*> Catalog::mapped(std::span<const uint8_t> firstTokenItem) const {
+  const platform::Result<std::string> digest = sha256Hex(firstTokenItem);
+  if (!digest) {
+    return platform::Failure{digest.error()};
+  }
+  const auto it = byDigest_.find(*digest);
   return it == byDigest_.end() ? nullptr : &it->second;
 }
 
@@ -216,11 +226,11 @@ const ProductPlan* Catalog::withPPID(std::string_view ppid) const {
   return nullptr;
 }
 
-std::string sha256Hex(std::span<const uint8_t> bytes) {
+platform::Result<std::string> sha256Hex(std::span<const uint8_t> bytes) {
   unsigned char digest[EVP_MAX_MD_SIZE];
   unsigned int length = 0;
   if (EVP_Digest(bytes.data(), bytes.size(), digest, &length, EVP_sha256(), nullptr) != 1) {
-    throw std::runtime_error("SHA-256 failed");
+    return platform::Failure{"SHA-256 failed"};
   }
   static constexpr char kHex[] = "0123456789abcdef";
   std::string out;

@@ -5,8 +5,8 @@
 // A catalogue file is {"default": PLAN (optional), "tokens": {"<sha256 hex>": PLAN}} where the
 // key is the lower-case hex SHA-256 of a token's first item. builtIn() has one default plan,
 // "PP-0001-ACCESSORY", in several locales, so that any token gets an answer.
-// Loading throws std::runtime_error naming the file and the member that is wrong. Immutable
-// once made, so it may be read from any thread.
+// Loading fails naming the file and the member that is wrong. Immutable once made, so it may be
+// read from any thread.
 #pragma once
 
 #include <cstdint>
@@ -17,6 +17,8 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+
+#include "platform/values/result.h"
 
 namespace devserver {
 
@@ -33,13 +35,16 @@ struct ProductPlan {
 
 class Catalog {
  public:
-  static Catalog builtIn();
-  static Catalog fromFile(const std::filesystem::path& file);
-  // `origin` names the source in error messages.
-  static Catalog fromJSON(const nlohmann::json& document, const std::string& origin);
+  // builtIn returns the built-in catalogue; it fails only if its own text were wrong.
+  static platform::Result<Catalog> builtIn();
+  // fromFile returns the catalogue in `file`, or a failure naming the file and what is wrong.
+  static platform::Result<Catalog> fromFile(const std::filesystem::path& file);
+  // fromJSON returns the catalogue `document` describes, or a failure naming `origin` and the
+  // member that is wrong.
+  static platform::Result<Catalog> fromJSON(const nlohmann::json& document, const std::string& origin);
 
-  // The plan mapped to this first token item, or null.
-  const ProductPlan* mapped(std::span<const uint8_t> firstTokenItem) const;
+  // The plan mapped to this first token item, or null; a failure when it cannot be digested.
+  platform::Result<const ProductPlan*> mapped(std::span<const uint8_t> firstTokenItem) const;
   // The first plan (default first) with this ppid, or null.
   const ProductPlan* withPPID(std::string_view ppid) const;
   // The plan of tokens that are not mapped, or null when there is none.
@@ -51,6 +56,7 @@ class Catalog {
   std::unordered_map<std::string, ProductPlan> byDigest_;
 };
 
-std::string sha256Hex(std::span<const uint8_t> bytes);
+// sha256Hex returns the lower-case hex SHA-256 of `bytes`, or a failure when the crypto library fails.
+platform::Result<std::string> sha256Hex(std::span<const uint8_t> bytes);
 
 }  // namespace devserver

@@ -1,30 +1,22 @@
+// A DevServer's set-up and life: state, catalogue and SAP server, cpp-httplib's configuration
+// (TLS, keep-alive, routes, error answers, request log), start and stop.
 #include "devserver/dev_server.h"
 
 #include <httplib.h>
-#include <openssl/rand.h>
 
-#include <condition_variable>
 #include <cstdio>
-#include <future>
-#include <mutex>
 #include <nlohmann/json.hpp>
-#include <thread>
 #include <utility>
 
-#include "devserver/catalog.h"
-#include "devserver/connection_tracker.h"
-#include "devserver/device_services.h"
-#include "devserver/fault_table.h"
+#include "devserver/dev_server_impl.h"
 #include "devserver/listen_address.h"
-#include "devserver/server_stats.h"
-#include "devserver/state_dir.h"
-#include "devserver/strict_base64.h"
 #include "devserver/worker_pool.h"
-#include "tarvexsap/tarvex_sap_server.h"
 
 namespace devserver {
 
 using nlohmann::json;
+
+thread_local RequestContext tlRequest;
 
 namespace {
 
@@ -32,16 +24,6 @@ constexpr std::size_t kMaxBody = 1024 * 1024;
 constexpr std::size_t kInitialWorkers = 4;
 constexpr std::size_t kMaxWorkers = 256;
 constexpr std::size_t kKeepAliveRequests = 1000000;
-
-// What the request log needs from the hooks that cpp-httplib calls around one request
-// (pre-routing, handler, logger: all on the connection's worker thread).
-struct RequestContext {
-  std::optional<std::chrono::steady_clock::time_point> start;
-  bool dropped = false;
-};
-thread_local RequestContext tlRequest;
-
-bool isAdminPath(const std::string& path) { return path.starts_with("/_admin/"); }
 
 const char* errorReason(int status) {
   switch (status) {
@@ -62,26 +44,6 @@ const char* errorReason(int status) {
   }
 }
 
-std::optional<std::string> header(const httplib::Request& req, const char* name) {
-  if (!req.has_header(name)) {
-    return std::nullopt;
-  }
-  return req.get_header_value(name);
-}
-
-void setAnswer(httplib::Response& res, const Answer& answer) {
-  res.status = answer.status;
-  if (answer.status == 204 || answer.status == 304) {
-    return;  // these carry no body on the wire
-  }
-  res.set_content(answer.body, answer.contentType);  // also when empty: the error handler keeps out
-}
-
-void setJSON(httplib::Response& res, int status, const json& value) {
-  res.status = status;
-  res.set_content(value.dump(-1, ' ', false, json::error_handler_t::replace), "application/json");
-}
-
 // Paths come from the network: keep the log one line per request.
 std::string printable(const std::string& text) {
   std::string out = text.substr(0, 200);
@@ -94,43 +56,6 @@ std::string printable(const std::string& text) {
 }
 
 }  // namespace
-
-struct DevServer::Impl {
-  explicit Impl(DevServerOptions opts) : options(std::move(opts)) {}
-
-  DevServerOptions options;
-  DevServerState state;
-  std::optional<Catalog> catalog;
-  std::unique_ptr<TarvexSAPServer> sap;
-  std::unique_ptr<DeviceServices> services;
-  FaultTable faults;
-  ServerStats stats;
-  ConnectionTracker tracker{[this] { stats.countConnection(); }};  // outlives `http`
-  std::unique_ptr<httplib::SSLServer> http;
-  std::thread listener;
-  std::promise<void> running;
-  std::once_flag runningOnce;
-  uint16_t port = 0;
-  socket_t listeningSocket = INVALID_SOCKET;
-  bool started = false;
-
-  std::mutex stopMutex;
-  std::condition_variable stopWake;
-  bool stopping = false;  // guarded by stopMutex
-
-  void markRunning() {
-    std::call_once(runningOnce, [this] { running.set_value(); });
-  }
-  bool configureTLS(SSL_CTX& ctx);
-  void configureHTTP();
-  void dispatch(const httplib::Request& req, httplib::Response& res);
-  void dispatchDevice(const httplib::Request& req, httplib::Response& res);
-  void dispatchAdmin(const httplib::Request& req, httplib::Response& res);
-  void respond(Endpoint endpoint, const httplib::Request& req, httplib::Response& res, Answer answer);
-  void signAnswer(const Answer& answer, SignatureFault mode, httplib::Response& res);
-  bool pause(std::chrono::milliseconds delay);
-  void log(const httplib::Request& req, const httplib::Response& res);
-};
 
 bool DevServer::Impl::configureTLS(SSL_CTX& ctx) {
   SSL_CTX_set_min_proto_version(&ctx, TLS1_2_VERSION);
@@ -208,171 +133,6 @@ void DevServer::Impl::log(const httplib::Request& req, const httplib::Response& 
                outcome.c_str(), ms);
 }
 
-void DevServer::Impl::dispatch(const httplib::Request& req, httplib::Response& res) {
-  const bool admin = options.admin && isAdminPath(req.path);
-  try {
-    if (admin) {
-      dispatchAdmin(req, res);
-    } else {
-      dispatchDevice(req, res);
-    }
-  } catch (const std::exception& error) {
-    setAnswer(res, errorAnswer(500, std::string("internal error: ") + error.what()));
-    if (!admin) {
-      stats.countStatus(500);
-    }
-  }
-}
-
-void DevServer::Impl::dispatchDevice(const httplib::Request& req, httplib::Response& res) {
-  const auto endpoint = endpointAtPath(req.path);
-  if (!endpoint) {
-    setAnswer(res, errorAnswer(404, "no such endpoint"));
-    stats.countStatus(404);
-    return;
-  }
-  stats.countRequest(*endpoint);
-  const std::string_view method = endpointMethod(*endpoint);
-  if (req.method != method && !(method == "GET" && req.method == "HEAD")) {
-    setAnswer(res, errorAnswer(405, "method not allowed: use " + std::string(method)));
-    res.set_header("Allow", method == "GET" ? "GET, HEAD" : "POST");
-    stats.countStatus(405);
-    return;
-  }
-  switch (*endpoint) {
-    case Endpoint::setupCertificate:
-      respond(*endpoint, req, res, services->setupCertificate());
-      return;
-    case Endpoint::sapSession:
-      respond(*endpoint, req, res, services->sapSession(req.body));
-      return;
-    default:
-      respond(*endpoint, req, res,
-              services->tokenRequest(
-                  *endpoint, SignedRequest{header(req, "session-identifier"), header(req, "signature"), req.body}));
-      return;
-  }
-}
-
-// The faults that rewrite an answer: the handshake's members (only of a successful handshake,
-// the one answer that has them), then the status and the body.
-static void applyFault(Endpoint endpoint, const Fault& fault, Answer& answer) {
-  if (endpoint == Endpoint::sapSession && answer.status == 200 && (fault.sessionValidity || fault.sessionInfo)) {
-    json document = json::parse(answer.body);
-    if (fault.sessionValidity) {
-      document["session-validity"] = *fault.sessionValidity;
-    }
-    if (fault.sessionInfo) {
-      document["session-info"] = *fault.sessionInfo;
-    }
-    answer.body = document.dump(-1, ' ', false, json::error_handler_t::replace);
-  }
-  if (fault.status) {
-    answer.status = *fault.status;
-  }
-  if (fault.body) {
-    answer.body = *fault.body;
-  }
-}
-
-// The right seq with a wrong MAC, or, where there was no signature to spoil, a random one.
-static void corruptSignature(std::optional<std::array<uint8_t, 40>>& signature) {
-  if (signature) {
-    (*signature)[39] ^= 0x01;
-    return;
-  }
-  signature.emplace();
-  (*signature)[7] = 1;
-  RAND_bytes(signature->data() + 8, 32);
-}
-
-// Faults act on the finished answer, so a verified request's seq is known for signing.
-void DevServer::Impl::respond(Endpoint endpoint, const httplib::Request& req, httplib::Response& res, Answer answer) {
-  const std::optional<Fault> fault = faults.take(endpoint);
-  if (fault && ((fault->delay.count() > 0 && !pause(fault->delay)) || fault->drop)) {
-    ConnectionTracker::cut(req.ssl);
-    tlRequest.dropped = true;
-    return;
-  }
-  if (fault) {
-    applyFault(endpoint, *fault, answer);
-  }
-  if (answer.status == 204 || answer.status == 304) {
-    answer.body.clear();  // what is signed must be what is sent
-  }
-  if (isTokenEndpoint(endpoint)) {
-    signAnswer(answer, fault && fault->signature ? *fault->signature : SignatureFault::valid, res);
-  }
-  setAnswer(res, answer);
-  stats.countStatus(answer.status);
-}
-
-void DevServer::Impl::signAnswer(const Answer& answer, SignatureFault mode, httplib::Response& res) {
-  std::optional<std::array<uint8_t, 40>> signature;
-  if (mode != SignatureFault::missing) {
-    signature = services->sign(answer, answer.body);
-  }
-  if (mode == SignatureFault::corrupt) {
-    corruptSignature(signature);
-  }
-  if (!signature) {
-    return;
-  }
-  const std::string text = base64Encode(*signature);
-  res.set_header("signature", mode == SignatureFault::padded ? " \t " + text + " \t" : text);
-}
-
-bool DevServer::Impl::pause(std::chrono::milliseconds delay) {
-  std::unique_lock lock(stopMutex);
-  return !stopWake.wait_for(lock, delay, [this] { return stopping; });
-}
-
-void DevServer::Impl::dispatchAdmin(const httplib::Request& req, httplib::Response& res) {
-  const auto methodNotAllowed = [&res](const char* allowed) {
-    setJSON(res, 405, json{{"error", std::string("method not allowed: use ") + allowed}});
-    res.set_header("Allow", allowed);
-  };
-  if (req.path == "/_admin/faults") {
-    if (req.method == "GET") {
-      setJSON(res, 200, json{{"faults", faults.toJSON()}});
-    } else if (req.method == "POST") {
-      const json document = json::parse(req.body, nullptr, false);
-      if (document.is_discarded()) {
-        setJSON(res, 400, json{{"error", "body is not JSON"}});
-        return;
-      }
-      try {
-        faults.set(parseFaultRule(document));
-      } catch (const std::invalid_argument& error) {
-        setJSON(res, 400, json{{"error", error.what()}});
-        return;
-      }
-      setJSON(res, 200, json{{"faults", faults.toJSON()}});
-    } else if (req.method == "DELETE") {
-      faults.clear();
-      setJSON(res, 200, json{{"faults", json::array()}});
-    } else {
-      methodNotAllowed("GET, POST, DELETE");
-    }
-  } else if (req.path == "/_admin/stats") {
-    if (req.method == "GET") {
-      setJSON(res, 200, stats.toJSON());
-    } else {
-      methodNotAllowed("GET");
-    }
-  } else if (req.path == "/_admin/reset") {
-    if (req.method == "POST") {
-      faults.clear();
-      stats.reset();
-      setJSON(res, 200, json{{"faults", json::array()}, {"stats", stats.toJSON()}});
-    } else {
-      methodNotAllowed("POST");
-    }
-  } else {
-    setJSON(res, 404, json{{"error", "no such admin endpoint"}});
-  }
-}
-
 DevServer::DevServer(DevServerOptions options) : impl_(std::make_unique<Impl>(std::move(options))) {}
 
 DevServer::~DevServer() { stop(); }
@@ -386,13 +146,23 @@ std::optional<std::string> DevServer::start() {
   if (d.options.sessionValidity.count() < 0) {
     return "the session validity must not be negative";
   }
-  try {
-    d.state = prepareStateDirectory(d.options.stateDir);
-    d.catalog = d.options.catalogFile ? Catalog::fromFile(*d.options.catalogFile) : Catalog::builtIn();
-    d.sap = std::make_unique<TarvexSAPServer>(d.state.setupCertificateDER, d.state.setupKey.get());
-  } catch (const std::exception& error) {
-    return std::string(error.what());
+  platform::Result<DevServerState> state = prepareStateDirectory(d.options.stateDir);
+  if (!state) {
+    return state.error();
   }
+  d.state = *std::move(state);
+  platform::Result<Catalog> catalog =
+      d.options.catalogFile ? Catalog::fromFile(*d.options.catalogFile) : Catalog::builtIn();
+  if (!catalog) {
+    return catalog.error();
+  }
+  d.catalog = *std::move(catalog);
+  TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> sap =
+      TarvexSAPServer::create(d.state.setupCertificateDER, d.state.setupKey.get());
+  if (!sap) {
+    return sap.error();
+  }
+  d.sap = std::move(*sap);
   d.services =
       std::make_unique<DeviceServices>(*d.sap, *d.catalog, d.state.setupKey.get(), d.options.sessionValidity, d.stats);
   d.http = std::make_unique<httplib::SSLServer>([&d](SSL_CTX& ctx) { return d.configureTLS(ctx); });
@@ -420,11 +190,9 @@ std::optional<std::string> DevServer::start() {
     d.markRunning();
   });
   running.wait();
-  try {
-    writeDaemonConfiguration(d.state.dir, baseURL());
-  } catch (const std::exception& error) {
+  if (const std::optional<platform::Failure> failed = writeDaemonConfiguration(d.state.dir, baseURL())) {
     stop();
-    return std::string(error.what());
+    return failed->message;
   }
   return std::nullopt;
 }

@@ -19,6 +19,10 @@ std::span<const uint8_t> bytesOf(std::string_view text) {
 // Every text in an answer came from parsed JSON; replacing stray bytes keeps dump() total.
 std::string serialise(const json& value) { return value.dump(-1, ' ', false, json::error_handler_t::replace); }
 
+// What the server's own failure (of the crypto library) answers, as the dispatcher answers
+// any other.
+Answer internalError(const std::string& why) { return errorAnswer(500, "internal error: " + why); }
+
 Answer jsonAnswer(int status, const json& value) {
   Answer answer;
   answer.status = status;
@@ -186,7 +190,11 @@ Answer DeviceServices::verifiedTokenRequest(Endpoint endpoint, std::string_view 
     }
     locale = requested->get<std::string>();
   }
-  const ProductPlan* plan = planFor(request.tokens);
+  const platform::Result<const ProductPlan*> found = planFor(request.tokens);
+  if (!found) {
+    return internalError(found.error());
+  }
+  const ProductPlan* plan = *found;
   if (plan == nullptr) {
     return errorAnswer(404, "unknown token");
   }
@@ -197,16 +205,24 @@ Answer DeviceServices::verifiedTokenRequest(Endpoint endpoint, std::string_view 
   }
   const auto issuedAt =
       std::chrono::duration_cast<std::chrono::seconds>(std::chrono::system_clock::now().time_since_epoch());
-  const std::vector<uint8_t> record = encodeActivationRecord({request.uuid, plan->ppid, issuedAt.count()});
-  const std::vector<uint8_t> signature = signActivationRecord(record, setupKey_);
-  return jsonAnswer(200, json{{"tokens", json::array({base64Encode(record), base64Encode(signature)})}});
+  const platform::Result<std::vector<uint8_t>> record =
+      encodeActivationRecord({request.uuid, plan->ppid, issuedAt.count()});
+  if (!record) {
+    return internalError(record.error());
+  }
+  const platform::Result<std::vector<uint8_t>> signature = signActivationRecord(*record, setupKey_);
+  if (!signature) {
+    return internalError(signature.error());
+  }
+  return jsonAnswer(200, json{{"tokens", json::array({base64Encode(*record), base64Encode(*signature)})}});
 }
 
 // A token mapped by the catalogue gets its plan; one of our own replacement tokens keeps the
 // plan it was issued for, while the catalogue still has it; anything else the default plan.
-const ProductPlan* DeviceServices::planFor(const std::vector<std::vector<uint8_t>>& tokens) const {
-  if (const ProductPlan* plan = catalog_.mapped(tokens.front())) {
-    return plan;
+platform::Result<const ProductPlan*> DeviceServices::planFor(const std::vector<std::vector<uint8_t>>& tokens) const {
+  const platform::Result<const ProductPlan*> mapped = catalog_.mapped(tokens.front());
+  if (!mapped || *mapped != nullptr) {
+    return mapped;
   }
   if (tokens.size() >= 2) {
     if (const auto record = decodeActivationToken(tokens[0], tokens[1], setupKey_)) {

@@ -60,7 +60,7 @@ class DeviceServices {
 
  private:
   Answer verifiedTokenRequest(Endpoint endpoint, std::string_view body);
-  const ProductPlan* planFor(const std::vector<std::vector<uint8_t>>& tokens) const;
+  platform::Result<const ProductPlan*> planFor(const std::vector<std::vector<uint8_t>>& tokens) const;
 
   TarvexSAPServer& sap_;
   const Catalog& catalog_;

@@ -1,7 +1,6 @@
 #include "devserver/fault_table.h"
 
 #include <algorithm>
-#include <stdexcept>
 
 namespace devserver {
 
@@ -9,21 +8,22 @@ using nlohmann::json;
 
 namespace {
 
-[[noreturn]] void invalid(const std::string& member, const std::string& what) {
-  throw std::invalid_argument("\"" + member + "\" " + what);
-}
+using platform::Failure;
+using platform::Result;
 
-int64_t integerMember(const json& value, const std::string& member, int64_t low, int64_t high) {
+Failure invalid(const std::string& member, const std::string& what) { return Failure{"\"" + member + "\" " + what}; }
+
+Result<int64_t> integerMember(const json& value, const std::string& member, int64_t low, int64_t high) {
   if (!value.is_number_integer()) {
-    invalid(member, "must be an integer");
+    return invalid(member, "must be an integer");
   }
   // Unsigned values above INT64_MAX would wrap: judge them before converting.
   if (value.is_number_unsigned() && value.get<uint64_t>() > static_cast<uint64_t>(high)) {
-    invalid(member, "must be at most " + std::to_string(high));
+    return invalid(member, "must be at most " + std::to_string(high));
   }
   const auto number = value.get<int64_t>();
   if (number < low || number > high) {
-    invalid(member, "must be between " + std::to_string(low) + " and " + std::to_string(high));
+    return invalid(member, "must be between " + std::to_string(low) + " and " + std::to_string(high));
   }
   return number;
 }
@@ -44,7 +44,7 @@ const char* signatureName(SignatureFault mode) {
   return "";
 }
 
-SignatureFault signatureMember(const json& value, const std::string& member) {
+Result<SignatureFault> signatureMember(const json& value, const std::string& member) {
   const std::string mode = value.is_string() ? value.get<std::string>() : "";
   for (SignatureFault known :
        {SignatureFault::valid, SignatureFault::missing, SignatureFault::corrupt, SignatureFault::padded}) {
@@ -52,59 +52,88 @@ SignatureFault signatureMember(const json& value, const std::string& member) {
       return known;
     }
   }
-  invalid(member, "must be \"valid\", \"missing\", \"corrupt\" or \"padded\"");
+  return invalid(member, "must be \"valid\", \"missing\", \"corrupt\" or \"padded\"");
 }
 
-std::string stringMember(const json& value, const std::string& member) {
+Result<std::string> stringMember(const json& value, const std::string& member) {
   if (!value.is_string()) {
-    invalid(member, "must be a string");
+    return invalid(member, "must be a string");
   }
   return value.get<std::string>();
 }
 
 // nullopt for "*", every endpoint.
-std::optional<Endpoint> endpointMember(const json& value, const std::string& member) {
-  const std::string name = stringMember(value, member);
-  if (name == "*") {
-    return std::nullopt;
+Result<std::optional<Endpoint>> endpointMember(const json& value, const std::string& member) {
+  const Result<std::string> name = stringMember(value, member);
+  if (!name) {
+    return Failure{name.error()};
   }
-  std::optional<Endpoint> endpoint = endpointNamed(name);
+  if (*name == "*") {
+    return std::optional<Endpoint>();
+  }
+  std::optional<Endpoint> endpoint = endpointNamed(*name);
   if (!endpoint) {
-    invalid(member,
-            "must be \"setup.crt\", \"sapSession\", \"queryProductPlan\", "
-            "\"activateAccessory\", \"ackAccessory\" or \"*\"");
+    return invalid(member,
+                   "must be \"setup.crt\", \"sapSession\", \"queryProductPlan\", "
+                   "\"activateAccessory\", \"ackAccessory\" or \"*\"");
   }
   return endpoint;
 }
 
-// The members that describe a fault, each with the parser that stores it.
+// Stores a member's value in `slot` when it parsed; the failure otherwise.
+template <typename T, typename Slot>
+std::optional<Failure> store(Result<T> parsed, Slot& slot) {
+  if (!parsed) {
+    return Failure{parsed.error()};
+  }
+  slot = *std::move(parsed);
+  return std::nullopt;
+}
+
+// The members that describe a fault, each with the parser that stores it (nullopt) or says why not.
 struct FaultMember {
   const char* name;
-  void (*parse)(const json& value, const std::string& member, Fault& fault);
+  std::optional<Failure> (*parse)(const json& value, const std::string& member, Fault& fault);
 };
 
 const FaultMember kFaultMembers[] = {
-    {"status", [](const json& value, const std::string& member,
-                  Fault& fault) { fault.status = static_cast<int>(integerMember(value, member, 200, 599)); }},
-    {"delay_ms",
-     [](const json& value, const std::string& member, Fault& fault) {
-       const int64_t ms = integerMember(value, member, 0, INT64_MAX);
-       fault.delay = std::min(std::chrono::milliseconds(ms), kLongestFaultDelay);
+    {"status",
+     [](const json& value, const std::string& member, Fault& fault) -> std::optional<Failure> {
+       const Result<int64_t> status = integerMember(value, member, 200, 599);
+       if (!status) {
+         return Failure{status.error()};
+       }
+       fault.status = static_cast<int>(*status);
+       return std::nullopt;
      }},
-    {"body",
-     [](const json& value, const std::string& member, Fault& fault) { fault.body = stringMember(value, member); }},
+    {"delay_ms",
+     [](const json& value, const std::string& member, Fault& fault) -> std::optional<Failure> {
+       const Result<int64_t> ms = integerMember(value, member, 0, INT64_MAX);
+       if (!ms) {
+         return Failure{ms.error()};
+       }
+       fault.delay = std::min(std::chrono::milliseconds(*ms), kLongestFaultDelay);
+       return std::nullopt;
+     }},
+    {"body", [](const json& value, const std::string& member,
+                Fault& fault) { return store(stringMember(value, member), fault.body); }},
     {"signature", [](const json& value, const std::string& member,
-                     Fault& fault) { fault.signature = signatureMember(value, member); }},
+                     Fault& fault) { return store(signatureMember(value, member), fault.signature); }},
     {"drop",
-     [](const json& value, const std::string& member, Fault& fault) {
+     [](const json& value, const std::string& member, Fault& fault) -> std::optional<Failure> {
        if (!value.is_boolean()) {
-         invalid(member, "must be true or false");
+         return invalid(member, "must be true or false");
        }
        fault.drop = value.get<bool>();
+       return std::nullopt;
      }},
-    {"session_validity", [](const json& value, const std::string&, Fault& fault) { fault.sessionValidity = value; }},
+    {"session_validity",
+     [](const json& value, const std::string&, Fault& fault) -> std::optional<Failure> {
+       fault.sessionValidity = value;
+       return std::nullopt;
+     }},
     {"session_info", [](const json& value, const std::string& member,
-                        Fault& fault) { fault.sessionInfo = stringMember(value, member); }},
+                        Fault& fault) { return store(stringMember(value, member), fault.sessionInfo); }},
 };
 
 const FaultMember* faultMemberNamed(const std::string& name) {
@@ -118,33 +147,37 @@ const FaultMember* faultMemberNamed(const std::string& name) {
 
 }  // namespace
 
-FaultRule parseFaultRule(const json& document) {
+Result<FaultRule> parseFaultRule(const json& document) {
   if (!document.is_object()) {
-    throw std::invalid_argument("a fault must be a JSON object");
+    return Failure{"a fault must be a JSON object"};
   }
   FaultRule rule;
   bool endpointGiven = false;
   bool faultGiven = false;
   for (const auto& [member, value] : document.items()) {
+    std::optional<Failure> failed;
     if (member == "endpoint") {
-      rule.endpoint = endpointMember(value, member);
+      failed = store(endpointMember(value, member), rule.endpoint);
       endpointGiven = true;
     } else if (member == "remaining") {
-      rule.fault.remaining = integerMember(value, member, 1, INT64_MAX);
+      failed = store(integerMember(value, member, 1, INT64_MAX), rule.fault.remaining);
     } else if (const FaultMember* known = faultMemberNamed(member)) {
-      known->parse(value, member, rule.fault);
+      failed = known->parse(value, member, rule.fault);
       faultGiven = true;
     } else {
-      throw std::invalid_argument("unknown member \"" + member + "\"");
+      failed = Failure{"unknown member \"" + member + "\""};
+    }
+    if (failed) {
+      return std::move(*failed);
     }
   }
   if (!endpointGiven) {
-    invalid("endpoint", "is required");
+    return invalid("endpoint", "is required");
   }
   if (!faultGiven) {
-    throw std::invalid_argument(
+    return Failure{
         "no fault given: set at least one of \"status\", \"delay_ms\", \"body\", "
-        "\"signature\", \"drop\", \"session_validity\", \"session_info\"");
+        "\"signature\", \"drop\", \"session_validity\", \"session_info\""};
   }
   return rule;
 }

@@ -17,6 +17,7 @@
 #include <string>
 
 #include "devserver/endpoint.h"
+#include "platform/values/result.h"
 
 namespace devserver {
 
@@ -41,8 +42,9 @@ struct FaultRule {
 
 inline constexpr std::chrono::milliseconds kLongestFaultDelay{120000};
 
-// Throws std::invalid_argument naming the member that is wrong.
-FaultRule parseFaultRule(const nlohmann::json& document);
+// parseFaultRule returns the rule `document` describes, or a failure naming the member that is
+// wrong (the text the admin interface answers with).
+platform::Result<FaultRule> parseFaultRule(const nlohmann::json& document);
 nlohmann::json faultRuleToJSON(const FaultRule& rule);
 
 class FaultTable {

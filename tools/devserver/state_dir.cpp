@@ -1,20 +1,14 @@
 #include "devserver/state_dir.h"
 
-#include <fcntl.h>
 #include <openssl/err.h>
 #include <openssl/x509.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <cstdio>
-#include <cstring>
-#include <fstream>
 #include <optional>
 #include <sstream>
-#include <stdexcept>
-#include <system_error>
 
+#include "devserver/state_files.h"
 #include "devserver/tls_credentials.h"
 
 namespace devserver {
@@ -26,120 +20,114 @@ namespace {
 constexpr mode_t kPrivateMode = 0600;
 constexpr mode_t kPublicMode = 0644;
 
-std::runtime_error fileError(const fs::path& path, const std::string& what) {
-  return std::runtime_error(path.string() + ": " + what);
+using platform::Failure;
+using platform::Result;
+// The outcome of a step that makes nothing: nullopt when it succeeded, else why it failed.
+using Done = std::optional<Failure>;
+
+// A failure of the certificate tooling, passed on as it is.
+template <typename T>
+Result<T> adopt(TarvexSAPResult<T> made) {
+  if (!made) {
+    return Failure{made.error()};
+  }
+  return *std::move(made);
 }
 
-std::optional<std::string> readFile(const fs::path& path) {
-  std::error_code error;
-  if (!fs::exists(path, error)) {
-    if (error) {
-      throw fileError(path, error.message());
-    }
-    return std::nullopt;
+// What the certificate tooling parsed out of `path`, or a failure naming the file.
+template <typename T>
+Result<T> parsed(const fs::path& path, TarvexSAPResult<T> read) {
+  if (!read) {
+    return fileError(path, "does not parse");
   }
-  std::ifstream in(path, std::ios::binary);
-  std::ostringstream text;
-  text << in.rdbuf();
-  if (!in) {
-    throw fileError(path, "cannot be read");
-  }
-  return std::move(text).str();
+  return *std::move(read);
 }
 
-// Written under a temporary name and renamed, so a reader never sees half a key.
-void writeFileAtomically(const fs::path& path, std::string_view content, mode_t mode) {
-  std::string temporary = path.string() + ".XXXXXX";
-  const int fd = mkstemp(temporary.data());
-  if (fd < 0) {
-    throw fileError(path, std::string("cannot be created: ") + std::strerror(errno));
+// Writes what the certificate tooling encoded (PEM text or DER bytes), or passes its failure on.
+template <typename Bytes>
+Done writeEncoded(const fs::path& path, const TarvexSAPResult<Bytes>& encoded, mode_t mode) {
+  if (!encoded) {
+    return Failure{encoded.error()};
   }
-  int error = fchmod(fd, mode) == 0 ? 0 : errno;
-  for (std::size_t done = 0; error == 0 && done < content.size();) {
-    const ssize_t n = ::write(fd, content.data() + done, content.size() - done);
-    if (n > 0) {
-      done += static_cast<std::size_t>(n);
-    } else if (n == 0 || errno != EINTR) {
-      error = n == 0 ? EIO : errno;
-    }
-  }
-  if (error == 0 && fsync(fd) != 0) {
-    error = errno;
-  }
-  if (::close(fd) != 0 && error == 0) {
-    error = errno;
-  }
-  if (error == 0 && std::rename(temporary.c_str(), path.c_str()) != 0) {
-    error = errno;
-  }
-  if (error != 0) {
-    std::remove(temporary.c_str());
-    throw fileError(path, std::string("cannot be written: ") + std::strerror(error));
-  }
+  return writeFileAtomically(path, std::string_view(reinterpret_cast<const char*>(encoded->data()), encoded->size()),
+                             mode);
 }
 
-std::string bytesAsString(const std::vector<uint8_t>& bytes) { return std::string(bytes.begin(), bytes.end()); }
-
-void requireUnexpired(X509* cert, const fs::path& path) {
-  if (X509_cmp_current_time(X509_get0_notAfter(cert)) <= 0) {
-    throw fileError(path, "the certificate has expired; remove it with its key to make a new one");
+// `cert` read from `certPath` with the key in `keyText`, once they are known to belong together
+// and the certificate to be still valid.
+Result<TarvexSAPCredential> withCheckedKey(TarvexSAPCert cert, const fs::path& certPath, const std::string& keyText,
+                                           const fs::path& keyPath) {
+  Result<TarvexSAPKey> key = parsed(keyPath, TarvexSAPKeyFromPEM(keyText));
+  if (!key) {
+    return Failure{key.error()};
   }
-}
-
-void requireKeyFits(X509* cert, EVP_PKEY* key, const fs::path& certPath, const fs::path& keyPath) {
-  const bool fits = X509_check_private_key(cert, key) == 1;
+  const bool fits = X509_check_private_key(cert.get(), key->get()) == 1;
   ERR_clear_error();
   if (!fits) {
-    throw fileError(keyPath, "is not the key of " + certPath.string());
+    return fileError(keyPath, "is not the key of " + certPath.string());
   }
-}
-
-template <typename Parse>
-auto parseFile(const fs::path& path, const std::string& text, Parse parse) {
-  try {
-    return parse(text);
-  } catch (const std::exception&) {
-    throw fileError(path, "does not parse");
+  if (X509_cmp_current_time(X509_get0_notAfter(cert.get())) <= 0) {
+    return fileError(certPath, "the certificate has expired; remove it with its key to make a new one");
   }
+  return TarvexSAPCredential{std::move(cert), *std::move(key)};
 }
 
 // A PEM certificate with its PEM key, or nullopt when neither file exists.
-std::optional<TarvexSAPCredential> loadCredential(const fs::path& dir, const char* certName, const char* keyName) {
+Result<std::optional<TarvexSAPCredential>> loadCredential(const fs::path& dir, const char* certName,
+                                                          const char* keyName) {
   const fs::path certPath = dir / certName;
   const fs::path keyPath = dir / keyName;
-  const auto certText = readFile(certPath);
-  const auto keyText = readFile(keyPath);
-  if (!certText && !keyText) {
-    return std::nullopt;
+  const Result<std::optional<std::string>> certText = readFile(certPath);
+  if (!certText) {
+    return Failure{certText.error()};
   }
-  if (!certText || !keyText) {
-    const fs::path& missing = certText ? keyPath : certPath;
-    const fs::path& present = certText ? certPath : keyPath;
-    throw fileError(missing,
-                    "is missing while " + present.string() + " exists; restore it, or remove both to make new ones");
+  const Result<std::optional<std::string>> keyText = readFile(keyPath);
+  if (!keyText) {
+    return Failure{keyText.error()};
   }
-  TarvexSAPCredential credential;
-  credential.certificate = parseFile(certPath, *certText, [](const std::string& t) { return TarvexSAPCertFromPEM(t); });
-  credential.key = parseFile(keyPath, *keyText, [](const std::string& t) { return TarvexSAPKeyFromPEM(t); });
-  requireKeyFits(credential.certificate.get(), credential.key.get(), certPath, keyPath);
-  requireUnexpired(credential.certificate.get(), certPath);
-  return credential;
+  if (!*certText && !*keyText) {
+    return std::optional<TarvexSAPCredential>();
+  }
+  if (!*certText || !*keyText) {
+    const fs::path& missing = *certText ? keyPath : certPath;
+    const fs::path& present = *certText ? certPath : keyPath;
+    return fileError(missing,
+                     "is missing while " + present.string() + " exists; restore it, or remove both to make new ones");
+  }
+  Result<TarvexSAPCert> cert = parsed(certPath, TarvexSAPCertFromPEM(**certText));
+  if (!cert) {
+    return Failure{cert.error()};
+  }
+  Result<TarvexSAPCredential> credential = withCheckedKey(*std::move(cert), certPath, **keyText, keyPath);
+  if (!credential) {
+    return Failure{credential.error()};
+  }
+  return std::optional<TarvexSAPCredential>(*std::move(credential));
 }
 
-void storeCredential(const fs::path& dir, const char* certName, const char* keyName,
-                     const TarvexSAPCredential& credential) {
-  writeFileAtomically(dir / keyName, TarvexSAPKeyToPEM(credential.key.get()), kPrivateMode);
-  writeFileAtomically(dir / certName, TarvexSAPCertToPEM(credential.certificate.get()), kPublicMode);
+// A credential just made, once stored as PEM under these names.
+Result<TarvexSAPCredential> stored(Result<TarvexSAPCredential> made, const fs::path& dir, const char* certName,
+                                   const char* keyName) {
+  if (!made) {
+    return made;
+  }
+  if (Done failed = writeEncoded(dir / keyName, TarvexSAPKeyToPEM(made->key.get()), kPrivateMode)) {
+    return *failed;
+  }
+  if (Done failed = writeEncoded(dir / certName, TarvexSAPCertToPEM(made->certificate.get()), kPublicMode)) {
+    return *failed;
+  }
+  return made;
 }
 
-fs::path makeDirectory(const fs::path& requested) {
+Result<fs::path> makeDirectory(const fs::path& requested) {
   if (requested.empty()) {
-    throw std::runtime_error("no state directory given");
+    return Failure{"no state directory given"};
   }
   std::error_code error;
   const fs::path dir = fs::absolute(requested, error).lexically_normal();
   if (error) {
-    throw fileError(requested, error.message());
+    return fileError(requested, error.message());
   }
   if (!fs::exists(dir, error)) {
     fs::create_directories(dir, error);
@@ -147,97 +135,156 @@ fs::path makeDirectory(const fs::path& requested) {
       fs::permissions(dir, fs::perms::owner_all, fs::perm_options::replace, error);
     }
     if (error) {
-      throw fileError(dir, "cannot create the state directory: " + error.message());
+      return fileError(dir, "cannot create the state directory: " + error.message());
     }
   } else if (!fs::is_directory(dir, error)) {
-    throw fileError(dir, "is not a directory");
+    return fileError(dir, "is not a directory");
   }
   for (const char* sub : {"defaults", "entitlements.d"}) {
     fs::create_directory(dir / sub, error);
     if (error) {
-      throw fileError(dir / sub, "cannot create the directory: " + error.message());
+      return fileError(dir / sub, "cannot create the directory: " + error.message());
     }
   }
   return dir;
 }
 
-TarvexSAPCredential prepareTLS(const fs::path& dir) {
-  std::optional<TarvexSAPCredential> authority = loadCredential(dir, "ca.pem", "ca.key");
-  const bool newAuthority = !authority;
-  if (newAuthority) {
-    authority = makeTLSAuthority("zlka-devserver local CA");
-    storeCredential(dir, "ca.pem", "ca.key", *authority);
+Result<TarvexSAPCredential> prepareTLS(const fs::path& dir) {
+  Result<std::optional<TarvexSAPCredential>> kept = loadCredential(dir, "ca.pem", "ca.key");
+  if (!kept) {
+    return Failure{kept.error()};
   }
   // A server certificate of a CA that is gone can never verify again: it is replaced.
-  std::optional<TarvexSAPCredential> server;
-  if (!newAuthority) {
-    server = loadCredential(dir, "server.pem", "server.key");
-    if (server && !issuedBy(server->certificate.get(), *authority)) {
-      throw fileError(dir / "server.pem", "was not issued by " + (dir / "ca.pem").string() +
-                                              "; remove server.pem and server.key to make new ones");
+  if (!*kept) {
+    const Result<TarvexSAPCredential> authority =
+        stored(makeTLSAuthority("zlka-devserver local CA"), dir, "ca.pem", "ca.key");
+    if (!authority) {
+      return Failure{authority.error()};
     }
+    return stored(issueTLSServerCertificate(*authority, "localhost"), dir, "server.pem", "server.key");
   }
+  const TarvexSAPCredential& authority = **kept;
+  Result<std::optional<TarvexSAPCredential>> server = loadCredential(dir, "server.pem", "server.key");
   if (!server) {
-    server = issueTLSServerCertificate(*authority, "localhost");
-    storeCredential(dir, "server.pem", "server.key", *server);
+    return Failure{server.error()};
   }
-  return std::move(*server);
+  if (!*server) {
+    return stored(issueTLSServerCertificate(authority, "localhost"), dir, "server.pem", "server.key");
+  }
+  if (!issuedBy((*server)->certificate.get(), authority)) {
+    return fileError(dir / "server.pem", "was not issued by " + (dir / "ca.pem").string() +
+                                             "; remove server.pem and server.key to make new ones");
+  }
+  return **std::move(server);
+}
+
+// Writes the PEM and the DER form of the setup certificate where asked to.
+Done writeSetupCertificate(const fs::path& pemPath, const fs::path& derPath, X509* cert, bool pem, bool der) {
+  Done failed;
+  if (pem) {
+    failed = writeEncoded(pemPath, TarvexSAPCertToPEM(cert), kPublicMode);
+  }
+  if (der && !failed) {
+    failed = writeEncoded(derPath, TarvexSAPCertToDER(cert), kPublicMode);
+  }
+  return failed;
+}
+
+// The setup certificate's files and what they hold (nullopt: absent).
+struct SetupFiles {
+  fs::path derPath, pemPath, keyPath;
+  std::optional<std::string> der, pem, key;
+};
+
+// The files of a root that had to be made anew are not read (`read` false): they are made anew too.
+Result<SetupFiles> readSetupFiles(const fs::path& dir, bool read) {
+  SetupFiles files{dir / "setup.crt", dir / "setup.pem", dir / "setup.key", {}, {}, {}};
+  for (auto [path, text] :
+       {std::pair{&files.derPath, &files.der}, {&files.pemPath, &files.pem}, {&files.keyPath, &files.key}}) {
+    Result<std::optional<std::string>> content = read ? readFile(*path) : std::optional<std::string>();
+    if (!content) {
+      return Failure{content.error()};
+    }
+    *text = *std::move(content);
+  }
+  return files;
+}
+
+Result<TarvexSAPCredential> makeSetupCertificate(const SetupFiles& files, const TarvexSAPCredential& root) {
+  Result<TarvexSAPCredential> setup = adopt(TarvexSAPIssueSetupCertificate(root, "zlka-devserver setup certificate"));
+  if (!setup) {
+    return setup;
+  }
+  if (Done failed = writeEncoded(files.keyPath, TarvexSAPKeyToPEM(setup->key.get()), kPrivateMode)) {
+    return *failed;
+  }
+  if (Done failed = writeSetupCertificate(files.pemPath, files.derPath, setup->certificate.get(), true, true)) {
+    return *failed;
+  }
+  return setup;
+}
+
+// The certificate in whichever of its two forms exist; where both do, they must agree.
+Result<TarvexSAPCert> existingSetupCertificate(const SetupFiles& files) {
+  TarvexSAPCert certificate;
+  if (files.der) {
+    const auto* bytes = reinterpret_cast<const uint8_t*>(files.der->data());
+    Result<TarvexSAPCert> fromDER = parsed(files.derPath, TarvexSAPCertFromDER(std::span(bytes, files.der->size())));
+    if (!fromDER) {
+      return fromDER;
+    }
+    certificate = *std::move(fromDER);
+  }
+  if (files.pem) {
+    Result<TarvexSAPCert> fromPEM = parsed(files.pemPath, TarvexSAPCertFromPEM(*files.pem));
+    if (!fromPEM) {
+      return fromPEM;
+    }
+    if (certificate && X509_cmp(certificate.get(), fromPEM->get()) != 0) {
+      return fileError(files.pemPath,
+                       "holds another certificate than " + files.derPath.string() + "; remove the one that is wrong");
+    }
+    certificate = *std::move(fromPEM);
+  }
+  return certificate;
 }
 
 // The setup certificate lives in two forms; either one restores the other.
-TarvexSAPCredential prepareSetupCertificate(const fs::path& dir, const TarvexSAPCredential& root, bool newRoot) {
-  const fs::path derPath = dir / "setup.crt";
-  const fs::path pemPath = dir / "setup.pem";
-  const fs::path keyPath = dir / "setup.key";
-  std::optional<std::string> der, pem, key;
-  if (!newRoot) {
-    der = readFile(derPath);
-    pem = readFile(pemPath);
-    key = readFile(keyPath);
+Result<TarvexSAPCredential> prepareSetupCertificate(const fs::path& dir, const TarvexSAPCredential& root,
+                                                    bool newRoot) {
+  const Result<SetupFiles> files = readSetupFiles(dir, !newRoot);
+  if (!files) {
+    return Failure{files.error()};
   }
-  if (!der && !pem && !key) {
-    TarvexSAPCredential setup = TarvexSAPIssueSetupCertificate(root, "zlka-devserver setup certificate");
-    writeFileAtomically(keyPath, TarvexSAPKeyToPEM(setup.key.get()), kPrivateMode);
-    writeFileAtomically(pemPath, TarvexSAPCertToPEM(setup.certificate.get()), kPublicMode);
-    writeFileAtomically(derPath, bytesAsString(TarvexSAPCertToDER(setup.certificate.get())), kPublicMode);
+  if (!files->der && !files->pem && !files->key) {
+    return makeSetupCertificate(*files, root);
+  }
+  if (!files->key) {
+    return fileError(files->keyPath,
+                     "is missing while the setup certificate exists; restore it, or remove "
+                     "setup.crt, setup.pem and setup.key to make new ones");
+  }
+  if (!files->der && !files->pem) {
+    return fileError(files->derPath,
+                     "is missing (and so is setup.pem) while setup.key exists; restore it, or "
+                     "remove setup.key to make new ones");
+  }
+  Result<TarvexSAPCert> certificate = existingSetupCertificate(*files);
+  if (!certificate) {
+    return Failure{certificate.error()};
+  }
+  const fs::path& certPath = files->der ? files->derPath : files->pemPath;
+  Result<TarvexSAPCredential> setup = withCheckedKey(*std::move(certificate), certPath, *files->key, files->keyPath);
+  if (!setup) {
     return setup;
   }
-  if (!key) {
-    throw fileError(keyPath,
-                    "is missing while the setup certificate exists; restore it, or remove "
-                    "setup.crt, setup.pem and setup.key to make new ones");
+  if (!issuedBy(setup->certificate.get(), root)) {
+    return fileError(certPath, "was not issued by " + (dir / "sap-root.pem").string() +
+                                   "; remove setup.crt, setup.pem and setup.key to make new ones");
   }
-  if (!der && !pem) {
-    throw fileError(derPath,
-                    "is missing (and so is setup.pem) while setup.key exists; restore it, or "
-                    "remove setup.key to make new ones");
-  }
-  TarvexSAPCredential setup;
-  if (der) {
-    setup.certificate = parseFile(derPath, *der, [](const std::string& t) {
-      return TarvexSAPCertFromDER(std::span(reinterpret_cast<const uint8_t*>(t.data()), t.size()));
-    });
-  }
-  if (pem) {
-    TarvexSAPCert fromPEM = parseFile(pemPath, *pem, [](const std::string& t) { return TarvexSAPCertFromPEM(t); });
-    if (setup.certificate && X509_cmp(setup.certificate.get(), fromPEM.get()) != 0) {
-      throw fileError(pemPath, "holds another certificate than " + derPath.string() + "; remove the one that is wrong");
-    }
-    setup.certificate = std::move(fromPEM);
-  }
-  setup.key = parseFile(keyPath, *key, [](const std::string& t) { return TarvexSAPKeyFromPEM(t); });
-  const fs::path& certPath = der ? derPath : pemPath;
-  requireKeyFits(setup.certificate.get(), setup.key.get(), certPath, keyPath);
-  requireUnexpired(setup.certificate.get(), certPath);
-  if (!issuedBy(setup.certificate.get(), root)) {
-    throw fileError(certPath, "was not issued by " + (dir / "sap-root.pem").string() +
-                                  "; remove setup.crt, setup.pem and setup.key to make new ones");
-  }
-  if (!der) {
-    writeFileAtomically(derPath, bytesAsString(TarvexSAPCertToDER(setup.certificate.get())), kPublicMode);
-  }
-  if (!pem) {
-    writeFileAtomically(pemPath, TarvexSAPCertToPEM(setup.certificate.get()), kPublicMode);
+  if (Done failed =
+          writeSetupCertificate(files->pemPath, files->derPath, setup->certificate.get(), !files->pem, !files->der)) {
+    return *failed;
   }
   return setup;
 }
@@ -262,19 +309,40 @@ std::string tomlString(std::string_view text) {
 
 }  // namespace
 
-DevServerState prepareStateDirectory(const fs::path& requested) {
+Result<DevServerState> prepareStateDirectory(const fs::path& requested) {
   DevServerState state;
-  state.dir = makeDirectory(requested);
-  state.tls = prepareTLS(state.dir);
-  std::optional<TarvexSAPCredential> root = loadCredential(state.dir, "sap-root.pem", "sap-root.key");
-  const bool newRoot = !root;
-  if (newRoot) {
-    root = TarvexSAPMakeRoot("zlka-devserver SAP root");
-    storeCredential(state.dir, "sap-root.pem", "sap-root.key", *root);
+  const Result<fs::path> dir = makeDirectory(requested);
+  if (!dir) {
+    return Failure{dir.error()};
   }
-  TarvexSAPCredential setup = prepareSetupCertificate(state.dir, *root, newRoot);
-  state.setupCertificateDER = TarvexSAPCertToDER(setup.certificate.get());
-  state.setupKey = std::move(setup.key);
+  state.dir = *dir;
+  Result<TarvexSAPCredential> tls = prepareTLS(state.dir);
+  if (!tls) {
+    return Failure{tls.error()};
+  }
+  state.tls = *std::move(tls);
+  Result<std::optional<TarvexSAPCredential>> kept = loadCredential(state.dir, "sap-root.pem", "sap-root.key");
+  if (!kept) {
+    return Failure{kept.error()};
+  }
+  const bool newRoot = !*kept;
+  const Result<TarvexSAPCredential> root =
+      newRoot ? stored(adopt(TarvexSAPMakeRoot("zlka-devserver SAP root")), state.dir, "sap-root.pem", "sap-root.key")
+              : Result<TarvexSAPCredential>(**std::move(kept));
+  if (!root) {
+    return Failure{root.error()};
+  }
+  Result<TarvexSAPCredential> setup = prepareSetupCertificate(state.dir, *root, newRoot);
+  if (!setup) {
+    return Failure{setup.error()};
+  }
+  TarvexSAPCredential credential = *std::move(setup);
+  Result<std::vector<uint8_t>> der = adopt(TarvexSAPCertToDER(credential.certificate.get()));
+  if (!der) {
+    return Failure{der.error()};
+  }
+  state.setupCertificateDER = *std::move(der);
+  state.setupKey = std::move(credential.key);
   return state;
 }
 
@@ -304,8 +372,8 @@ std::string daemonConfiguration(const fs::path& dir, std::string_view baseURL) {
   return std::move(text).str();
 }
 
-void writeDaemonConfiguration(const fs::path& dir, std::string_view baseURL) {
-  writeFileAtomically(dir / "zlkad.toml", daemonConfiguration(dir, baseURL), kPublicMode);
+Done writeDaemonConfiguration(const fs::path& dir, std::string_view baseURL) {
+  return writeFileAtomically(dir / "zlkad.toml", daemonConfiguration(dir, baseURL), kPublicMode);
 }
 
 }  // namespace devserver

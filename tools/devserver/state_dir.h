@@ -8,15 +8,17 @@
 // that they parse, belong together and have not expired; a certificate whose issuer had to be
 // made anew is made anew too. Private keys are written 0600, every file atomically.
 // writeDaemonConfiguration() writes zlkad.toml, pointing every server environment at `baseURL`.
-// Failures throw std::runtime_error naming the file and what is wrong with it.
+// Both fail naming the file and what is wrong with it.
 #pragma once
 
 #include <cstdint>
 #include <filesystem>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "platform/values/result.h"
 #include "tarvexsap/tarvex_sap_certs.h"
 
 namespace devserver {
@@ -28,10 +30,12 @@ struct DevServerState {
   TarvexSAPKey setupKey;
 };
 
-DevServerState prepareStateDirectory(const std::filesystem::path& dir);
+// prepareStateDirectory returns the state in `dir`, made or completed as above, or a failure.
+platform::Result<DevServerState> prepareStateDirectory(const std::filesystem::path& dir);
 
 // The text of zlkad.toml for a server at `baseURL` keeping its state in `dir` (absolute).
 std::string daemonConfiguration(const std::filesystem::path& dir, std::string_view baseURL);
-void writeDaemonConfiguration(const std::filesystem::path& dir, std::string_view baseURL);
+// writeDaemonConfiguration writes that text to `dir`/zlkad.toml; nullopt on success, else why not.
+std::optional<platform::Failure> writeDaemonConfiguration(const std::filesystem::path& dir, std::string_view baseURL);
 
 }  // namespace devserver
