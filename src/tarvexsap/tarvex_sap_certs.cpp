@@ -14,9 +14,9 @@
 
 namespace {
 
-TarvexSAPFailure failure(const char* what) {
+platform::Failure failure(const char* what) {
   ERR_clear_error();
-  return TarvexSAPFailure{std::string("SAP certificate tooling: ") + what};
+  return platform::Failure{std::string("SAP certificate tooling: ") + what};
 }
 
 struct BioFree {
@@ -28,7 +28,7 @@ struct NameFree {
 };
 using NamePtr = std::unique_ptr<X509_NAME, NameFree>;
 
-TarvexSAPResult<BioPtr> readBio(std::string_view text) {
+platform::Result<BioPtr> readBio(std::string_view text) {
   if (text.size() > static_cast<std::size_t>(std::numeric_limits<int>::max())) {
     return failure("input too large");
   }
@@ -45,7 +45,7 @@ std::string drain(BIO* bio) {
   return std::string(data, static_cast<std::size_t>(len));
 }
 
-std::optional<TarvexSAPFailure> setRandomSerial(X509* cert) {
+std::optional<platform::Failure> setRandomSerial(X509* cert) {
   // 64 positive bits, never zero: unique enough and valid under strict checks.
   std::array<uint8_t, 8> bytes{};
   if (!tsap::randomBytes(bytes)) {
@@ -59,7 +59,7 @@ std::optional<TarvexSAPFailure> setRandomSerial(X509* cert) {
   return std::nullopt;
 }
 
-TarvexSAPResult<NamePtr> nameFor(std::string_view commonName) {
+platform::Result<NamePtr> nameFor(std::string_view commonName) {
   if (commonName.empty()) {
     return failure("empty common name");
   }
@@ -83,8 +83,8 @@ bool addExtension(X509* cert, X509* issuer, int nid, const char* value) {
 }
 
 // Everything but extensions and signature.
-TarvexSAPResult<TarvexSAPCert> newCertificate(std::string_view commonName, const X509_NAME* issuerName,
-                                              EVP_PKEY* subjectKey, const TarvexSAPValidity& validity) {
+platform::Result<TarvexSAPCert> newCertificate(std::string_view commonName, const X509_NAME* issuerName,
+                                               EVP_PKEY* subjectKey, const TarvexSAPValidity& validity) {
   TarvexSAPCert cert(X509_new());
   if (!cert || X509_set_version(cert.get(), X509_VERSION_3) != 1) {
     return failure("X509_new");
@@ -92,9 +92,9 @@ TarvexSAPResult<TarvexSAPCert> newCertificate(std::string_view commonName, const
   if (auto failed = setRandomSerial(cert.get())) {
     return std::move(*failed);
   }
-  TarvexSAPResult<NamePtr> subject = nameFor(commonName);
+  platform::Result<NamePtr> subject = nameFor(commonName);
   if (!subject) {
-    return TarvexSAPFailure{subject.error()};
+    return platform::Failure{subject.error()};
   }
   const bool named = X509_set_subject_name(cert.get(), subject->get()) == 1 &&
                      X509_set_issuer_name(cert.get(), issuerName != nullptr ? issuerName : subject->get()) == 1;
@@ -109,7 +109,7 @@ TarvexSAPResult<TarvexSAPCert> newCertificate(std::string_view commonName, const
   return cert;
 }
 
-TarvexSAPResult<TarvexSAPKey> takeOrGenerate(EVP_PKEY* key) {
+platform::Result<TarvexSAPKey> takeOrGenerate(EVP_PKEY* key) {
   if (key == nullptr) {
     return TarvexSAPGenerateEd25519Key();
   }
@@ -127,17 +127,17 @@ struct Profile {
 };
 
 // A certificate of `subjectKey` (null: a fresh key) issued by `issuer`, or self-signed when it is null.
-TarvexSAPResult<TarvexSAPCredential> certify(std::string_view commonName, const TarvexSAPCredential* issuer,
-                                             EVP_PKEY* subjectKey, const TarvexSAPValidity& validity,
-                                             const Profile& profile) {
-  TarvexSAPResult<TarvexSAPKey> key = takeOrGenerate(subjectKey);
+platform::Result<TarvexSAPCredential> certify(std::string_view commonName, const TarvexSAPCredential* issuer,
+                                              EVP_PKEY* subjectKey, const TarvexSAPValidity& validity,
+                                              const Profile& profile) {
+  platform::Result<TarvexSAPKey> key = takeOrGenerate(subjectKey);
   if (!key) {
-    return TarvexSAPFailure{key.error()};
+    return platform::Failure{key.error()};
   }
   const X509_NAME* issuerName = issuer != nullptr ? X509_get_subject_name(issuer->certificate.get()) : nullptr;
-  TarvexSAPResult<TarvexSAPCert> made = newCertificate(commonName, issuerName, key->get(), validity);
+  platform::Result<TarvexSAPCert> made = newCertificate(commonName, issuerName, key->get(), validity);
   if (!made) {
-    return TarvexSAPFailure{made.error()};
+    return platform::Failure{made.error()};
   }
   X509* cert = made->get();
   X509* issuerCert = issuer != nullptr ? issuer->certificate.get() : cert;
@@ -156,7 +156,7 @@ TarvexSAPResult<TarvexSAPCredential> certify(std::string_view commonName, const 
 
 }  // namespace
 
-TarvexSAPResult<TarvexSAPKey> TarvexSAPGenerateEd25519Key() {
+platform::Result<TarvexSAPKey> TarvexSAPGenerateEd25519Key() {
   TarvexSAPKey key(EVP_PKEY_Q_keygen(nullptr, nullptr, "ED25519"));
   if (!key) {
     return failure("Ed25519 key generation");
@@ -164,7 +164,7 @@ TarvexSAPResult<TarvexSAPKey> TarvexSAPGenerateEd25519Key() {
   return key;
 }
 
-TarvexSAPResult<TarvexSAPKey> TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed) {
+platform::Result<TarvexSAPKey> TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed) {
   TarvexSAPKey key(EVP_PKEY_new_raw_private_key_ex(nullptr, "ED25519", nullptr, seed.data(), seed.size()));
   if (!key) {
     return failure("Ed25519 key from seed");
@@ -172,16 +172,16 @@ TarvexSAPResult<TarvexSAPKey> TarvexSAPEd25519KeyFromSeed(std::span<const uint8_
   return key;
 }
 
-TarvexSAPResult<TarvexSAPCredential> TarvexSAPMakeRoot(std::string_view commonName, const TarvexSAPValidity& validity,
-                                                       EVP_PKEY* key) {
+platform::Result<TarvexSAPCredential> TarvexSAPMakeRoot(std::string_view commonName, const TarvexSAPValidity& validity,
+                                                        EVP_PKEY* key) {
   return certify(commonName, nullptr, key, validity,
                  Profile{"critical,CA:TRUE", "critical,keyCertSign,cRLSign", "root signature"});
 }
 
-TarvexSAPResult<TarvexSAPCredential> TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root,
-                                                                    std::string_view commonName,
-                                                                    const TarvexSAPValidity& validity,
-                                                                    EVP_PKEY* subjectKey) {
+platform::Result<TarvexSAPCredential> TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root,
+                                                                     std::string_view commonName,
+                                                                     const TarvexSAPValidity& validity,
+                                                                     EVP_PKEY* subjectKey) {
   if (!root.certificate || !root.key) {
     return failure("root credential incomplete");
   }
@@ -189,7 +189,7 @@ TarvexSAPResult<TarvexSAPCredential> TarvexSAPIssueSetupCertificate(const Tarvex
                  Profile{"critical,CA:FALSE", "critical,digitalSignature", "setup certificate signature"});
 }
 
-TarvexSAPResult<std::string> TarvexSAPCertToPEM(const X509* cert) {
+platform::Result<std::string> TarvexSAPCertToPEM(const X509* cert) {
   BioPtr bio(BIO_new(BIO_s_mem()));
   if (!bio || cert == nullptr || PEM_write_bio_X509(bio.get(), cert) != 1) {
     return failure("certificate to PEM");
@@ -197,7 +197,7 @@ TarvexSAPResult<std::string> TarvexSAPCertToPEM(const X509* cert) {
   return drain(bio.get());
 }
 
-TarvexSAPResult<std::vector<uint8_t>> TarvexSAPCertToDER(const X509* cert) {
+platform::Result<std::vector<uint8_t>> TarvexSAPCertToDER(const X509* cert) {
   unsigned char* der = nullptr;
   const int len = cert != nullptr ? i2d_X509(cert, &der) : -1;
   if (len <= 0) {
@@ -208,10 +208,10 @@ TarvexSAPResult<std::vector<uint8_t>> TarvexSAPCertToDER(const X509* cert) {
   return out;
 }
 
-TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromPEM(std::string_view pem) {
-  TarvexSAPResult<BioPtr> bio = readBio(pem);
+platform::Result<TarvexSAPCert> TarvexSAPCertFromPEM(std::string_view pem) {
+  platform::Result<BioPtr> bio = readBio(pem);
   if (!bio) {
-    return TarvexSAPFailure{bio.error()};
+    return platform::Failure{bio.error()};
   }
   TarvexSAPCert cert(PEM_read_bio_X509(bio->get(), nullptr, nullptr, nullptr));
   if (!cert) {
@@ -220,7 +220,7 @@ TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromPEM(std::string_view pem) {
   return cert;
 }
 
-TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromDER(std::span<const uint8_t> der) {
+platform::Result<TarvexSAPCert> TarvexSAPCertFromDER(std::span<const uint8_t> der) {
   const unsigned char* p = der.data();
   TarvexSAPCert cert(der.empty() ? nullptr : d2i_X509(nullptr, &p, static_cast<long>(der.size())));
   if (!cert || p != der.data() + der.size()) {
@@ -229,7 +229,7 @@ TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromDER(std::span<const uint8_t> der
   return cert;
 }
 
-TarvexSAPResult<std::string> TarvexSAPKeyToPEM(const EVP_PKEY* key) {
+platform::Result<std::string> TarvexSAPKeyToPEM(const EVP_PKEY* key) {
   BioPtr bio(BIO_new(BIO_s_mem()));
   if (!bio || key == nullptr || PEM_write_bio_PrivateKey(bio.get(), key, nullptr, nullptr, 0, nullptr, nullptr) != 1) {
     return failure("key to PEM");
@@ -237,7 +237,7 @@ TarvexSAPResult<std::string> TarvexSAPKeyToPEM(const EVP_PKEY* key) {
   return drain(bio.get());
 }
 
-TarvexSAPResult<std::vector<uint8_t>> TarvexSAPKeyToDER(const EVP_PKEY* key) {
+platform::Result<std::vector<uint8_t>> TarvexSAPKeyToDER(const EVP_PKEY* key) {
   std::unique_ptr<PKCS8_PRIV_KEY_INFO, decltype(&PKCS8_PRIV_KEY_INFO_free)> p8(
       key != nullptr ? EVP_PKEY2PKCS8(key) : nullptr, &PKCS8_PRIV_KEY_INFO_free);
   unsigned char* der = nullptr;
@@ -250,10 +250,10 @@ TarvexSAPResult<std::vector<uint8_t>> TarvexSAPKeyToDER(const EVP_PKEY* key) {
   return out;
 }
 
-TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromPEM(std::string_view pem) {
-  TarvexSAPResult<BioPtr> bio = readBio(pem);
+platform::Result<TarvexSAPKey> TarvexSAPKeyFromPEM(std::string_view pem) {
+  platform::Result<BioPtr> bio = readBio(pem);
   if (!bio) {
-    return TarvexSAPFailure{bio.error()};
+    return platform::Failure{bio.error()};
   }
   TarvexSAPKey key(PEM_read_bio_PrivateKey(bio->get(), nullptr, nullptr, nullptr));
   if (!key) {
@@ -262,7 +262,7 @@ TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromPEM(std::string_view pem) {
   return key;
 }
 
-TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromDER(std::span<const uint8_t> der) {
+platform::Result<TarvexSAPKey> TarvexSAPKeyFromDER(std::span<const uint8_t> der) {
   const unsigned char* p = der.data();
   TarvexSAPKey key(der.empty() ? nullptr : d2i_AutoPrivateKey(nullptr, &p, static_cast<long>(der.size())));
   if (!key) {

@@ -20,7 +20,7 @@
 #include <string_view>
 #include <vector>
 
-#include "tarvexsap/tarvex_sap_result.h"
+#include "platform/values/result.h"
 
 // The deleters of the owning types below.
 struct TarvexSAPKeyFree {
@@ -46,34 +46,35 @@ struct TarvexSAPCredential {
 };
 
 // TarvexSAPGenerateEd25519Key returns a fresh Ed25519 key, owned by the caller.
-TarvexSAPResult<TarvexSAPKey> TarvexSAPGenerateEd25519Key();
+platform::Result<TarvexSAPKey> TarvexSAPGenerateEd25519Key();
 // TarvexSAPEd25519KeyFromSeed returns the Ed25519 key of 32 raw private bytes, owned by the
 // caller: a fixed seed gives a fixed key.
-TarvexSAPResult<TarvexSAPKey> TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed);
+platform::Result<TarvexSAPKey> TarvexSAPEd25519KeyFromSeed(std::span<const uint8_t, 32> seed);
 
 // TarvexSAPMakeRoot returns a self-signed root named `commonName` (which must not be empty).
 // `key` null: a fresh Ed25519 key; otherwise the root takes a reference to it.
-TarvexSAPResult<TarvexSAPCredential> TarvexSAPMakeRoot(std::string_view commonName,
-                                                       const TarvexSAPValidity& validity = {}, EVP_PKEY* key = nullptr);
+platform::Result<TarvexSAPCredential> TarvexSAPMakeRoot(std::string_view commonName,
+                                                        const TarvexSAPValidity& validity = {},
+                                                        EVP_PKEY* key = nullptr);
 // TarvexSAPIssueSetupCertificate returns a setup certificate issued by `root`, which must hold
 // its key. `subjectKey` null: a fresh Ed25519 key; otherwise its public half is certified and the
 // credential takes a reference to it.
-TarvexSAPResult<TarvexSAPCredential> TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root,
-                                                                    std::string_view commonName,
-                                                                    const TarvexSAPValidity& validity = {},
-                                                                    EVP_PKEY* subjectKey = nullptr);
+platform::Result<TarvexSAPCredential> TarvexSAPIssueSetupCertificate(const TarvexSAPCredential& root,
+                                                                     std::string_view commonName,
+                                                                     const TarvexSAPValidity& validity = {},
+                                                                     EVP_PKEY* subjectKey = nullptr);
 
 // TarvexSAPCertToPEM and TarvexSAPCertToDER encode `cert`, which stays the caller's.
-TarvexSAPResult<std::string> TarvexSAPCertToPEM(const X509* cert);
-TarvexSAPResult<std::vector<uint8_t>> TarvexSAPCertToDER(const X509* cert);
+platform::Result<std::string> TarvexSAPCertToPEM(const X509* cert);
+platform::Result<std::vector<uint8_t>> TarvexSAPCertToDER(const X509* cert);
 // TarvexSAPCertFromPEM and TarvexSAPCertFromDER decode one certificate (the first of a PEM text;
 // the whole of the DER bytes), owned by the caller.
-TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromPEM(std::string_view pem);
-TarvexSAPResult<TarvexSAPCert> TarvexSAPCertFromDER(std::span<const uint8_t> der);
+platform::Result<TarvexSAPCert> TarvexSAPCertFromPEM(std::string_view pem);
+platform::Result<TarvexSAPCert> TarvexSAPCertFromDER(std::span<const uint8_t> der);
 
 // TarvexSAPKeyToPEM and TarvexSAPKeyToDER encode `key` as unencrypted PKCS#8; it stays the caller's.
-TarvexSAPResult<std::string> TarvexSAPKeyToPEM(const EVP_PKEY* key);
-TarvexSAPResult<std::vector<uint8_t>> TarvexSAPKeyToDER(const EVP_PKEY* key);
+platform::Result<std::string> TarvexSAPKeyToPEM(const EVP_PKEY* key);
+platform::Result<std::vector<uint8_t>> TarvexSAPKeyToDER(const EVP_PKEY* key);
 // TarvexSAPKeyFromPEM and TarvexSAPKeyFromDER decode an unencrypted private key, owned by the caller.
-TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromPEM(std::string_view pem);
-TarvexSAPResult<TarvexSAPKey> TarvexSAPKeyFromDER(std::span<const uint8_t> der);
+platform::Result<TarvexSAPKey> TarvexSAPKeyFromPEM(std::string_view pem);
+platform::Result<TarvexSAPKey> TarvexSAPKeyFromDER(std::span<const uint8_t> der);

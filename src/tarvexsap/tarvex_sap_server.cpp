@@ -65,19 +65,19 @@ const char* TarvexSAPServerStatusName(TarvexSAPServerStatus status) {
   return "unknown";
 }
 
-TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
-                                                                          EVP_PKEY* setupKey, Clock clock) {
+platform::Result<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
+                                                                           EVP_PKEY* setupKey, Clock clock) {
   tsap::X509Ptr cert = certificateFromDER(setupCertificateDER);
   if (!cert) {
     ERR_clear_error();
-    return TarvexSAPFailure{"setup certificate is not one DER certificate"};
+    return platform::Failure{"setup certificate is not one DER certificate"};
   }
   if (setupKey == nullptr || EVP_PKEY_get_base_id(setupKey) != EVP_PKEY_ED25519) {
-    return TarvexSAPFailure{"setup key is not an Ed25519 key"};
+    return platform::Failure{"setup key is not an Ed25519 key"};
   }
   if (X509_check_private_key(cert.get(), setupKey) != 1) {
     ERR_clear_error();
-    return TarvexSAPFailure{"setup key does not belong to the setup certificate"};
+    return platform::Failure{"setup key does not belong to the setup certificate"};
   }
   EVP_PKEY_up_ref(setupKey);
   std::unique_ptr<EVP_PKEY, KeyFree> key(setupKey);
@@ -85,8 +85,8 @@ TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::s
       new TarvexSAPServer({setupCertificateDER.begin(), setupCertificateDER.end()}, std::move(key), std::move(clock)));
 }
 
-TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
-                                                                          std::string_view setupKeyPEM, Clock clock) {
+platform::Result<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
+                                                                           std::string_view setupKeyPEM, Clock clock) {
   const std::unique_ptr<EVP_PKEY, KeyFree> key(keyFromPEM(setupKeyPEM));
   return create(setupCertificateDER, key.get(), std::move(clock));
 }

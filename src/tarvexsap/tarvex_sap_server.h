@@ -28,7 +28,7 @@
 #include <unordered_map>
 #include <vector>
 
-#include "tarvexsap/tarvex_sap_result.h"
+#include "platform/values/result.h"
 
 enum class TarvexSAPServerStatus {
   ok,
@@ -64,11 +64,11 @@ class TarvexSAPServer {
   // (copied) and its Ed25519 `setupKey` (the server takes a reference); it fails, saying which,
   // unless the certificate is one DER certificate, the key is Ed25519 and it is the certificate's.
   // A null clock means std::chrono::steady_clock::now.
-  static TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> create(std::span<const uint8_t> setupCertificateDER,
-                                                                  EVP_PKEY* setupKey, Clock clock = nullptr);
+  static platform::Result<std::unique_ptr<TarvexSAPServer>> create(std::span<const uint8_t> setupCertificateDER,
+                                                                   EVP_PKEY* setupKey, Clock clock = nullptr);
   // create with the key as unencrypted PEM text; it fails as above, and when the text holds no key.
-  static TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> create(std::span<const uint8_t> setupCertificateDER,
-                                                                  std::string_view setupKeyPEM, Clock clock = nullptr);
+  static platform::Result<std::unique_ptr<TarvexSAPServer>> create(std::span<const uint8_t> setupCertificateDER,
+                                                                   std::string_view setupKeyPEM, Clock clock = nullptr);
   ~TarvexSAPServer();
   TarvexSAPServer(const TarvexSAPServer&) = delete;
   TarvexSAPServer& operator=(const TarvexSAPServer&) = delete;

@@ -115,7 +115,7 @@ TEST(ServerSetupTest, KeyMustBeTheCertificatesEd25519Key) {
   const TarvexSAPKey other = *TarvexSAPGenerateEd25519Key();
   const TarvexSAPKey ec(EVP_PKEY_Q_keygen(nullptr, nullptr, "EC", "P-256"));
   // clang-format off
-  const std::pair<TarvexSAPResult<std::unique_ptr<TarvexSAPServer>>, const char*> refused[] = {
+  const std::pair<platform::Result<std::unique_ptr<TarvexSAPServer>>, const char*> refused[] = {
       {TarvexSAPServer::create(pki.setupDER, other.get()), "setup key does not belong to the setup certificate"},
       {TarvexSAPServer::create(pki.setupDER, ec.get()), "setup key is not an Ed25519 key"},
       {TarvexSAPServer::create(pki.setupDER, static_cast<EVP_PKEY*>(nullptr)), "setup key is not an Ed25519 key"},

@@ -157,7 +157,7 @@ std::optional<std::string> DevServer::start() {
     return catalog.error();
   }
   d.catalog = *std::move(catalog);
-  TarvexSAPResult<std::unique_ptr<TarvexSAPServer>> sap =
+  platform::Result<std::unique_ptr<TarvexSAPServer>> sap =
       TarvexSAPServer::create(d.state.setupCertificateDER, d.state.setupKey.get());
   if (!sap) {
     return sap.error();

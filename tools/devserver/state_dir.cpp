@@ -25,18 +25,9 @@ using platform::Result;
 // The outcome of a step that makes nothing: nullopt when it succeeded, else why it failed.
 using Done = std::optional<Failure>;
 
-// A failure of the certificate tooling, passed on as it is.
-template <typename T>
-Result<T> adopt(TarvexSAPResult<T> made) {
-  if (!made) {
-    return Failure{made.error()};
-  }
-  return *std::move(made);
-}
-
 // What the certificate tooling parsed out of `path`, or a failure naming the file.
 template <typename T>
-Result<T> parsed(const fs::path& path, TarvexSAPResult<T> read) {
+Result<T> parsed(const fs::path& path, platform::Result<T> read) {
   if (!read) {
     return fileError(path, "does not parse");
   }
@@ -45,7 +36,7 @@ Result<T> parsed(const fs::path& path, TarvexSAPResult<T> read) {
 
 // Writes what the certificate tooling encoded (PEM text or DER bytes), or passes its failure on.
 template <typename Bytes>
-Done writeEncoded(const fs::path& path, const TarvexSAPResult<Bytes>& encoded, mode_t mode) {
+Done writeEncoded(const fs::path& path, const platform::Result<Bytes>& encoded, mode_t mode) {
   if (!encoded) {
     return Failure{encoded.error()};
   }
@@ -211,7 +202,7 @@ Result<SetupFiles> readSetupFiles(const fs::path& dir, bool read) {
 }
 
 Result<TarvexSAPCredential> makeSetupCertificate(const SetupFiles& files, const TarvexSAPCredential& root) {
-  Result<TarvexSAPCredential> setup = adopt(TarvexSAPIssueSetupCertificate(root, "zlka-devserver setup certificate"));
+  Result<TarvexSAPCredential> setup = TarvexSAPIssueSetupCertificate(root, "zlka-devserver setup certificate");
   if (!setup) {
     return setup;
   }
@@ -327,7 +318,7 @@ Result<DevServerState> prepareStateDirectory(const fs::path& requested) {
   }
   const bool newRoot = !*kept;
   const Result<TarvexSAPCredential> root =
-      newRoot ? stored(adopt(TarvexSAPMakeRoot("zlka-devserver SAP root")), state.dir, "sap-root.pem", "sap-root.key")
+      newRoot ? stored(TarvexSAPMakeRoot("zlka-devserver SAP root"), state.dir, "sap-root.pem", "sap-root.key")
               : Result<TarvexSAPCredential>(**std::move(kept));
   if (!root) {
     return Failure{root.error()};
@@ -337,7 +328,7 @@ Result<DevServerState> prepareStateDirectory(const fs::path& requested) {
     return Failure{setup.error()};
   }
   TarvexSAPCredential credential = *std::move(setup);
-  Result<std::vector<uint8_t>> der = adopt(TarvexSAPCertToDER(credential.certificate.get()));
+  Result<std::vector<uint8_t>> der = TarvexSAPCertToDER(credential.certificate.get());
   if (!der) {
     return Failure{der.error()};
   }

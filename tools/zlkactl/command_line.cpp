@@ -33,8 +33,10 @@ std::optional<std::string> given(const CLI::Option* option, const std::string& v
   return std::nullopt;
 }
 
-bool validBus(const std::string& bus) {
-  return bus == "system" || bus == "session" || bus.find(':') != std::string::npos;
+// CLI11's check: empty when `bus` names one, else why not.
+std::string busProblem(const std::string& bus) {
+  if (bus == "system" || bus == "session" || bus.find(':') != std::string::npos) return "";
+  return "must be system, session or a D-Bus address such as unix:path=/run/dbus/system_bus_socket";
 }
 
 platform::Result<platform::Data> tokenData(const Invocation& inv) {
@@ -44,12 +46,14 @@ platform::Result<platform::Data> tokenData(const Invocation& inv) {
   return platform::Failure{"a token (--token-file, --token-hex or --token-base64) is required"};
 }
 
-// What the daemon refuses as InvalidParameter when it is absent, named as the user gives it.
-void requireArguments(const Invocation& inv) {
+// What the daemon refuses as InvalidParameter when it is absent, named as the user gives it;
+// nullopt when nothing is missing.
+std::optional<CLI::RequiredError> missingArgument(const Invocation& inv) {
   if (!inv.tokenFile && !inv.tokenHex && !inv.tokenBase64)
-    throw CLI::RequiredError("A token (--token-file, --token-hex or --token-base64)");
-  if (!inv.uuid) throw CLI::RequiredError("--uuid");
-  if (inv.command == Command::Metadata && !inv.locale) throw CLI::RequiredError("--locale");
+    return CLI::RequiredError("A token (--token-file, --token-hex or --token-base64)");
+  if (!inv.uuid) return CLI::RequiredError("--uuid");
+  if (inv.command == Command::Metadata && !inv.locale) return CLI::RequiredError("--locale");
+  return std::nullopt;
 }
 
 bool jsonRequested(int argc, const char* const* argv) {
@@ -76,6 +80,7 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
   app.set_version_flag("--version", std::string("zlkactl ") + ZLKA_VERSION);
   app.add_option("--bus", inv.bus, "The bus to reach zlkad on: system, session, or a D-Bus address (unix:path=...)")
       ->type_name("BUS")
+      ->check(CLI::Validator(busProblem, "BUS"))
       ->capture_default_str();
   app.add_flag("--json", inv.json, "Print the answer, and any error, as one line of JSON");
   app.add_option("--timeout", inv.timeoutSeconds,
@@ -165,28 +170,31 @@ ParsedCommandLine parseCommandLine(int argc, const char* const* argv, std::ostre
     inv.tokenBase64 = given(t.base64, base64);
     inv.uuid = given(uuidOption, uuid);
   };
-  try {
-    app.parse(argc, argv);
-    if (!validBus(inv.bus))
-      throw CLI::ValidationError(
-          "--bus", "must be system, session or a D-Bus address such as unix:path=/run/dbus/system_bus_socket");
-    if (*metadata) {
-      takeOperation(Command::Metadata, metadataToken, metadataUUID);
-      inv.locale = given(metadataLocale, locale);
-      inv.requestInfo = given(metadataInfo, requestInfo);
-    } else if (*activate) {
-      takeOperation(Command::Activate, activateToken, activateUUID);
-    } else if (*confirm) {
-      takeOperation(Command::Confirm, confirmToken, confirmUUID);
-    }
-    if (*metadata || *activate || *confirm) requireArguments(inv);
-  } catch (const CLI::ParseError& e) {
+  // CLI11 reports what it refuses by throwing; a missing argument is reported the same way.
+  auto refuse = [&](const CLI::ParseError& e) -> ParsedCommandLine {
     if (e.get_exit_code() == 0 || !jsonRequested(argc, argv)) {
       int status = app.exit(e, out, err);
       return {std::nullopt, status == 0 ? kExitSuccess : kExitUsage};
     }
     err << formatError(toolError(kExitUsage, e.what()), true);
     return {std::nullopt, kExitUsage};
+  };
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    return refuse(e);
+  }
+  if (*metadata) {
+    takeOperation(Command::Metadata, metadataToken, metadataUUID);
+    inv.locale = given(metadataLocale, locale);
+    inv.requestInfo = given(metadataInfo, requestInfo);
+  } else if (*activate) {
+    takeOperation(Command::Activate, activateToken, activateUUID);
+  } else if (*confirm) {
+    takeOperation(Command::Confirm, confirmToken, confirmUUID);
+  }
+  if (*metadata || *activate || *confirm) {
+    if (std::optional<CLI::RequiredError> missing = missingArgument(inv)) return refuse(*missing);
   }
 
   if (*read) {
