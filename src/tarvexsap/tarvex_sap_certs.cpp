@@ -45,7 +45,7 @@ std::string drain(BIO* bio) {
   return std::string(data, static_cast<std::size_t>(len));
 }
 
-std::optional<platform::Failure> setRandomSerial(X509* cert) {
+platform::Done setRandomSerial(X509* cert) {
   // 64 positive bits, never zero: unique enough and valid under strict checks.
   std::array<uint8_t, 8> bytes{};
   if (!tsap::randomBytes(bytes)) {

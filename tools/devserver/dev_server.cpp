@@ -190,7 +190,7 @@ std::optional<std::string> DevServer::start() {
     d.markRunning();
   });
   running.wait();
-  if (const std::optional<platform::Failure> failed = writeDaemonConfiguration(d.state.dir, baseURL())) {
+  if (const platform::Done failed = writeDaemonConfiguration(d.state.dir, baseURL())) {
     stop();
     return failed->message;
   }

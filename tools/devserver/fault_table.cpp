@@ -8,6 +8,7 @@ using nlohmann::json;
 
 namespace {
 
+using platform::Done;
 using platform::Failure;
 using platform::Result;
 
@@ -82,7 +83,7 @@ Result<std::optional<Endpoint>> endpointMember(const json& value, const std::str
 
 // Stores a member's value in `slot` when it parsed; the failure otherwise.
 template <typename T, typename Slot>
-std::optional<Failure> store(Result<T> parsed, Slot& slot) {
+Done store(Result<T> parsed, Slot& slot) {
   if (!parsed) {
     return Failure{parsed.error()};
   }
@@ -93,12 +94,12 @@ std::optional<Failure> store(Result<T> parsed, Slot& slot) {
 // The members that describe a fault, each with the parser that stores it (nullopt) or says why not.
 struct FaultMember {
   const char* name;
-  std::optional<Failure> (*parse)(const json& value, const std::string& member, Fault& fault);
+  Done (*parse)(const json& value, const std::string& member, Fault& fault);
 };
 
 const FaultMember kFaultMembers[] = {
     {"status",
-     [](const json& value, const std::string& member, Fault& fault) -> std::optional<Failure> {
+     [](const json& value, const std::string& member, Fault& fault) -> Done {
        const Result<int64_t> status = integerMember(value, member, 200, 599);
        if (!status) {
          return Failure{status.error()};
@@ -107,7 +108,7 @@ const FaultMember kFaultMembers[] = {
        return std::nullopt;
      }},
     {"delay_ms",
-     [](const json& value, const std::string& member, Fault& fault) -> std::optional<Failure> {
+     [](const json& value, const std::string& member, Fault& fault) -> Done {
        const Result<int64_t> ms = integerMember(value, member, 0, INT64_MAX);
        if (!ms) {
          return Failure{ms.error()};
@@ -120,7 +121,7 @@ const FaultMember kFaultMembers[] = {
     {"signature", [](const json& value, const std::string& member,
                      Fault& fault) { return store(signatureMember(value, member), fault.signature); }},
     {"drop",
-     [](const json& value, const std::string& member, Fault& fault) -> std::optional<Failure> {
+     [](const json& value, const std::string& member, Fault& fault) -> Done {
        if (!value.is_boolean()) {
          return invalid(member, "must be true or false");
        }
@@ -128,7 +129,7 @@ const FaultMember kFaultMembers[] = {
        return std::nullopt;
      }},
     {"session_validity",
-     [](const json& value, const std::string&, Fault& fault) -> std::optional<Failure> {
+     [](const json& value, const std::string&, Fault& fault) -> Done {
        fault.sessionValidity = value;
        return std::nullopt;
      }},
@@ -155,7 +156,7 @@ Result<FaultRule> parseFaultRule(const json& document) {
   bool endpointGiven = false;
   bool faultGiven = false;
   for (const auto& [member, value] : document.items()) {
-    std::optional<Failure> failed;
+    Done failed;
     if (member == "endpoint") {
       failed = store(endpointMember(value, member), rule.endpoint);
       endpointGiven = true;

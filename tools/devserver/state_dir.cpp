@@ -20,10 +20,9 @@ namespace {
 constexpr mode_t kPrivateMode = 0600;
 constexpr mode_t kPublicMode = 0644;
 
+using platform::Done;
 using platform::Failure;
 using platform::Result;
-// The outcome of a step that makes nothing: nullopt when it succeeded, else why it failed.
-using Done = std::optional<Failure>;
 
 // What the certificate tooling parsed out of `path`, or a failure naming the file.
 template <typename T>

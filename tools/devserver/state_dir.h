@@ -36,6 +36,6 @@ platform::Result<DevServerState> prepareStateDirectory(const std::filesystem::pa
 // The text of zlkad.toml for a server at `baseURL` keeping its state in `dir` (absolute).
 std::string daemonConfiguration(const std::filesystem::path& dir, std::string_view baseURL);
 // writeDaemonConfiguration writes that text to `dir`/zlkad.toml; nullopt on success, else why not.
-std::optional<platform::Failure> writeDaemonConfiguration(const std::filesystem::path& dir, std::string_view baseURL);
+platform::Done writeDaemonConfiguration(const std::filesystem::path& dir, std::string_view baseURL);
 
 }  // namespace devserver

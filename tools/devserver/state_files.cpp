@@ -36,7 +36,7 @@ platform::Result<std::optional<std::string>> readFile(const fs::path& path) {
   return std::optional<std::string>(std::move(text).str());
 }
 
-std::optional<platform::Failure> writeFileAtomically(const fs::path& path, std::string_view content, mode_t mode) {
+platform::Done writeFileAtomically(const fs::path& path, std::string_view content, mode_t mode) {
   std::string temporary = path.string() + ".XXXXXX";
   const int fd = mkstemp(temporary.data());
   if (fd < 0) {

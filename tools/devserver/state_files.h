@@ -23,7 +23,6 @@ platform::Result<std::optional<std::string>> readFile(const std::filesystem::pat
 // writeFileAtomically replaces `path` with `content`, readable as `mode`, so that a reader sees
 // the old file or the new one, never half of one; nullopt on success, else why it failed (and
 // nothing is left behind).
-std::optional<platform::Failure> writeFileAtomically(const std::filesystem::path& path, std::string_view content,
-                                                     mode_t mode);
+platform::Done writeFileAtomically(const std::filesystem::path& path, std::string_view content, mode_t mode);
 
 }  // namespace devserver

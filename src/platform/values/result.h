@@ -4,6 +4,7 @@
 #pragma once
 
 #include <concepts>
+#include <optional>
 #include <string>
 #include <utility>
 #include <variant>
@@ -14,6 +15,10 @@ namespace platform {
 struct Failure {
   std::string message;
 };
+
+// Done is the outcome of a step that makes nothing: empty when it succeeded, else why it failed;
+// `if (Done failed = step()) return *failed;` passes the failure on into a Result.
+using Done = std::optional<Failure>;
 
 template <class T, class E = std::string>
 class Result {
