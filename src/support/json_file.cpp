@@ -23,5 +23,5 @@ bool writeJSONFile(const std::optional<platform::Value>& object, const std::opti
   platform::Result<std::string> text =
       platform::json::serialize(object ? *object : platform::Value(platform::Dictionary{}), true);
   if (!text) return false;
-  return platform::writeFileAtomically(*path, *text);
+  return !platform::writeFileAtomically(*path, *text);
 }

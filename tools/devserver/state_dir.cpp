@@ -39,8 +39,7 @@ Done writeEncoded(const fs::path& path, const platform::Result<Bytes>& encoded, 
   if (!encoded) {
     return Failure{encoded.error()};
   }
-  return writeFileAtomically(path, std::string_view(reinterpret_cast<const char*>(encoded->data()), encoded->size()),
-                             mode);
+  return writeStateFile(path, std::string_view(reinterpret_cast<const char*>(encoded->data()), encoded->size()), mode);
 }
 
 // `cert` read from `certPath` with the key in `keyText`, once they are known to belong together
@@ -363,7 +362,7 @@ std::string daemonConfiguration(const fs::path& dir, std::string_view baseURL) {
 }
 
 Done writeDaemonConfiguration(const fs::path& dir, std::string_view baseURL) {
-  return writeFileAtomically(dir / "zlkad.toml", daemonConfiguration(dir, baseURL), kPublicMode);
+  return writeStateFile(dir / "zlkad.toml", daemonConfiguration(dir, baseURL), kPublicMode);
 }
 
 }  // namespace devserver

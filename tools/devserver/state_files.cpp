@@ -1,15 +1,10 @@
 #include "devserver/state_files.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstdio>
-#include <cstring>
 #include <fstream>
 #include <sstream>
 #include <system_error>
+
+#include "platform/config/atomic_file.h"
 
 namespace devserver {
 
@@ -36,33 +31,9 @@ platform::Result<std::optional<std::string>> readFile(const fs::path& path) {
   return std::optional<std::string>(std::move(text).str());
 }
 
-platform::Done writeFileAtomically(const fs::path& path, std::string_view content, mode_t mode) {
-  std::string temporary = path.string() + ".XXXXXX";
-  const int fd = mkstemp(temporary.data());
-  if (fd < 0) {
-    return fileError(path, std::string("cannot be created: ") + std::strerror(errno));
-  }
-  int error = fchmod(fd, mode) == 0 ? 0 : errno;
-  for (std::size_t done = 0; error == 0 && done < content.size();) {
-    const ssize_t n = ::write(fd, content.data() + done, content.size() - done);
-    if (n > 0) {
-      done += static_cast<std::size_t>(n);
-    } else if (n == 0 || errno != EINTR) {
-      error = n == 0 ? EIO : errno;
-    }
-  }
-  if (error == 0 && fsync(fd) != 0) {
-    error = errno;
-  }
-  if (::close(fd) != 0 && error == 0) {
-    error = errno;
-  }
-  if (error == 0 && std::rename(temporary.c_str(), path.c_str()) != 0) {
-    error = errno;
-  }
-  if (error != 0) {
-    std::remove(temporary.c_str());
-    return fileError(path, std::string("cannot be written: ") + std::strerror(error));
+platform::Done writeStateFile(const fs::path& path, std::string_view content, mode_t mode) {
+  if (platform::Done failed = platform::writeFileAtomically(path, content, mode)) {
+    return fileError(path, failed->message);
   }
   return std::nullopt;
 }

@@ -20,9 +20,9 @@ platform::Failure fileError(const std::filesystem::path& path, const std::string
 // cannot be read.
 platform::Result<std::optional<std::string>> readFile(const std::filesystem::path& path);
 
-// writeFileAtomically replaces `path` with `content`, readable as `mode`, so that a reader sees
-// the old file or the new one, never half of one; nullopt on success, else why it failed (and
-// nothing is left behind).
-platform::Done writeFileAtomically(const std::filesystem::path& path, std::string_view content, mode_t mode);
+// writeStateFile replaces `path` with `content`, readable as `mode`, so that a reader sees the old
+// file or the new one, never half of one; nullopt on success, else why it failed, naming the file
+// (and nothing is left behind).
+platform::Done writeStateFile(const std::filesystem::path& path, std::string_view content, mode_t mode);
 
 }  // namespace devserver

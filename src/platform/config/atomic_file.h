@@ -8,10 +8,13 @@
 #include <filesystem>
 #include <string_view>
 
+#include "platform/values/result.h"
+
 namespace platform {
 
-// writeFileAtomically replaces the file at `path` with `contents`, with permissions `mode`. It
-// returns false, leaving the old file and no temporary behind, when any step fails.
-bool writeFileAtomically(const std::filesystem::path& path, std::string_view contents, mode_t mode = 0644);
+// writeFileAtomically replaces the file at `path` with `contents`, with permissions `mode`. When a
+// step fails it leaves the old file and no temporary behind and says why ("cannot be written: <errno
+// text>"), to follow the file's name.
+Done writeFileAtomically(const std::filesystem::path& path, std::string_view contents, mode_t mode = 0644);
 
 }  // namespace platform

@@ -87,7 +87,7 @@ bool SettingsStore::modify(const std::function<void(Dictionary&)>& change) {
   Dictionary d = load();
   change(d);
   Result<std::string> text = json::serialize(Value(d), true);
-  return text && writeFileAtomically(path_, *text + "\n");
+  return text && !writeFileAtomically(path_, *text + "\n");
 }
 
 bool SettingsStore::setObject(std::string_view key, const Value& value) {
