@@ -1,11 +1,8 @@
 #include "tarvexsap/tarvex_sap_server.h"
 
-#include <openssl/bio.h>
 #include <openssl/err.h>
-#include <openssl/pem.h>
 
 #include <algorithm>
-#include <limits>
 #include <mutex>
 
 #include "tarvexsap/tsap_crypto.h"
@@ -20,30 +17,6 @@ struct TarvexSAPServer::Association {
   std::mutex windowMutex;
   tsap::ReplayWindow window;  // guarded by windowMutex
 };
-
-namespace {
-
-EVP_PKEY* keyFromPEM(std::string_view pem) {
-  if (pem.size() > static_cast<std::size_t>(std::numeric_limits<int>::max())) {
-    return nullptr;
-  }
-  BIO* bio = BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size()));
-  EVP_PKEY* key = bio != nullptr ? PEM_read_bio_PrivateKey(bio, nullptr, nullptr, nullptr) : nullptr;
-  BIO_free(bio);
-  ERR_clear_error();
-  return key;
-}
-
-tsap::X509Ptr certificateFromDER(std::span<const uint8_t> der) {
-  const unsigned char* p = der.data();
-  tsap::X509Ptr cert(der.empty() ? nullptr : d2i_X509(nullptr, &p, static_cast<long>(der.size())));
-  if (cert && p != der.data() + der.size()) {
-    cert.reset();
-  }
-  return cert;
-}
-
-}  // namespace
 
 const char* TarvexSAPServerStatusName(TarvexSAPServerStatus status) {
   switch (status) {
@@ -67,31 +40,31 @@ const char* TarvexSAPServerStatusName(TarvexSAPServerStatus status) {
 
 platform::Result<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
                                                                            EVP_PKEY* setupKey, Clock clock) {
-  tsap::X509Ptr cert = certificateFromDER(setupCertificateDER);
+  platform::Result<TarvexSAPCert> cert = TarvexSAPCertFromDER(setupCertificateDER);
   if (!cert) {
-    ERR_clear_error();
     return platform::Failure{"setup certificate is not one DER certificate"};
   }
   if (setupKey == nullptr || EVP_PKEY_get_base_id(setupKey) != EVP_PKEY_ED25519) {
     return platform::Failure{"setup key is not an Ed25519 key"};
   }
-  if (X509_check_private_key(cert.get(), setupKey) != 1) {
+  if (X509_check_private_key(cert->get(), setupKey) != 1) {
     ERR_clear_error();
     return platform::Failure{"setup key does not belong to the setup certificate"};
   }
   EVP_PKEY_up_ref(setupKey);
-  std::unique_ptr<EVP_PKEY, KeyFree> key(setupKey);
+  TarvexSAPKey key(setupKey);
   return std::unique_ptr<TarvexSAPServer>(
       new TarvexSAPServer({setupCertificateDER.begin(), setupCertificateDER.end()}, std::move(key), std::move(clock)));
 }
 
 platform::Result<std::unique_ptr<TarvexSAPServer>> TarvexSAPServer::create(std::span<const uint8_t> setupCertificateDER,
                                                                            std::string_view setupKeyPEM, Clock clock) {
-  const std::unique_ptr<EVP_PKEY, KeyFree> key(keyFromPEM(setupKeyPEM));
-  return create(setupCertificateDER, key.get(), std::move(clock));
+  // A text that holds no key is refused as no Ed25519 key.
+  platform::Result<TarvexSAPKey> key = TarvexSAPKeyFromPEM(setupKeyPEM);
+  return create(setupCertificateDER, key ? key->get() : nullptr, std::move(clock));
 }
 
-TarvexSAPServer::TarvexSAPServer(std::vector<uint8_t> certificate, std::unique_ptr<EVP_PKEY, KeyFree> key, Clock clock)
+TarvexSAPServer::TarvexSAPServer(std::vector<uint8_t> certificate, TarvexSAPKey key, Clock clock)
     : certificate_(std::move(certificate)),
       key_(std::move(key)),
       clock_(clock ? std::move(clock) : Clock(&std::chrono::steady_clock::now)) {}

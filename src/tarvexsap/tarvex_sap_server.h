@@ -29,6 +29,7 @@
 #include <vector>
 
 #include "platform/values/result.h"
+#include "tarvexsap/tarvex_sap_certs.h"
 
 enum class TarvexSAPServerStatus {
   ok,
@@ -101,17 +102,13 @@ class TarvexSAPServer {
 
  private:
   struct Association;
-  struct KeyFree {
-    void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
-  };
-
   // Takes the checked certificate and key; cannot fail.
-  TarvexSAPServer(std::vector<uint8_t> certificate, std::unique_ptr<EVP_PKEY, KeyFree> key, Clock clock);
+  TarvexSAPServer(std::vector<uint8_t> certificate, TarvexSAPKey key, Clock clock);
 
   std::shared_ptr<Association> find(std::string_view sessionIdentifier, TarvexSAPServerStatus& status) const;
 
   std::vector<uint8_t> certificate_;
-  std::unique_ptr<EVP_PKEY, KeyFree> key_;
+  TarvexSAPKey key_;
   Clock clock_;
   mutable std::shared_mutex mutex_;
   std::unordered_map<std::string, std::shared_ptr<Association>> associations_;  // guarded by mutex_
